@@ -1,0 +1,250 @@
+#include "core/KelvoAgent.h"
+
+#include "KelvoLog.h"
+#include "utils/TimeProvider.h"
+
+namespace kelvo {
+
+namespace {
+
+// Creation order of the handlers, by id.
+const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
+        HANDLER_SYSTEM, HANDLER_CPU,      HANDLER_DISPLAY, HANDLER_FLASHLIGHT, HANDLER_SENSOR,
+        HANDLER_CAMERA, HANDLER_GNSS,     HANDLER_THERMAL, HANDLER_WIFI,       HANDLER_BATTERY,
+        HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
+};
+
+struct Factories {
+    std::mutex lock;
+    KelvoAgent::OperatorFactory handlers[HANDLER_COUNT] = {};
+    KelvoAgent::OperatorFactory routines[ROUTINE_COUNT] = {};
+};
+
+Factories& factories() {
+    static Factories* f = new Factories();
+    return *f;
+}
+
+std::mutex gInstanceLock;
+android::sp<KelvoAgent>* gInstance = nullptr;
+
+void forwardError(const android::Parcel& data) {
+    android::sp<KelvoAgent> agent;
+    {
+        std::lock_guard<std::mutex> guard(gInstanceLock);
+        if (gInstance != nullptr) {
+            agent = *gInstance;
+        }
+    }
+    if (agent != nullptr) {
+        agent->logError(data);
+    }
+}
+
+} // namespace
+
+android::sp<KelvoAgent> KelvoAgent::getInstance() {
+    std::lock_guard<std::mutex> guard(gInstanceLock);
+    if (gInstance == nullptr) {
+        // Errors raised while the agent is built reach the system log only:
+        // the sink is installed once the agent exists.
+        gInstance = new android::sp<KelvoAgent>(new KelvoAgent());
+        ErrorLogger::setSink(forwardError);
+    }
+    return *gInstance;
+}
+
+void KelvoAgent::setHandlerFactory(int32_t id, OperatorFactory factory) {
+    if (id < 0 || id >= HANDLER_COUNT) {
+        return;
+    }
+    std::lock_guard<std::mutex> guard(factories().lock);
+    factories().handlers[id] = factory;
+}
+
+void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
+    if (id < 0 || id >= ROUTINE_COUNT) {
+        return;
+    }
+    std::lock_guard<std::mutex> guard(factories().lock);
+    factories().routines[id] = factory;
+}
+
+KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {}
+
+android::sp<KelvoOperator> KelvoAgent::getHandler(int32_t id) {
+    if (id < 0 || id >= HANDLER_COUNT) {
+        return nullptr;
+    }
+    std::lock_guard<std::mutex> guard(mSlotLock);
+    return mHandlers[id];
+}
+
+android::sp<KelvoOperator> KelvoAgent::getRoutine(int32_t id) {
+    if (id < 0 || id >= ROUTINE_COUNT) {
+        return nullptr;
+    }
+    std::lock_guard<std::mutex> guard(mSlotLock);
+    return mRoutines[id];
+}
+
+void KelvoAgent::setHandler(int32_t id, const android::sp<KelvoOperator>& op) {
+    std::lock_guard<std::mutex> guard(mSlotLock);
+    mHandlers[id] = op;
+}
+
+void KelvoAgent::setRoutine(int32_t id, const android::sp<KelvoOperator>& op) {
+    std::lock_guard<std::mutex> guard(mSlotLock);
+    mRoutines[id] = op;
+}
+
+int32_t KelvoAgent::initiate() {
+    startHandlers();
+    startRoutines();
+    startStorage();
+    startHidlService();
+    startLibrary();
+    publishService();
+    startBatteryListener();
+    initRoutines();
+    initHandlers();
+    return startDispatcher();
+}
+
+void KelvoAgent::startHandlers() {
+    OperatorFactory made[HANDLER_COUNT];
+    {
+        std::lock_guard<std::mutex> guard(factories().lock);
+        std::copy(std::begin(factories().handlers), std::end(factories().handlers), made);
+    }
+    for (int32_t id : kHandlerCreationOrder) {
+        if (made[id] != nullptr) {
+            setHandler(id, made[id]());
+        }
+    }
+    for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
+        android::sp<KelvoOperator> handler = getHandler(id);
+        if (handler != nullptr && handler->earlyInitialize() < 0) {
+            setHandler(id, nullptr);
+        }
+    }
+}
+
+void KelvoAgent::startRoutines() {
+    OperatorFactory made[ROUTINE_COUNT];
+    {
+        std::lock_guard<std::mutex> guard(factories().lock);
+        std::copy(std::begin(factories().routines), std::end(factories().routines), made);
+    }
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        if (made[id] != nullptr) {
+            setRoutine(id, made[id]());
+        }
+    }
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        android::sp<KelvoOperator> routine = getRoutine(id);
+        if (routine != nullptr && routine->earlyInitialize() < 0) {
+            setRoutine(id, nullptr);
+        }
+    }
+}
+
+void KelvoAgent::startStorage() {
+    // Operators register their tables and the storage thread opens the
+    // database here.
+}
+
+void KelvoAgent::startHidlService() {}
+
+void KelvoAgent::startLibrary() {}
+
+void KelvoAgent::publishService() {}
+
+void KelvoAgent::startBatteryListener() {}
+
+void KelvoAgent::initRoutines() {
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        android::sp<KelvoOperator> routine = getRoutine(id);
+        if (routine != nullptr) {
+            routine->initialize();
+        }
+    }
+}
+
+void KelvoAgent::initHandlers() {
+    for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
+        android::sp<KelvoOperator> handler = getHandler(id);
+        if (handler != nullptr) {
+            handler->initialize();
+        }
+    }
+}
+
+int32_t KelvoAgent::startDispatcher() {
+    return 0;
+}
+
+int32_t KelvoAgent::sendToHandler(int32_t id, int32_t code, const android::Parcel& data,
+                                  android::Parcel* reply, bool sync) {
+    if (id < 0 || id >= HANDLER_COUNT) {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    android::sp<KelvoOperator> handler = getHandler(id);
+    if (handler == nullptr) {
+        return -11;
+    }
+    return handler->sendCustomizedMessage(code, data, reply, sync);
+}
+
+int32_t KelvoAgent::sendToRoutine(int32_t id, int32_t code, const android::Parcel& data,
+                                  android::Parcel* reply, bool sync) {
+    if (id < 0 || id >= ROUTINE_COUNT) {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    android::sp<KelvoOperator> routine = getRoutine(id);
+    if (routine == nullptr) {
+        KLOGE("Invalid routine");
+        return -11;
+    }
+    return routine->sendCustomizedMessage(code, data, reply, sync);
+}
+
+void KelvoAgent::requestQuery(int32_t code, const android::Parcel& data) {}
+
+int32_t KelvoAgent::noteSamplingUpload(const android::String8& a, const android::String8& b) {
+    return -1;
+}
+
+int32_t KelvoAgent::noteRemoteDebug(int32_t kind, const android::String8& text) {
+    return -1;
+}
+
+void KelvoAgent::forceFlushDatabase() {}
+
+void KelvoAgent::logError(const android::Parcel& data) {
+    android::sp<KelvoOperator> system = getHandler(HANDLER_SYSTEM);
+    if (system != nullptr) {
+        system->sendCustomizedMessage(3, data, nullptr, false);
+    }
+}
+
+void KelvoAgent::handleDump(android::String8& out) {
+    for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
+        android::sp<KelvoOperator> handler = getHandler(id);
+        if (handler != nullptr) {
+            handler->dump(out);
+        }
+    }
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        android::sp<KelvoOperator> routine = getRoutine(id);
+        if (routine != nullptr) {
+            routine->dump(out);
+        }
+    }
+}
+
+void KelvoAgent::cleanTables(int64_t time) {}
+
+} // namespace kelvo

@@ -1,0 +1,34 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <atomic>
+
+namespace android {
+class Parcel;
+}
+
+namespace kelvo {
+
+// The database side of error output. Each stored error becomes a parcel of
+// (int64 wall-clock ms, String8 text) handed to the agent, which has the
+// system handler store it. At most kMaxErrorsPerDay are stored between two
+// counter resets (the system handler resets it on the daily tick).
+class ErrorLogger {
+public:
+    static constexpr int32_t kMaxErrorsPerDay = 1000;
+
+    // Where stored errors go; the agent installs itself once it is built.
+    typedef void (*Sink)(const android::Parcel& data);
+
+    static void toDatabase(const char* text);
+    static void setCounter(int32_t n);
+    static int32_t getCounter();
+    static void setSink(Sink sink);
+
+private:
+    static std::atomic<int32_t> sCounter;
+    static std::atomic<Sink> sSink;
+};
+
+} // namespace kelvo

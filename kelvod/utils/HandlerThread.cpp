@@ -1,0 +1,233 @@
+#include "utils/HandlerThread.h"
+
+#include <cerrno>
+#include <chrono>
+#include <climits>
+#include <cstring>
+#include <vector>
+
+#include <utils/Timers.h>
+
+#include "KelvoLog.h"
+
+namespace kelvo {
+
+std::atomic<int64_t> HandlerThread::sSyncTimeoutMs{HandlerThread::kDefaultSyncTimeoutMs};
+
+void HandlerThread::setSyncTimeoutMs(int64_t ms) {
+    sSyncTimeoutMs.store(ms > 0 ? ms : kDefaultSyncTimeoutMs);
+}
+
+HandlerThread::HandlerThread(const char* name, int32_t priority)
+    : android::Thread(), mLastId(0) {
+    if (name == nullptr || name[0] == '\0') {
+        KLOGE("Handler name is empty");
+        return;
+    }
+    mName.setTo(name, strnlen(name, kMaxNameLength));
+    if (priority < -19 || priority > 19) {
+        KLOGE("Invalid priority: %s", mName.string());
+        return;
+    }
+    // The looper and the name exist before the thread runs.
+    mLooper = new android::Looper(false);
+    run(mName.string(), priority);
+}
+
+HandlerThread::~HandlerThread() {
+    KLOGE("%s exit", mName.string());
+}
+
+bool HandlerThread::isAccepting() {
+    return mLooper != nullptr && isRunning() && !exitPending();
+}
+
+int32_t HandlerThread::queueMessage(const ParcelMessage& msg) {
+    std::lock_guard<std::mutex> guard(mMessageLock);
+    int32_t id;
+    do {
+        // Ids run 1, 2, 3 ... and wrap from INT32_MAX to 0; an id that is
+        // still pending is skipped.
+        id = (mLastId < 0 || mLastId == INT32_MAX) ? 0 : mLastId + 1;
+        mLastId = id;
+    } while (mPending.count(id) != 0);
+    mPending.emplace(id, msg);
+    return id;
+}
+
+void HandlerThread::postMessage(int32_t id, nsecs_t when) {
+    mLooper->sendMessageAtTime(when, this, android::Message(id));
+}
+
+int32_t HandlerThread::sendMessage(const ParcelMessage& msg) {
+    return sendMessageAtTime(systemTime(SYSTEM_TIME_MONOTONIC), msg);
+}
+
+int32_t HandlerThread::sendMessageDelayed(nsecs_t delay, const ParcelMessage& msg) {
+    return sendMessageAtTime(systemTime(SYSTEM_TIME_MONOTONIC) + delay, msg);
+}
+
+int32_t HandlerThread::sendMessageAtTime(nsecs_t when, const ParcelMessage& msg) {
+    if (!isAccepting()) {
+        KLOGE("%s is not running or is pending to exit", mName.string());
+        return -2;
+    }
+    int32_t id = queueMessage(msg);
+    postMessage(id, when);
+    return id;
+}
+
+int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
+    if (!isAccepting()) {
+        KLOGE("%s is not running or is pending to exit", mName.string());
+        return -2;
+    }
+    // Queued only: the looper message is posted once the waiter is in place.
+    int32_t id = queueMessage(msg);
+
+    std::unique_lock<std::mutex> lock(mSyncLock);
+    if (mWaiting.count(id) != 0) {
+        KLOGE("Already existed message id[%d] in %s", id, mName.string());
+        std::lock_guard<std::mutex> guard(mMessageLock);
+        mPending.erase(id);
+        return -13;
+    }
+    sync_result waiter;
+    mWaiting.emplace(id, &waiter);
+    postMessage(id, systemTime(SYSTEM_TIME_MONOTONIC));
+
+    using Clock = std::chrono::steady_clock;
+    int64_t timeoutMs = sSyncTimeoutMs.load();
+    Clock::time_point now = Clock::now();
+    Clock::time_point deadline = Clock::time_point::max();
+    if (std::chrono::duration_cast<std::chrono::milliseconds>(Clock::time_point::max() - now)
+                .count() > timeoutMs) {
+        deadline = now + std::chrono::milliseconds(timeoutMs);
+    }
+    // A spurious wake-up goes back to waiting until done or the deadline.
+    bool done = waiter.cond.wait_until(lock, deadline, [&waiter] { return waiter.done; });
+    if (!done) {
+        KLOGE("Failed to send synchronized message to %s: %d, result: %d", mName.string(),
+              ETIMEDOUT, waiter.result);
+    }
+    int32_t result = waiter.result;
+    mWaiting.erase(id);
+    return result;
+}
+
+int32_t HandlerThread::removeMessage(int32_t id) {
+    {
+        std::lock_guard<std::mutex> guard(mMessageLock);
+        if (mPending.erase(id) == 0) {
+            KLOGE("Invalid message id[%d] in %s", id, mName.string());
+            return -4;
+        }
+    }
+    if (mLooper != nullptr) {
+        mLooper->removeMessages(this, id);
+    }
+    releaseWaiters(&id, 1);
+    return 0;
+}
+
+void HandlerThread::removeAllMessages() {
+    if (mLooper != nullptr) {
+        mLooper->removeMessages(this);
+    }
+    std::vector<int32_t> ids;
+    {
+        std::lock_guard<std::mutex> guard(mMessageLock);
+        ids.reserve(mPending.size());
+        for (const auto& entry : mPending) {
+            ids.push_back(entry.first);
+        }
+        mPending.clear();
+    }
+    releaseWaiters(ids.data(), ids.size());
+}
+
+void HandlerThread::releaseWaiters(const int32_t* ids, size_t count) {
+    // A caller waiting for a removed message would otherwise sit out the
+    // whole time-out: it returns at once with -1.
+    std::lock_guard<std::mutex> guard(mSyncLock);
+    if (mWaiting.empty()) {
+        return;
+    }
+    for (size_t i = 0; i < count; ++i) {
+        auto it = mWaiting.find(ids[i]);
+        if (it != mWaiting.end()) {
+            it->second->done = true;
+            it->second->cond.notify_one();
+        }
+    }
+}
+
+void HandlerThread::requestThreadExit() {
+    requestExit();
+    if (mLooper != nullptr) {
+        mLooper->wake();
+    }
+}
+
+void HandlerThread::handleMessage(const android::Message& message) {
+    int32_t id = message.what;
+    std::unordered_map<int32_t, ParcelMessage>::node_type node;
+    {
+        std::lock_guard<std::mutex> guard(mMessageLock);
+        // The entry leaves the table with its body: no copy.
+        node = mPending.extract(id);
+    }
+    if (node.empty()) {
+        KLOGE("Invalid message id[%d] in %s", id, mName.string());
+        return;
+    }
+    ParcelMessage& msg = node.mapped();
+    android::Parcel* callerReply = msg.reply;
+    android::Parcel reply;
+    msg.reply = &reply;
+
+    int32_t status = handleParcelMessage(msg);
+
+    std::lock_guard<std::mutex> guard(mSyncLock);
+    auto it = mWaiting.find(id);
+    if (it == mWaiting.end()) {
+        return; // asynchronous, or the caller gave up waiting
+    }
+    sync_result* waiter = it->second;
+    waiter->result = status;
+    if (callerReply != nullptr && reply.dataSize() > 0) {
+        callerReply->freeData();
+        callerReply->appendFrom(&reply, 0, reply.dataSize());
+        callerReply->setDataPosition(0);
+    }
+    waiter->done = true;
+    waiter->cond.notify_one();
+}
+
+bool HandlerThread::threadLoop() {
+    int result = mLooper->pollOnce(-1);
+    switch (result) {
+        case android::Looper::POLL_CALLBACK:
+            break;
+        case android::Looper::POLL_WAKE:
+            if (exitPending()) {
+                removeAllMessages();
+                KLOGE("%s is pending to exit", mName.string());
+            } else {
+                KLOGD("%s Looper::POLL_WAKE", mName.string());
+            }
+            break;
+        case android::Looper::POLL_TIMEOUT:
+            KLOGD("%s Looper::POLL_TIMEOUT", mName.string());
+            break;
+        case android::Looper::POLL_ERROR:
+            KLOGD("%s Looper::POLL_ERROR", mName.string());
+            break;
+        default:
+            KLOGD("%s Looper::default", mName.string());
+            break;
+    }
+    return true;
+}
+
+} // namespace kelvo

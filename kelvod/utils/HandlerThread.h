@@ -1,0 +1,80 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <atomic>
+#include <condition_variable>
+#include <mutex>
+#include <unordered_map>
+
+#include <utils/Looper.h>
+#include <utils/String8.h>
+#include <utils/Thread.h>
+
+#include "utils/ParcelMessage.h"
+
+namespace kelvo {
+
+// A named worker thread with its own looper. Every message gets an id; its
+// body waits in the pending table until the thread takes it, so the looper
+// message carries nothing but that id. Sends are asynchronous, delayed or
+// synchronous (the caller waits for the handler's status and reply).
+class HandlerThread : public android::Thread, public android::MessageHandler {
+public:
+    // Longest wait of a synchronous send.
+    static constexpr int64_t kDefaultSyncTimeoutMs = 20000;
+    // Names are cut to this many characters.
+    static constexpr size_t kMaxNameLength = 19;
+
+    HandlerThread(const char* name, int32_t priority);
+    ~HandlerThread() override;
+
+    // Each returns the message id (0 or more) or -2 when the thread is not
+    // running or is pending to exit.
+    int32_t sendMessage(const ParcelMessage& msg);
+    int32_t sendMessageDelayed(nsecs_t delay, const ParcelMessage& msg);
+    int32_t sendMessageAtTime(nsecs_t when, const ParcelMessage& msg);
+    // Waits for the handler. Returns its status, -1 on time-out, -13 when the
+    // id is already waited for, -2 when the thread is not running.
+    int32_t sendMessageSync(const ParcelMessage& msg);
+
+    int32_t removeMessage(int32_t id);
+    void removeAllMessages();
+    void requestThreadExit();
+
+    const char* getName() const { return mName.string(); }
+    // True while the thread runs and no exit is pending.
+    bool isAccepting();
+
+    // Shortens the synchronous wait (tests); 0 or less restores the default.
+    static void setSyncTimeoutMs(int64_t ms);
+
+    bool threadLoop() override;
+    void handleMessage(const android::Message& message) override;
+    virtual int32_t handleParcelMessage(const ParcelMessage& msg) = 0;
+
+private:
+    struct sync_result {
+        int32_t result = -1;
+        bool done = false;
+        std::condition_variable cond;
+    };
+
+    int32_t queueMessage(const ParcelMessage& msg);
+    void postMessage(int32_t id, nsecs_t when);
+    void releaseWaiters(const int32_t* ids, size_t count);
+
+    android::String8 mName;
+    android::sp<android::Looper> mLooper;
+
+    std::mutex mMessageLock;
+    int32_t mLastId;
+    std::unordered_map<int32_t, ParcelMessage> mPending;
+
+    std::mutex mSyncLock;
+    std::unordered_map<int32_t, sync_result*> mWaiting;
+
+    static std::atomic<int64_t> sSyncTimeoutMs;
+};
+
+} // namespace kelvo

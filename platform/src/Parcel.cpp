@@ -1,0 +1,428 @@
+#include <binder/Parcel.h>
+
+#include <cstdint>
+#include <cstdlib>
+#include <cstring>
+
+namespace android {
+
+namespace {
+
+// Largest parcel and largest single item, as binder limits them.
+constexpr size_t kMaxSize = INT32_MAX;
+
+inline size_t padSize(size_t s) {
+    return (s + 3) & ~static_cast<size_t>(3);
+}
+
+} // namespace
+
+Parcel::Parcel() : mData(nullptr), mDataSize(0), mDataCapacity(0), mDataPos(0) {}
+
+Parcel::~Parcel() {
+    freeData();
+}
+
+size_t Parcel::dataAvail() const {
+    return mDataPos < mDataSize ? mDataSize - mDataPos : 0;
+}
+
+void Parcel::freeData() {
+    free(mData);
+    mData = nullptr;
+    mDataSize = 0;
+    mDataCapacity = 0;
+    mDataPos = 0;
+}
+
+status_t Parcel::continueWrite(size_t desired) {
+    if (desired > kMaxSize) {
+        return BAD_VALUE;
+    }
+    if (desired == mDataCapacity) {
+        return NO_ERROR;
+    }
+    if (desired == 0) {
+        freeData();
+        return NO_ERROR;
+    }
+    uint8_t* data = static_cast<uint8_t*>(realloc(mData, desired));
+    if (data == nullptr) {
+        return NO_MEMORY;
+    }
+    if (desired > mDataCapacity) {
+        memset(data + mDataCapacity, 0, desired - mDataCapacity);
+    }
+    mData = data;
+    mDataCapacity = desired;
+    if (mDataSize > desired) {
+        mDataSize = desired;
+    }
+    if (mDataPos > desired) {
+        mDataPos = desired;
+    }
+    return NO_ERROR;
+}
+
+status_t Parcel::growData(size_t len) {
+    if (len > kMaxSize || mDataPos > kMaxSize - len) {
+        return BAD_VALUE;
+    }
+    size_t needed = mDataPos + len;
+    if (needed <= mDataCapacity) {
+        return NO_ERROR;
+    }
+    size_t newSize = needed < kMaxSize / 3 ? (needed * 3) / 2 : kMaxSize;
+    if (newSize < 64) {
+        newSize = 64;
+    }
+    return continueWrite(newSize);
+}
+
+status_t Parcel::finishWrite(size_t len) {
+    mDataPos += len;
+    if (mDataPos > mDataSize) {
+        mDataSize = mDataPos;
+    }
+    return NO_ERROR;
+}
+
+status_t Parcel::setDataSize(size_t size) {
+    if (size > kMaxSize) {
+        return BAD_VALUE;
+    }
+    if (size > mDataCapacity) {
+        status_t err = continueWrite(size);
+        if (err != NO_ERROR) {
+            return err;
+        }
+    } else if (size > mDataSize) {
+        memset(mData + mDataSize, 0, size - mDataSize);
+    }
+    mDataSize = size;
+    if (mDataPos > size) {
+        mDataPos = size;
+    }
+    return NO_ERROR;
+}
+
+void Parcel::setDataPosition(size_t pos) const {
+    mDataPos = pos > kMaxSize ? kMaxSize : pos;
+}
+
+status_t Parcel::setDataCapacity(size_t size) {
+    if (size > mDataCapacity) {
+        return continueWrite(size);
+    }
+    return NO_ERROR;
+}
+
+status_t Parcel::setData(const uint8_t* buffer, size_t len) {
+    if (len > kMaxSize || (buffer == nullptr && len != 0)) {
+        return BAD_VALUE;
+    }
+    freeData();
+    if (len == 0) {
+        return NO_ERROR;
+    }
+    status_t err = continueWrite(len);
+    if (err != NO_ERROR) {
+        return err;
+    }
+    memcpy(mData, buffer, len);
+    mDataSize = len;
+    return NO_ERROR;
+}
+
+status_t Parcel::appendFrom(const Parcel* parcel, size_t start, size_t len) {
+    if (parcel == nullptr) {
+        return BAD_VALUE;
+    }
+    if (len == 0) {
+        return NO_ERROR;
+    }
+    if (start > parcel->mDataSize || len > parcel->mDataSize - start) {
+        return BAD_VALUE;
+    }
+    status_t err = growData(len);
+    if (err != NO_ERROR) {
+        return err;
+    }
+    // Read the source only after growing: it may be this very parcel.
+    memmove(mData + mDataPos, parcel->mData + start, len);
+    return finishWrite(len);
+}
+
+void* Parcel::writeInplace(size_t len) {
+    if (len > kMaxSize) {
+        return nullptr;
+    }
+    size_t padded = padSize(len);
+    if (padded < len || growData(padded) != NO_ERROR) {
+        return nullptr;
+    }
+    uint8_t* out = mData + mDataPos;
+    if (padded != len) {
+        memset(out + len, 0, padded - len);
+    }
+    finishWrite(padded);
+    return out;
+}
+
+status_t Parcel::write(const void* data, size_t len) {
+    if (len != 0 && data == nullptr) {
+        return BAD_VALUE;
+    }
+    void* out = writeInplace(len);
+    if (out == nullptr) {
+        return len > kMaxSize ? BAD_VALUE : NO_MEMORY;
+    }
+    if (len != 0) {
+        memcpy(out, data, len);
+    }
+    return NO_ERROR;
+}
+
+template <typename T>
+status_t Parcel::writeAligned(T val) {
+    static_assert(sizeof(T) % 4 == 0, "aligned values only");
+    status_t err = growData(sizeof(T));
+    if (err != NO_ERROR) {
+        return err;
+    }
+    memcpy(mData + mDataPos, &val, sizeof(T));
+    return finishWrite(sizeof(T));
+}
+
+status_t Parcel::writeInt32(int32_t val) { return writeAligned(val); }
+status_t Parcel::writeUint32(uint32_t val) { return writeAligned(val); }
+status_t Parcel::writeInt64(int64_t val) { return writeAligned(val); }
+status_t Parcel::writeUint64(uint64_t val) { return writeAligned(val); }
+status_t Parcel::writeFloat(float val) { return writeAligned(val); }
+status_t Parcel::writeDouble(double val) { return writeAligned(val); }
+status_t Parcel::writeBool(bool val) { return writeInt32(val ? 1 : 0); }
+
+status_t Parcel::writeCString(const char* str) {
+    if (str == nullptr) {
+        return BAD_VALUE;
+    }
+    return write(str, strlen(str) + 1);
+}
+
+status_t Parcel::writeString8(const String8& str) {
+    size_t len = str.size();
+    if (len >= kMaxSize) {
+        return BAD_VALUE;
+    }
+    size_t start = mDataPos;
+    status_t err = writeInt32(static_cast<int32_t>(len));
+    if (err == NO_ERROR) {
+        err = write(str.string(), len + 1);
+    }
+    if (err != NO_ERROR) {
+        mDataPos = start;
+    }
+    return err;
+}
+
+status_t Parcel::writeString16(const String16& str) {
+    return writeString16(str.string(), str.size());
+}
+
+status_t Parcel::writeString16(const char16_t* str, size_t len) {
+    if (str == nullptr) {
+        return writeInt32(-1);
+    }
+    if (len >= kMaxSize / sizeof(char16_t)) {
+        return BAD_VALUE;
+    }
+    size_t start = mDataPos;
+    status_t err = writeInt32(static_cast<int32_t>(len));
+    if (err == NO_ERROR) {
+        size_t bytes = len * sizeof(char16_t);
+        uint8_t* out = static_cast<uint8_t*>(writeInplace(bytes + sizeof(char16_t)));
+        if (out == nullptr) {
+            err = NO_MEMORY;
+        } else {
+            memcpy(out, str, bytes);
+            memset(out + bytes, 0, sizeof(char16_t));
+        }
+    }
+    if (err != NO_ERROR) {
+        mDataPos = start;
+    }
+    return err;
+}
+
+const void* Parcel::readInplace(size_t len) const {
+    if (len > kMaxSize) {
+        return nullptr;
+    }
+    size_t padded = padSize(len);
+    if (mDataPos > mDataSize || padded > mDataSize - mDataPos) {
+        return nullptr;
+    }
+    const void* out = mData + mDataPos;
+    mDataPos += padded;
+    return out;
+}
+
+status_t Parcel::read(void* outData, size_t len) const {
+    if (len > kMaxSize) {
+        return BAD_VALUE;
+    }
+    if (len != 0 && outData == nullptr) {
+        return BAD_VALUE;
+    }
+    const void* in = readInplace(len);
+    if (in == nullptr) {
+        return NOT_ENOUGH_DATA;
+    }
+    if (len != 0) {
+        memcpy(outData, in, len);
+    }
+    return NO_ERROR;
+}
+
+template <typename T>
+status_t Parcel::readAligned(T* pArg) const {
+    if (mDataPos > mDataSize || sizeof(T) > mDataSize - mDataPos) {
+        return NOT_ENOUGH_DATA;
+    }
+    memcpy(pArg, mData + mDataPos, sizeof(T));
+    mDataPos += sizeof(T);
+    return NO_ERROR;
+}
+
+template <typename T>
+T Parcel::readAligned() const {
+    T result{};
+    if (readAligned(&result) != NO_ERROR) {
+        return T{};
+    }
+    return result;
+}
+
+int32_t Parcel::readInt32() const { return readAligned<int32_t>(); }
+status_t Parcel::readInt32(int32_t* pArg) const { return readAligned(pArg); }
+uint32_t Parcel::readUint32() const { return readAligned<uint32_t>(); }
+status_t Parcel::readUint32(uint32_t* pArg) const { return readAligned(pArg); }
+int64_t Parcel::readInt64() const { return readAligned<int64_t>(); }
+status_t Parcel::readInt64(int64_t* pArg) const { return readAligned(pArg); }
+uint64_t Parcel::readUint64() const { return readAligned<uint64_t>(); }
+status_t Parcel::readUint64(uint64_t* pArg) const { return readAligned(pArg); }
+float Parcel::readFloat() const { return readAligned<float>(); }
+status_t Parcel::readFloat(float* pArg) const { return readAligned(pArg); }
+double Parcel::readDouble() const { return readAligned<double>(); }
+status_t Parcel::readDouble(double* pArg) const { return readAligned(pArg); }
+
+bool Parcel::readBool() const {
+    return readInt32() != 0;
+}
+
+status_t Parcel::readBool(bool* pArg) const {
+    int32_t v = 0;
+    status_t err = readInt32(&v);
+    if (err == NO_ERROR && pArg != nullptr) {
+        *pArg = v != 0;
+    }
+    return err;
+}
+
+const char* Parcel::readCString() const {
+    if (mDataPos >= mDataSize) {
+        return nullptr;
+    }
+    const char* str = reinterpret_cast<const char*>(mData + mDataPos);
+    size_t avail = mDataSize - mDataPos;
+    const void* nul = memchr(str, '\0', avail);
+    if (nul == nullptr) {
+        return nullptr;
+    }
+    size_t used = padSize(static_cast<const char*>(nul) - str + 1);
+    mDataPos += used < avail ? used : avail;
+    return str;
+}
+
+status_t Parcel::readString8(String8* pArg) const {
+    size_t start = mDataPos;
+    int32_t size = 0;
+    status_t err = readInt32(&size);
+    if (err != NO_ERROR) {
+        return err;
+    }
+    if (size < 0 || size == INT32_MAX) {
+        mDataPos = start;
+        return BAD_VALUE;
+    }
+    const char* str = static_cast<const char*>(readInplace(static_cast<size_t>(size) + 1));
+    if (str == nullptr || str[size] != '\0') {
+        mDataPos = start;
+        return str == nullptr ? NOT_ENOUGH_DATA : BAD_VALUE;
+    }
+    if (pArg != nullptr) {
+        pArg->setTo(str, static_cast<size_t>(size));
+    }
+    return NO_ERROR;
+}
+
+String8 Parcel::readString8() const {
+    String8 out;
+    if (readString8(&out) != NO_ERROR) {
+        return String8();
+    }
+    return out;
+}
+
+const char16_t* Parcel::readString16Inplace(size_t* outLen) const {
+    if (outLen != nullptr) {
+        *outLen = 0;
+    }
+    size_t start = mDataPos;
+    int32_t size = 0;
+    if (readInt32(&size) != NO_ERROR) {
+        return nullptr;
+    }
+    if (size < 0 || static_cast<size_t>(size) >= kMaxSize / sizeof(char16_t)) {
+        if (size != -1) {
+            mDataPos = start; // malformed length: leave the cursor alone
+        }
+        return nullptr;
+    }
+    const char16_t* str = static_cast<const char16_t*>(
+            readInplace((static_cast<size_t>(size) + 1) * sizeof(char16_t)));
+    if (str == nullptr || str[size] != 0) {
+        mDataPos = start;
+        return nullptr;
+    }
+    if (outLen != nullptr) {
+        *outLen = static_cast<size_t>(size);
+    }
+    return str;
+}
+
+status_t Parcel::readString16(String16* pArg) const {
+    size_t start = mDataPos;
+    size_t len = 0;
+    const char16_t* str = readString16Inplace(&len);
+    if (str == nullptr) {
+        if (pArg != nullptr) {
+            *pArg = String16();
+        }
+        // A null string (-1) moved the cursor past its length; anything else
+        // is malformed or missing.
+        return mDataPos != start ? UNEXPECTED_NULL : NOT_ENOUGH_DATA;
+    }
+    if (pArg != nullptr) {
+        pArg->setTo(str, len);
+    }
+    return NO_ERROR;
+}
+
+String16 Parcel::readString16() const {
+    String16 out;
+    readString16(&out);
+    return out;
+}
+
+} // namespace android

@@ -1,0 +1,39 @@
+#!/usr/bin/env bash
+# Starts the daemon on a private root, checks its banner and thread names,
+# then stops it with SIGTERM and expects a clean exit within 2 seconds.
+set -u
+bin=$1
+root=$(mktemp -d /tmp/kelvo-daemon-XXXXXX)
+log=$root/stderr.log
+trap 'rm -rf "$root"' EXIT
+
+KELVO_ROOT=$root "$bin" 2>"$log" &
+pid=$!
+for _ in $(seq 1 100); do
+    grep -q 'main# Kelvo Daemon' "$log" && break
+    sleep 0.05
+done
+if ! grep -q '\[KelvoMain.cpp\] main# Kelvo Daemon (Version: 000.1.4.0)' "$log"; then
+    echo "FAIL: no banner"; cat "$log"; kill -9 $pid; exit 1
+fi
+sleep 0.3
+names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
+echo "threads: $names"
+for expected in kelvod; do
+    case " $names " in *" $expected "*) ;; *) echo "FAIL: no thread $expected"; kill -9 $pid; exit 1;; esac
+done
+start=$(date +%s%N)
+kill -TERM $pid
+for _ in $(seq 1 40); do
+    kill -0 $pid 2>/dev/null || break
+    sleep 0.05
+done
+if kill -0 $pid 2>/dev/null; then
+    echo "FAIL: still running 2 s after SIGTERM"; kill -9 $pid; exit 1
+fi
+wait $pid
+rc=$?
+elapsed=$(( ($(date +%s%N) - start) / 1000000 ))
+echo "exit status $rc after ${elapsed} ms"
+[ $rc -eq 0 ] || { echo "FAIL: exit status $rc"; cat "$log"; exit 1; }
+echo "PASS"
