@@ -38,6 +38,11 @@ HandlerThread::~HandlerThread() {
     KLOGE("%s exit", mName.string());
 }
 
+void HandlerThread::setLastMessageId(int32_t id) {
+    std::lock_guard<std::mutex> guard(mMessageLock);
+    mLastId = id;
+}
+
 bool HandlerThread::isAccepting() {
     return mLooper != nullptr && isRunning() && !exitPending();
 }
@@ -181,6 +186,11 @@ void HandlerThread::handleMessage(const android::Message& message) {
         KLOGE("Invalid message id[%d] in %s", id, mName.string());
         return;
     }
+    if (exitPending()) {
+        // The thread is going away: what is still queued is dropped.
+        releaseWaiters(&id, 1);
+        return;
+    }
     ParcelMessage& msg = node.mapped();
     android::Parcel* callerReply = msg.reply;
     android::Parcel reply;
@@ -206,16 +216,18 @@ void HandlerThread::handleMessage(const android::Message& message) {
 
 bool HandlerThread::threadLoop() {
     int result = mLooper->pollOnce(-1);
+    if (exitPending()) {
+        // Whatever woke the loop, an exit request drops the queue; the
+        // thread then ends.
+        removeAllMessages();
+        KLOGE("%s is pending to exit", mName.string());
+        return true;
+    }
     switch (result) {
         case android::Looper::POLL_CALLBACK:
             break;
         case android::Looper::POLL_WAKE:
-            if (exitPending()) {
-                removeAllMessages();
-                KLOGE("%s is pending to exit", mName.string());
-            } else {
-                KLOGD("%s Looper::POLL_WAKE", mName.string());
-            }
+            KLOGD("%s Looper::POLL_WAKE", mName.string());
             break;
         case android::Looper::POLL_TIMEOUT:
             KLOGD("%s Looper::POLL_TIMEOUT", mName.string());

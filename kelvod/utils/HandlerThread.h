@@ -46,6 +46,9 @@ public:
     // True while the thread runs and no exit is pending.
     bool isAccepting();
 
+    // Sets the id the next one follows (tests of the wrap-around).
+    void setLastMessageId(int32_t id);
+
     // Shortens the synchronous wait (tests); 0 or less restores the default.
     static void setSyncTimeoutMs(int64_t ms);
 

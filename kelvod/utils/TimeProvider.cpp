@@ -20,8 +20,16 @@ inline int64_t floorDiv(int64_t a, int64_t b) {
     return (a % b != 0 && (a < 0) != (b < 0)) ? q - 1 : q;
 }
 
+// Same result as a - floorDiv(a, b) * b, without its overflow near the ends
+// of the range.
 inline int64_t floorMod(int64_t a, int64_t b) {
-    return a - floorDiv(a, b) * b;
+    int64_t r = a % b;
+    return (r != 0 && (r < 0) != (b < 0)) ? r + b : r;
+}
+
+// floorMod(a + offset, b) without computing a + offset.
+inline int64_t floorModShifted(int64_t a, int64_t offset, int64_t b) {
+    return floorMod(floorMod(a, b) + floorMod(offset, b), b);
 }
 
 } // namespace
@@ -65,30 +73,45 @@ TimeProvider::TimeProvider(int64_t ms)
 }
 
 void TimeProvider::normalise() {
-    mSeconds += floorDiv(mNanoseconds, kNsPerSecond);
+    int64_t carry = floorDiv(mNanoseconds, kNsPerSecond);
     mNanoseconds = floorMod(mNanoseconds, kNsPerSecond);
+    if (__builtin_add_overflow(mSeconds, carry, &mSeconds)) {
+        // Saturate at the ends of the range.
+        mSeconds = carry > 0 ? INT64_MAX : INT64_MIN;
+        mNanoseconds = carry > 0 ? kNsPerSecond - 1 : 0;
+    }
 }
 
 void TimeProvider::computeLocalOffset() {
-    // Local time of midnight UTC of this day; the offset lies within
-    // -11:59 .. +12:59 and stays fixed for the object's life.
-    time_t midnight = static_cast<time_t>(floorDiv(mSeconds, kSecondsPerDay) * kSecondsPerDay);
+    // The zone's offset at midnight UTC of this day; it stays fixed for the
+    // object's life. Taken from the zone itself rather than from the local
+    // time of day, which cannot tell -12:00 from +12:00 and would turn the
+    // +13:00 and +14:00 zones into -11:00 and -10:00.
+    mLocalOffset = 0;
+    int64_t midnight;
+    if (__builtin_sub_overflow(mSeconds, floorMod(mSeconds, kSecondsPerDay), &midnight)) {
+        return; // before any representable day
+    }
+    time_t t = static_cast<time_t>(midnight);
     struct tm local = {};
-    if (localtime_r(&midnight, &local) == nullptr) {
-        mLocalOffset = 0;
+    if (localtime_r(&t, &local) == nullptr) {
         return;
     }
-    int hour = local.tm_hour <= 12 ? local.tm_hour : local.tm_hour - 24;
-    mLocalOffset = (local.tm_min + hour * 60) * 60;
+    mLocalOffset = static_cast<int32_t>(local.tm_gmtoff);
 }
 
 int64_t TimeProvider::getTimeMs() const {
-    return mSeconds * 1000 + mNanoseconds / 1000000;
+    int64_t ms;
+    if (__builtin_mul_overflow(mSeconds, 1000, &ms) ||
+        __builtin_add_overflow(ms, mNanoseconds / 1000000, &ms)) {
+        return mSeconds < 0 ? INT64_MIN : INT64_MAX;
+    }
+    return ms;
 }
 
 int TimeProvider::getHour(bool local) const {
-    int64_t seconds = mSeconds + (local ? mLocalOffset : 0);
-    return static_cast<int>(floorMod(seconds, kSecondsPerDay) / 3600);
+    return static_cast<int>(floorModShifted(mSeconds, local ? mLocalOffset : 0, kSecondsPerDay) /
+                            3600);
 }
 
 int TimeProvider::getHour(int64_t ms, bool local) {
@@ -96,11 +119,11 @@ int TimeProvider::getHour(int64_t ms, bool local) {
 }
 
 int64_t TimeProvider::startOfDay() const {
-    return mSeconds - floorMod(mSeconds + mLocalOffset, kSecondsPerDay);
+    return mSeconds - floorModShifted(mSeconds, mLocalOffset, kSecondsPerDay);
 }
 
 int64_t TimeProvider::startOfHour() const {
-    return mSeconds - floorMod(mSeconds + mLocalOffset, 3600);
+    return mSeconds - floorModShifted(mSeconds, mLocalOffset, 3600);
 }
 
 const char* TimeProvider::toString(int format, bool local) {
@@ -110,26 +133,34 @@ const char* TimeProvider::toString(int format, bool local) {
         ms += 1;
     }
     if (ms >= 1000) {
-        seconds += 1;
-        ms = 0;
+        if (seconds == INT64_MAX) {
+            ms = 999; // the last representable millisecond
+        } else {
+            seconds += 1;
+            ms = 0;
+        }
     }
     mText[0] = '\0';
     if (format == TIME_FORMAT_DURATION) {
         // A negative duration prints as its magnitude with a leading '-'.
+        // The magnitude is unsigned so that the most negative value has one.
         const char* sign = "";
+        uint64_t magnitude = static_cast<uint64_t>(seconds);
         if (seconds < 0) {
             sign = "-";
+            // -(seconds + 1) never overflows.
+            magnitude = static_cast<uint64_t>(-(seconds + 1));
             if (ms > 0) {
-                seconds = -(seconds + 1);
                 ms = 1000 - ms;
             } else {
-                seconds = seconds == INT64_MIN ? INT64_MAX : -seconds;
+                magnitude += 1;
             }
         }
-        snprintf(mText, sizeof(mText), "%s%02" PRId64 "-%02" PRId64 ":%02" PRId64 ":%02" PRId64
+        // Bounded: an absurd duration is cut, never overflows the buffer.
+        snprintf(mText, sizeof(mText), "%s%02" PRIu64 "-%02" PRIu64 ":%02" PRIu64 ":%02" PRIu64
                  ".%03" PRId64,
-                 sign, seconds / kSecondsPerDay, (seconds / 3600) % 24, (seconds / 60) % 60,
-                 seconds % 60, ms);
+                 sign, magnitude / kSecondsPerDay, (magnitude / 3600) % 24, (magnitude / 60) % 60,
+                 magnitude % 60, ms);
         return mText;
     }
     time_t t = static_cast<time_t>(seconds);

@@ -15,6 +15,13 @@ inline size_t padSize(size_t s) {
     return (s + 3) & ~static_cast<size_t>(3);
 }
 
+// True when p points into the size bytes at base.
+bool pointsInto(const void* p, const uint8_t* base, size_t size) {
+    uintptr_t at = reinterpret_cast<uintptr_t>(p);
+    uintptr_t start = reinterpret_cast<uintptr_t>(base);
+    return base != nullptr && at >= start && at - start < size;
+}
+
 } // namespace
 
 Parcel::Parcel() : mData(nullptr), mDataSize(0), mDataCapacity(0), mDataPos(0) {}
@@ -99,6 +106,11 @@ status_t Parcel::setDataSize(size_t size) {
     } else if (size > mDataSize) {
         memset(mData + mDataSize, 0, size - mDataSize);
     }
+    if (size < mDataSize) {
+        // Bytes past the end are kept zero, so that growing the parcel again
+        // or writing beyond its end never brings dropped data back.
+        memset(mData + size, 0, mDataSize - size);
+    }
     mDataSize = size;
     if (mDataPos > size) {
         mDataPos = size;
@@ -121,16 +133,20 @@ status_t Parcel::setData(const uint8_t* buffer, size_t len) {
     if (len > kMaxSize || (buffer == nullptr && len != 0)) {
         return BAD_VALUE;
     }
-    freeData();
     if (len == 0) {
+        freeData();
         return NO_ERROR;
     }
-    status_t err = continueWrite(len);
-    if (err != NO_ERROR) {
-        return err;
+    // Copy before releasing the old buffer: the source may lie inside it.
+    uint8_t* data = static_cast<uint8_t*>(malloc(len));
+    if (data == nullptr) {
+        return NO_MEMORY;
     }
-    memcpy(mData, buffer, len);
+    memcpy(data, buffer, len);
+    freeData();
+    mData = data;
     mDataSize = len;
+    mDataCapacity = len;
     return NO_ERROR;
 }
 
@@ -173,9 +189,24 @@ status_t Parcel::write(const void* data, size_t len) {
     if (len != 0 && data == nullptr) {
         return BAD_VALUE;
     }
+    if (len > kMaxSize) {
+        return BAD_VALUE;
+    }
+    if (len != 0 && pointsInto(data, mData, mDataCapacity)) {
+        // Bytes of this very parcel (a string just read in place, say): the
+        // write may move the buffer under them, so it goes from a copy.
+        void* copy = malloc(len);
+        if (copy == nullptr) {
+            return NO_MEMORY;
+        }
+        memcpy(copy, data, len);
+        status_t err = write(copy, len);
+        free(copy);
+        return err;
+    }
     void* out = writeInplace(len);
     if (out == nullptr) {
-        return len > kMaxSize ? BAD_VALUE : NO_MEMORY;
+        return NO_MEMORY;
     }
     if (len != 0) {
         memcpy(out, data, len);
@@ -235,6 +266,17 @@ status_t Parcel::writeString16(const char16_t* str, size_t len) {
     }
     if (len >= kMaxSize / sizeof(char16_t)) {
         return BAD_VALUE;
+    }
+    if (len != 0 && pointsInto(str, mData, mDataCapacity)) {
+        // Units of this very parcel: write them from a copy, as write() does.
+        char16_t* copy = static_cast<char16_t*>(malloc(len * sizeof(char16_t)));
+        if (copy == nullptr) {
+            return NO_MEMORY;
+        }
+        memcpy(copy, str, len * sizeof(char16_t));
+        status_t err = writeString16(copy, len);
+        free(copy);
+        return err;
     }
     size_t start = mDataPos;
     status_t err = writeInt32(static_cast<int32_t>(len));
@@ -389,9 +431,16 @@ const char16_t* Parcel::readString16Inplace(size_t* outLen) const {
         }
         return nullptr;
     }
-    const char16_t* str = static_cast<const char16_t*>(
+    const uint8_t* units = static_cast<const uint8_t*>(
             readInplace((static_cast<size_t>(size) + 1) * sizeof(char16_t)));
-    if (str == nullptr || str[size] != 0) {
+    // The cursor may sit at any offset: look at the terminator bytewise.
+    char16_t terminator = 1;
+    if (units != nullptr) {
+        memcpy(&terminator, units + static_cast<size_t>(size) * sizeof(char16_t),
+               sizeof(terminator));
+    }
+    const char16_t* str = reinterpret_cast<const char16_t*>(units);
+    if (str == nullptr || terminator != 0) {
         mDataPos = start;
         return nullptr;
     }

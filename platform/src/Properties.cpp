@@ -53,8 +53,11 @@ void loadBuildProp(PropertyStore& s, const std::string& path) {
     if (f == nullptr) {
         return;
     }
-    char line[1024];
-    while (fgets(line, sizeof(line), f) != nullptr) {
+    // Whole lines, however long: a fixed buffer would split an overlong
+    // comment or value and read its tail as a line of its own.
+    char* line = nullptr;
+    size_t lineCapacity = 0;
+    while (getline(&line, &lineCapacity, f) != -1) {
         std::string text = trim(line);
         if (text.empty() || text[0] == '#') {
             continue;
@@ -74,6 +77,7 @@ void loadBuildProp(PropertyStore& s, const std::string& path) {
         }
         s.values[key] = value;
     }
+    free(line);
     fclose(f);
 }
 

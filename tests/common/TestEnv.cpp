@@ -68,33 +68,52 @@ std::string TempRoot::readFile(const std::string& devicePath) const {
 }
 
 LogCapture::LogCapture() {
+    // Installed once and left in place: liblog calls the logger under its own
+    // lock, so swapping loggers while lines are written could deadlock.
+    static bool installed = [] {
+        __android_log_set_logger(&LogCapture::logger);
+        return true;
+    }();
+    (void)installed;
     CaptureState& s = capture();
     std::lock_guard<std::mutex> guard(s.lock);
     s.lines.clear();
-    if (s.active++ == 0) {
-        __android_log_set_logger(&LogCapture::logger);
-    }
+    s.active++;
 }
 
 LogCapture::~LogCapture() {
     CaptureState& s = capture();
     std::lock_guard<std::mutex> guard(s.lock);
-    if (--s.active == 0) {
-        __android_log_set_logger(__android_log_stderr_logger);
-    }
+    s.active--;
 }
 
-void LogCapture::logger(const struct __android_log_message* message) {
+void LogCapture::logger(const struct __android_logger_data* data, const char* message) {
     CaptureState& s = capture();
-    std::lock_guard<std::mutex> guard(s.lock);
-    s.lines.push_back({message->priority, message->tag != nullptr ? message->tag : "",
-                       message->message != nullptr ? message->message : ""});
+    {
+        std::lock_guard<std::mutex> guard(s.lock);
+        if (s.active > 0) {
+            s.lines.push_back({data->priority, data->tag != nullptr ? data->tag : "",
+                               message != nullptr ? message : ""});
+            return;
+        }
+    }
+    __android_log_stderr_logger(data, message);
 }
 
 std::vector<LogLine> LogCapture::lines() const {
     CaptureState& s = capture();
     std::lock_guard<std::mutex> guard(s.lock);
     return s.lines;
+}
+
+std::vector<LogLine> LogCapture::linesWith(const std::string& text) const {
+    std::vector<LogLine> out;
+    for (const LogLine& line : lines()) {
+        if (line.text.find(text) != std::string::npos) {
+            out.push_back(line);
+        }
+    }
+    return out;
 }
 
 size_t LogCapture::count(const std::string& text, int priority) const {

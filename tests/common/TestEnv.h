@@ -38,6 +38,8 @@ public:
     LogCapture();
     ~LogCapture();
     std::vector<LogLine> lines() const;
+    // The captured lines that contain the text (other threads log too).
+    std::vector<LogLine> linesWith(const std::string& text) const;
     // Number of captured lines containing the text (at any priority when
     // priority is 0).
     size_t count(const std::string& text, int priority = 0) const;
@@ -47,7 +49,7 @@ public:
     void clear();
 
 private:
-    static void logger(const struct __android_log_message* message);
+    static void logger(const struct __android_logger_data* data, const char* message);
 };
 
 // Polls the condition until it holds or the time-out passes.

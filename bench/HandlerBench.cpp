@@ -1,0 +1,145 @@
+// Message passing through HandlerThread: asynchronous throughput and the
+// round trip of a synchronous request with a reply.
+
+#include <benchmark/benchmark.h>
+
+#include <algorithm>
+#include <atomic>
+#include <chrono>
+#include <thread>
+#include <vector>
+
+#include <binder/Parcel.h>
+
+#include "utils/HandlerThread.h"
+#include "utils/ParcelMessage.h"
+
+using android::Parcel;
+using kelvo::HandlerThread;
+using kelvo::ParcelMessage;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+// Reads each body, answers synchronous requests with the sequence number plus
+// one, and counts what it handled.
+class CountingThread : public HandlerThread {
+public:
+    CountingThread() : HandlerThread("BenchHandler", 0) {}
+
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        const Parcel& body = msg.getParcel();
+        int32_t seq = body.readInt32();
+        int64_t stamp = body.readInt64();
+        mChecksum += static_cast<uint64_t>(seq) ^ static_cast<uint64_t>(stamp);
+        if (msg.getReply() != nullptr) {
+            msg.getReply()->writeInt32(seq + 1);
+        }
+        mHandled.fetch_add(1, std::memory_order_release);
+        return seq & 0x7fff;
+    }
+
+    uint64_t handled() const { return mHandled.load(std::memory_order_acquire); }
+
+private:
+    std::atomic<uint64_t> mHandled{0};
+    uint64_t mChecksum = 0; // only the handler thread touches it
+};
+
+double median(std::vector<double> values) {
+    std::sort(values.begin(), values.end());
+    size_t n = values.size();
+    return n % 2 == 1 ? values[n / 2] : (values[n / 2 - 1] + values[n / 2]) / 2;
+}
+
+ParcelMessage makeMessage(int32_t seq, Parcel* reply) {
+    Parcel body;
+    body.writeInt32(seq);
+    body.writeInt64(0x5eed0000LL + seq);
+    return ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, 1, body, reply);
+}
+
+// Waits until the thread serves requests: a first synchronous round trip.
+bool warmUp(CountingThread* thread) {
+    Parcel reply;
+    return thread->sendMessageSync(makeMessage(0, &reply)) == 0 && reply.readInt32() == 1;
+}
+
+void stop(const android::sp<CountingThread>& thread) {
+    thread->requestThreadExit();
+    thread->join();
+}
+
+// One sender, one handler thread. At most kWindow messages are in flight:
+// the looper's queue costs grow with its length, and a daemon never holds
+// more than a few hundred.
+void BM_HandlerAsyncThroughput(benchmark::State& state) {
+    constexpr uint64_t kMessages = 100000;
+    constexpr uint64_t kWindow = 256;
+    constexpr int kRounds = 5;
+
+    android::sp<CountingThread> thread = new CountingThread();
+    if (!warmUp(thread.get())) {
+        state.SkipWithError("handler thread did not answer");
+        stop(thread);
+        return;
+    }
+    std::vector<double> rates;
+    for (auto _ : state) {
+        for (int round = 0; round < kRounds; ++round) {
+            uint64_t base = thread->handled();
+            Clock::time_point start = Clock::now();
+            for (uint64_t sent = 0; sent < kMessages; ++sent) {
+                while (sent - (thread->handled() - base) >= kWindow) {
+                    std::this_thread::yield();
+                }
+                if (thread->sendMessage(makeMessage(static_cast<int32_t>(sent), nullptr)) < 0) {
+                    state.SkipWithError("sendMessage failed");
+                    stop(thread);
+                    return;
+                }
+            }
+            while (thread->handled() - base < kMessages) {
+                std::this_thread::yield();
+            }
+            double seconds = std::chrono::duration<double>(Clock::now() - start).count();
+            rates.push_back(kMessages / seconds);
+        }
+    }
+    stop(thread);
+    state.counters["handler_async_msgs_per_s"] = median(rates);
+}
+BENCHMARK(BM_HandlerAsyncThroughput)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
+
+void BM_HandlerSyncRoundTrip(benchmark::State& state) {
+    constexpr int kRoundTrips = 5000;
+
+    android::sp<CountingThread> thread = new CountingThread();
+    if (!warmUp(thread.get())) {
+        state.SkipWithError("handler thread did not answer");
+        stop(thread);
+        return;
+    }
+    std::vector<double> micros;
+    micros.reserve(kRoundTrips);
+    for (auto _ : state) {
+        for (int i = 1; i <= kRoundTrips; ++i) {
+            Parcel reply;
+            ParcelMessage msg = makeMessage(i, &reply);
+            Clock::time_point start = Clock::now();
+            int32_t status = thread->sendMessageSync(msg);
+            Clock::time_point end = Clock::now();
+            if (status != (i & 0x7fff) || reply.readInt32() != i + 1) {
+                state.SkipWithError("wrong status or reply");
+                stop(thread);
+                return;
+            }
+            micros.push_back(std::chrono::duration<double, std::micro>(end - start).count());
+        }
+    }
+    stop(thread);
+    state.counters["handler_sync_roundtrip_us_p50"] = median(micros);
+}
+BENCHMARK(BM_HandlerSyncRoundTrip)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
+
+} // namespace

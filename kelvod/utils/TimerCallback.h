@@ -1,0 +1,29 @@
+#pragma once
+
+#include <stdint.h>
+#include <utils/Looper.h>
+#include <utils/StrongPointer.h>
+
+#include "utils/HandlerThread.h"
+
+namespace kelvo {
+
+// Turns expiries of one timer into MESSAGE_TIMER messages (what = timer id,
+// empty body) for the thread that owns the timer. Runs on the TimerManager
+// thread; several expiries seen by one read become one message.
+class TimerCallback : public android::LooperCallback {
+public:
+    TimerCallback(const android::sp<HandlerThread>& target, int32_t id);
+
+    const android::sp<HandlerThread>& getTarget() const { return mTarget; }
+    int32_t getId() const { return mId; }
+
+    // 1 keeps the descriptor watched, 0 drops it from the looper.
+    int handleEvent(int fd, int events, void* data) override;
+
+private:
+    android::sp<HandlerThread> mTarget;
+    int32_t mId;
+};
+
+} // namespace kelvo

@@ -1,0 +1,208 @@
+#include <gtest/gtest.h>
+
+#include <atomic>
+#include <mutex>
+#include <thread>
+#include <string>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "core/KelvoAgent.h"
+
+using android::Parcel;
+using android::sp;
+using android::String8;
+using kelvo::KelvoAgent;
+using kelvo::KelvoOperator;
+using kelvo::test::LogCapture;
+using kelvo::test::waitFor;
+
+namespace {
+
+std::mutex gEventsLock;
+std::vector<std::string> gEvents;
+
+void record(const std::string& event) {
+    std::lock_guard<std::mutex> guard(gEventsLock);
+    gEvents.push_back(event);
+}
+
+std::vector<std::string> events() {
+    std::lock_guard<std::mutex> guard(gEventsLock);
+    return gEvents;
+}
+
+// An operator that records its start-up steps and answers requests: code 1
+// replies with its name, code 3 (an error row) is recorded with its text.
+class FakeOperator : public KelvoOperator {
+public:
+    FakeOperator(const char* name, bool enabled)
+        : KelvoOperator(name, -1, 0), mEnabled(enabled) {
+        record(std::string("create ") + name);
+    }
+    int32_t checkEnable() override { return mEnabled ? 0 : -1; }
+    int32_t lateInitialize() override {
+        record(std::string("init ") + getName());
+        return 0;
+    }
+    void dump(String8& out) override { out.appendFormat("%s;", getName()); }
+    int32_t handleCustomized(int32_t code, const Parcel& data, Parcel* reply) override {
+        if (code == 1) {
+            reply->writeString8(String8(getName()));
+            return 11;
+        }
+        if (code == 3) {
+            data.readInt64();
+            record(std::string("error ") + data.readString8().string());
+        }
+        return 0;
+    }
+
+private:
+    bool mEnabled;
+};
+
+template <int N>
+sp<KelvoOperator> makeHandler() {
+    static const std::string name = "FakeHandler" + std::to_string(N);
+    // Handler 1 (the CPU handler's slot) reports its component unsupported.
+    return new FakeOperator(name.c_str(), N != 1);
+}
+
+template <int N>
+sp<KelvoOperator> makeRoutine() {
+    static const std::string name = "FakeRoutine" + std::to_string(N);
+    return new FakeOperator(name.c_str(), true);
+}
+
+class KelvoAgentTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        std::lock_guard<std::mutex> guard(gEventsLock);
+        gEvents.clear();
+    }
+    void TearDown() override {
+        for (int i = 0; i < kelvo::HANDLER_COUNT; ++i) KelvoAgent::setHandlerFactory(i, nullptr);
+        for (int i = 0; i < kelvo::ROUTINE_COUNT; ++i) KelvoAgent::setRoutineFactory(i, nullptr);
+    }
+    void installAll() {
+        KelvoAgent::OperatorFactory handlers[] = {
+                makeHandler<0>, makeHandler<1>,  makeHandler<2>,  makeHandler<3>,
+                makeHandler<4>, makeHandler<5>,  makeHandler<6>,  makeHandler<7>,
+                makeHandler<8>, makeHandler<9>,  makeHandler<10>, makeHandler<11>,
+                makeHandler<12>, makeHandler<13>, makeHandler<14>};
+        for (int i = 0; i < kelvo::HANDLER_COUNT; ++i) {
+            KelvoAgent::setHandlerFactory(i, handlers[i]);
+        }
+        KelvoAgent::setRoutineFactory(0, makeRoutine<0>);
+        KelvoAgent::setRoutineFactory(1, makeRoutine<1>);
+        KelvoAgent::setRoutineFactory(2, makeRoutine<2>);
+    }
+};
+
+} // namespace
+
+TEST_F(KelvoAgentTest, StartsOperatorsInOrderAndDropsUnsupportedOnes) {
+    installAll();
+    sp<KelvoAgent> agent = new KelvoAgent();
+    LogCapture log;
+    EXPECT_EQ(0, agent->initiate());
+
+    std::vector<std::string> expected;
+    for (int id : {0, 1, 2, 3, 7, 4, 5, 6, 8, 9, 10, 11, 12, 13, 14}) {
+        expected.push_back("create FakeHandler" + std::to_string(id));
+    }
+    for (int id : {0, 1, 2}) expected.push_back("create FakeRoutine" + std::to_string(id));
+    // Routines are initialized before handlers.
+    for (int id : {0, 1, 2}) expected.push_back("init FakeRoutine" + std::to_string(id));
+    for (int id = 0; id < kelvo::HANDLER_COUNT; ++id) {
+        if (id != 1) expected.push_back("init FakeHandler" + std::to_string(id));
+    }
+    EXPECT_EQ(expected, events());
+
+    EXPECT_TRUE(log.contains("earlyInitialize# Check support failed, disable module: -1",
+                             ANDROID_LOG_ERROR));
+    EXPECT_EQ(nullptr, agent->getHandler(1));
+    Parcel reply;
+    EXPECT_EQ(-11, agent->sendToHandler(1, 1, Parcel(), &reply, true));
+
+    String8 dump;
+    agent->handleDump(dump);
+    EXPECT_STREQ("FakeHandler0;FakeHandler2;FakeHandler3;FakeHandler4;FakeHandler5;FakeHandler6;"
+                 "FakeHandler7;FakeHandler8;FakeHandler9;FakeHandler10;FakeHandler11;"
+                 "FakeHandler12;FakeHandler13;FakeHandler14;FakeRoutine0;FakeRoutine1;"
+                 "FakeRoutine2;",
+                 dump.string());
+    for (int id = 0; id < kelvo::HANDLER_COUNT; ++id) {
+        if (agent->getHandler(id) != nullptr) agent->getHandler(id)->requestThreadExit();
+    }
+    for (int id = 0; id < kelvo::ROUTINE_COUNT; ++id) agent->getRoutine(id)->requestThreadExit();
+}
+
+TEST_F(KelvoAgentTest, RoutesRequestsByIdAndRefusesBadIds) {
+    KelvoAgent::setHandlerFactory(5, makeHandler<5>);
+    KelvoAgent::setRoutineFactory(1, makeRoutine<1>);
+    sp<KelvoAgent> agent = new KelvoAgent();
+    agent->initiate();
+
+    Parcel reply;
+    EXPECT_EQ(11, agent->sendToHandler(5, 1, Parcel(), &reply, true));
+    EXPECT_STREQ("FakeHandler5", reply.readString8().string());
+    Parcel routineReply;
+    EXPECT_EQ(11, agent->sendToRoutine(1, 1, Parcel(), &routineReply, true));
+    EXPECT_STREQ("FakeRoutine1", routineReply.readString8().string());
+    // Asynchronous: a message id.
+    EXPECT_GE(agent->sendToHandler(5, 2, Parcel(), nullptr, false), 0);
+    // Synchronous without a reply parcel.
+    EXPECT_EQ(-5, agent->sendToHandler(5, 1, Parcel(), nullptr, true));
+
+    LogCapture log;
+    EXPECT_EQ(-5, agent->sendToHandler(15, 1, Parcel(), &reply, true));
+    EXPECT_EQ(-5, agent->sendToHandler(-1, 1, Parcel(), &reply, true));
+    EXPECT_EQ(-5, agent->sendToRoutine(3, 1, Parcel(), &reply, true));
+    EXPECT_EQ(3u, log.count("Invalid parameter", ANDROID_LOG_ERROR));
+    // An empty handler slot answers quietly, an empty routine slot does not.
+    log.clear();
+    EXPECT_EQ(-11, agent->sendToHandler(4, 1, Parcel(), &reply, true));
+    EXPECT_EQ(0u, log.linesWith("[KelvoAgent.cpp]").size());
+    EXPECT_EQ(-11, agent->sendToRoutine(0, 1, Parcel(), &reply, true));
+    EXPECT_TRUE(log.contains("sendToRoutine# Invalid routine", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-1, agent->noteSamplingUpload(String8("a"), String8("b")));
+
+    agent->getHandler(5)->requestThreadExit();
+    agent->getRoutine(1)->requestThreadExit();
+}
+
+TEST_F(KelvoAgentTest, ErrorLinesReachTheSystemHandlerWhileStartUpRuns) {
+    KelvoAgent::setHandlerFactory(0, makeHandler<0>);
+    sp<KelvoAgent> agent = new KelvoAgent();
+    // Errors are forwarded from other threads while the slots are written.
+    std::atomic<bool> stop{false};
+    std::thread noisy([&] {
+        while (!stop.load()) {
+            Parcel row;
+            row.writeInt64(1);
+            row.writeString8(String8("noise"));
+            row.setDataPosition(0);
+            agent->logError(row);
+            std::this_thread::yield();
+        }
+    });
+    agent->initiate();
+    stop = true;
+    noisy.join();
+
+    Parcel row;
+    row.writeInt64(123);
+    row.writeString8(String8("[X.cpp] f# stored error"));
+    row.setDataPosition(0);
+    agent->logError(row);
+    EXPECT_TRUE(waitFor([] {
+        for (const std::string& e : events()) {
+            if (e == "error [X.cpp] f# stored error") return true;
+        }
+        return false;
+    }));
+    agent->getHandler(0)->requestThreadExit();
+}

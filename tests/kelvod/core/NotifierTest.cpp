@@ -1,0 +1,168 @@
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "common/TestEnv.h"
+#include "core/Notifier.h"
+#include "utils/HandlerThread.h"
+
+using android::Parcel;
+using android::sp;
+using kelvo::HandlerThread;
+using kelvo::Notifier;
+using kelvo::NotifierListener;
+using kelvo::ParcelMessage;
+using kelvo::test::LogCapture;
+using kelvo::test::waitFor;
+
+namespace {
+
+struct Got {
+    int32_t type;
+    int32_t what;
+    int64_t time;
+};
+
+class ListeningThread : public HandlerThread {
+public:
+    explicit ListeningThread(const char* name) : HandlerThread(name, 11) {}
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.push_back({msg.type, msg.what, msg.getParcel().readInt64()});
+        return 0;
+    }
+    std::vector<Got> got() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mGot;
+    }
+
+private:
+    std::mutex mLock;
+    std::vector<Got> mGot;
+};
+
+int32_t notify(Notifier* notifier, int32_t type, int64_t t) {
+    Parcel body;
+    body.writeInt64(t);
+    return notifier->sendNotification(type, body);
+}
+
+// Sends a marker of a type only the marker thread listens for, and waits
+// until it arrived: everything sent before it has been fanned out by then.
+void drain(Notifier* notifier) {
+    static sp<ListeningThread> marker = new ListeningThread("NotifyMarker");
+    static NotifierListener* listener = new NotifierListener(marker);
+    static bool registered = notifier->registerListener(kelvo::NOTIFICATION_DIFF_DAY_REBOOT,
+                                                        listener) == 0;
+    ASSERT_TRUE(registered);
+    size_t before = marker->got().size();
+    notify(notifier, kelvo::NOTIFICATION_DIFF_DAY_REBOOT, -1);
+    ASSERT_TRUE(waitFor([&] { return marker->got().size() > before; }));
+    // Give the listeners a moment to take what was posted before the marker.
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+}
+
+} // namespace
+
+TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
+    Notifier* notifier = Notifier::getInstance();
+    sp<ListeningThread> a = new ListeningThread("ListenerA");
+    sp<ListeningThread> b = new ListeningThread("ListenerB");
+    NotifierListener la(a);
+    NotifierListener lb(b);
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &la));
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &lb));
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_HOURLY_TICK, &la));
+
+    for (int64_t t = 1; t <= 5; ++t) {
+        EXPECT_GE(notify(notifier, kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, t),
+                  0);
+    }
+    notify(notifier, kelvo::NOTIFICATION_HOURLY_TICK, 100);
+    drain(notifier);
+    ASSERT_TRUE(waitFor([&] { return a->got().size() == 6 && b->got().size() == 5; }));
+
+    std::vector<Got> gotA = a->got();
+    for (int i = 0; i < 5; ++i) {
+        EXPECT_EQ(kelvo::MESSAGE_NOTIFICATION, gotA[i].type);
+        EXPECT_EQ(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, gotA[i].what);
+        EXPECT_EQ(i + 1, gotA[i].time);
+        EXPECT_EQ(i + 1, b->got()[i].time);
+    }
+    EXPECT_EQ(kelvo::NOTIFICATION_HOURLY_TICK, gotA[5].what);
+    EXPECT_EQ(100, gotA[5].time);
+
+    // After unregistering, nothing more arrives.
+    notifier->unregisterListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &la);
+    notifier->unregisterListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &lb);
+    notifier->unregisterListener(kelvo::NOTIFICATION_HOURLY_TICK, &la);
+    notify(notifier, kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, 9);
+    drain(notifier);
+    EXPECT_EQ(6u, a->got().size());
+    EXPECT_EQ(5u, b->got().size());
+    a->requestThreadExit();
+    b->requestThreadExit();
+}
+
+TEST(NotifierTest, DuplicateRegistrationIsRefusedAndDeliversOnce) {
+    Notifier* notifier = Notifier::getInstance();
+    sp<ListeningThread> a = new ListeningThread("ListenerDup");
+    NotifierListener la(a);
+    LogCapture log;
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_HOURLY_TICK, &la));
+    EXPECT_EQ(-13, notifier->registerListener(kelvo::NOTIFICATION_HOURLY_TICK, &la));
+    EXPECT_TRUE(log.contains("This listener has already been registered for type(8)",
+                             ANDROID_LOG_INFO));
+    notify(notifier, kelvo::NOTIFICATION_HOURLY_TICK, 77);
+    drain(notifier);
+    ASSERT_TRUE(waitFor([&] { return a->got().size() == 1; }));
+    drain(notifier);
+    EXPECT_EQ(1u, a->got().size());
+    notifier->unregisterListener(kelvo::NOTIFICATION_HOURLY_TICK, &la);
+    a->requestThreadExit();
+}
+
+TEST(NotifierTest, InvalidTypesAndListenersAreRefused) {
+    Notifier* notifier = Notifier::getInstance();
+    sp<ListeningThread> a = new ListeningThread("ListenerBad");
+    NotifierListener la(a);
+    LogCapture log;
+    EXPECT_EQ(-5, notifier->registerListener(23, &la));
+    EXPECT_EQ(-5, notifier->registerListener(-1, &la));
+    EXPECT_EQ(-5, notifier->registerListener(0, nullptr));
+    EXPECT_EQ(3u, log.count("registerListener# Invalid parameter", ANDROID_LOG_ERROR));
+
+    // A type nobody listens for is accepted and dropped quietly.
+    EXPECT_GE(notify(notifier, kelvo::NOTIFICATION_VM_DIED, 1), 0);
+    // An unknown type is accepted by the sender and refused on the notifier
+    // thread.
+    EXPECT_GE(notify(notifier, 30, 1), 0);
+    drain(notifier);
+    EXPECT_TRUE(waitFor([&] { return log.contains("Unknown notification type: 30"); }));
+    EXPECT_TRUE(log.contains("[Notifier.cpp] notifyAllListeners# Unknown notification type: 30",
+                             ANDROID_LOG_ERROR));
+    a->requestThreadExit();
+}
+
+TEST(NotifierTest, ListenerWhoseThreadEndedIsSkippedWithoutHarm) {
+    Notifier* notifier = Notifier::getInstance();
+    sp<ListeningThread> gone = new ListeningThread("ListenerGone");
+    sp<ListeningThread> alive = new ListeningThread("ListenerAlive");
+    NotifierListener lg(gone);
+    NotifierListener la(alive);
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &lg));
+    ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &la));
+    gone->requestThreadExit();
+    gone->join();
+    LogCapture log;
+    notify(notifier, kelvo::NOTIFICATION_BOOT_COMPLETED, 5);
+    drain(notifier);
+    ASSERT_TRUE(waitFor([&] { return alive->got().size() == 1; }));
+    EXPECT_TRUE(log.contains("ListenerGone is not running or is pending to exit"));
+    notifier->unregisterListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &lg);
+    notifier->unregisterListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &la);
+    alive->requestThreadExit();
+}

@@ -1,0 +1,287 @@
+#include <gtest/gtest.h>
+#include <sys/syscall.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <climits>
+#include <fstream>
+#include <mutex>
+#include <thread>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "utils/HandlerThread.h"
+
+using android::Parcel;
+using android::sp;
+using kelvo::HandlerThread;
+using kelvo::ParcelMessage;
+using kelvo::test::LogCapture;
+using kelvo::test::waitFor;
+
+namespace {
+
+struct Received {
+    int32_t type;
+    int32_t what;
+    int32_t value;
+};
+
+// Records what it receives. Code 7 sleeps for the body's milliseconds then
+// replies; code 8 replies with the body's value doubled; code 9 replies
+// nothing; code 10 holds the thread until released.
+class RecordingThread : public HandlerThread {
+public:
+    explicit RecordingThread(const char* name = "RecordingThread") : HandlerThread(name, 11) {}
+
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        int32_t value = msg.getParcel().readInt32();
+        mTid = static_cast<pid_t>(syscall(SYS_gettid));
+        {
+            std::lock_guard<std::mutex> guard(mLock);
+            mReceived.push_back({msg.type, msg.what, value});
+        }
+        switch (msg.what) {
+            case 7:
+                std::this_thread::sleep_for(std::chrono::milliseconds(value));
+                msg.getReply()->writeInt32(value);
+                return 70;
+            case 8:
+                msg.getReply()->writeInt32(value * 2);
+                return 80;
+            case 9:
+                return 90;
+            case 10:
+                while (!mRelease.load()) {
+                    std::this_thread::sleep_for(std::chrono::milliseconds(1));
+                }
+                return 100;
+            default:
+                return 0;
+        }
+    }
+
+    std::vector<Received> received() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mReceived;
+    }
+    size_t count() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mReceived.size();
+    }
+
+    std::atomic<bool> mRelease{false};
+    std::atomic<pid_t> mTid{0};
+
+private:
+    std::mutex mLock;
+    std::vector<Received> mReceived;
+};
+
+ParcelMessage makeMessage(int32_t what, int32_t value, Parcel* reply = nullptr) {
+    Parcel p;
+    p.writeInt32(value);
+    return ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, what, p, reply);
+}
+
+class HandlerThreadTest : public ::testing::Test {
+protected:
+    void TearDown() override { HandlerThread::setSyncTimeoutMs(0); }
+};
+
+} // namespace
+
+TEST_F(HandlerThreadTest, DeliversAsynchronousMessagesInOrderWithTheirBodies) {
+    sp<RecordingThread> t = new RecordingThread();
+    std::vector<int32_t> ids;
+    for (int i = 0; i < 100; ++i) {
+        ids.push_back(t->sendMessage(makeMessage(1, i)));
+    }
+    ASSERT_TRUE(waitFor([&] { return t->count() == 100; }));
+    std::vector<Received> got = t->received();
+    for (int i = 0; i < 100; ++i) {
+        EXPECT_EQ(kelvo::MESSAGE_CUSTOMIZED, got[i].type);
+        EXPECT_EQ(i, got[i].value);
+    }
+    // Ids run 1, 2, 3 ...
+    for (size_t i = 0; i < ids.size(); ++i) {
+        EXPECT_EQ(static_cast<int32_t>(i + 1), ids[i]);
+    }
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, DelayedMessageWaitsAndCanBeRemoved) {
+    sp<RecordingThread> t = new RecordingThread();
+    int32_t late = t->sendMessageDelayed(ms2ns(300), makeMessage(1, 1));
+    int32_t removed = t->sendMessageDelayed(ms2ns(300), makeMessage(1, 2));
+    ASSERT_GE(late, 0);
+    ASSERT_GE(removed, 0);
+    EXPECT_EQ(0, t->removeMessage(removed));
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    EXPECT_EQ(0u, t->count());
+    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
+    EXPECT_EQ(1, t->received()[0].value);
+    std::this_thread::sleep_for(std::chrono::milliseconds(350));
+    EXPECT_EQ(1u, t->count());
+
+    // An id already delivered (or removed) is unknown.
+    LogCapture log;
+    EXPECT_EQ(-4, t->removeMessage(late));
+    EXPECT_EQ(-4, t->removeMessage(removed));
+    EXPECT_TRUE(log.contains("removeMessage# Invalid message id[" + std::to_string(late) +
+                             "] in RecordingThread", ANDROID_LOG_ERROR));
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, SynchronousSendReturnsStatusAndReply) {
+    sp<RecordingThread> t = new RecordingThread();
+    Parcel reply;
+    EXPECT_EQ(80, t->sendMessageSync(makeMessage(8, 21, &reply)));
+    EXPECT_EQ(0u, reply.dataPosition());
+    EXPECT_EQ(42, reply.readInt32());
+
+    // A handler that writes nothing leaves the caller's reply as it was.
+    Parcel untouched;
+    untouched.writeInt32(1234);
+    untouched.setDataPosition(4);
+    EXPECT_EQ(90, t->sendMessageSync(makeMessage(9, 0, &untouched)));
+    EXPECT_EQ(4u, untouched.dataSize());
+    EXPECT_EQ(4u, untouched.dataPosition());
+    untouched.setDataPosition(0);
+    EXPECT_EQ(1234, untouched.readInt32());
+
+    // Without a reply parcel the status still comes back.
+    EXPECT_EQ(80, t->sendMessageSync(makeMessage(8, 1)));
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, SynchronousTimeOutDiscardsTheLateReply) {
+    HandlerThread::setSyncTimeoutMs(100);
+    sp<RecordingThread> t = new RecordingThread();
+    LogCapture log;
+    Parcel reply;
+    reply.writeInt32(-7);
+    EXPECT_EQ(-1, t->sendMessageSync(makeMessage(7, 400, &reply)));
+    EXPECT_TRUE(log.contains("Failed to send synchronized message to RecordingThread: 110, "
+                             "result: -1",
+                             ANDROID_LOG_ERROR));
+    // The handler finishes later; its reply must not reach the caller's parcel.
+    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
+    std::this_thread::sleep_for(std::chrono::milliseconds(500));
+    EXPECT_EQ(4u, reply.dataSize());
+    reply.setDataPosition(0);
+    EXPECT_EQ(-7, reply.readInt32());
+    // The thread still serves synchronous requests afterwards.
+    Parcel again;
+    EXPECT_EQ(80, t->sendMessageSync(makeMessage(8, 5, &again)));
+    EXPECT_EQ(10, again.readInt32());
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, ManyConcurrentSynchronousSendersEachGetTheirOwnAnswer) {
+    sp<RecordingThread> t = new RecordingThread();
+    std::atomic<int> wrong{0};
+    std::vector<std::thread> senders;
+    for (int s = 0; s < 4; ++s) {
+        senders.emplace_back([&, s] {
+            for (int i = 0; i < 200; ++i) {
+                Parcel reply;
+                int32_t value = s * 1000 + i;
+                if (t->sendMessageSync(makeMessage(8, value, &reply)) != 80 ||
+                    reply.readInt32() != value * 2) {
+                    wrong++;
+                }
+            }
+        });
+    }
+    for (auto& s : senders) s.join();
+    EXPECT_EQ(0, wrong.load());
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, AfterExitSendsAreRefusedAndQueuedMessagesDropped) {
+    sp<RecordingThread> t = new RecordingThread();
+    // Hold the thread busy, queue more behind it, then ask it to exit.
+    t->sendMessage(makeMessage(10, 0));
+    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
+    t->sendMessage(makeMessage(1, 1));
+    t->sendMessage(makeMessage(1, 2));
+
+    LogCapture log;
+    t->requestThreadExit();
+    EXPECT_EQ(-2, t->sendMessage(makeMessage(1, 3)));
+    Parcel reply;
+    EXPECT_EQ(-2, t->sendMessageSync(makeMessage(8, 3, &reply)));
+    EXPECT_EQ(2u, log.count("RecordingThread is not running or is pending to exit",
+                            ANDROID_LOG_ERROR));
+
+    t->mRelease = true;
+    t->join();
+    EXPECT_EQ(1u, t->count());
+    EXPECT_TRUE(log.contains("RecordingThread is pending to exit", ANDROID_LOG_ERROR));
+}
+
+TEST_F(HandlerThreadTest, SynchronousWaiterOfADroppedMessageReturnsAtOnce) {
+    sp<RecordingThread> t = new RecordingThread();
+    t->sendMessage(makeMessage(10, 0));
+    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
+    auto start = std::chrono::steady_clock::now();
+    std::thread waiter([&] { EXPECT_EQ(-1, t->sendMessageSync(makeMessage(8, 1))); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    t->removeAllMessages();
+    waiter.join();
+    // Far below the 20 s time-out.
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+    t->mRelease = true;
+    t->requestThreadExit();
+}
+
+TEST_F(HandlerThreadTest, NamesArePrioritiesCheckedAndThreadIsNamed) {
+    LogCapture log;
+    sp<RecordingThread> empty = new RecordingThread("");
+    EXPECT_TRUE(log.contains("Handler name is empty", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-2, empty->sendMessage(makeMessage(1, 1)));
+
+    sp<RecordingThread> longName = new RecordingThread("ABCDEFGHIJKLMNOPQRSTUVWXY");
+    EXPECT_STREQ("ABCDEFGHIJKLMNOPQRS", longName->getName());
+    ASSERT_GE(longName->sendMessage(makeMessage(1, 1)), 0);
+    ASSERT_TRUE(waitFor([&] { return longName->count() == 1; }));
+    // The kernel keeps 15 characters of the name.
+    pid_t tid = longName->mTid;
+    std::ifstream in("/proc/self/task/" + std::to_string(tid) + "/comm");
+    std::string comm;
+    std::getline(in, comm);
+    EXPECT_EQ("ABCDEFGHIJKLMNO", comm);
+    longName->requestThreadExit();
+
+    class BadPriority : public HandlerThread {
+    public:
+        BadPriority() : HandlerThread("BadPriority", 20) {}
+        int32_t handleParcelMessage(const ParcelMessage&) override { return 0; }
+    };
+    sp<BadPriority> bad = new BadPriority();
+    EXPECT_TRUE(log.contains("Invalid priority: BadPriority", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-2, bad->sendMessage(makeMessage(1, 1)));
+}
+
+TEST_F(HandlerThreadTest, IdsWrapToZeroAndSkipPendingOnes) {
+    sp<RecordingThread> t = new RecordingThread();
+    t->setLastMessageId(INT32_MAX - 1);
+    // Busy with the first, so the next stay pending.
+    EXPECT_EQ(INT32_MAX, t->sendMessage(makeMessage(10, 0)));
+    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
+    EXPECT_EQ(0, t->sendMessage(makeMessage(1, 1)));
+    EXPECT_EQ(1, t->sendMessage(makeMessage(1, 2)));
+    // Wrapping again lands on pending ids 0 and 1: both are skipped.
+    t->setLastMessageId(INT32_MAX);
+    EXPECT_EQ(2, t->sendMessage(makeMessage(1, 3)));
+    t->mRelease = true;
+    ASSERT_TRUE(waitFor([&] { return t->count() == 4; }));
+    std::vector<Received> got = t->received();
+    EXPECT_EQ(1, got[1].value);
+    EXPECT_EQ(2, got[2].value);
+    EXPECT_EQ(3, got[3].value);
+    t->requestThreadExit();
+}

@@ -1,0 +1,414 @@
+#include <dirent.h>
+#include <gtest/gtest.h>
+#include <sys/ioctl.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <chrono>
+#include <cstdlib>
+#include <mutex>
+#include <set>
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "utils/HandlerThread.h"
+#include "utils/TimerCallback.h"
+#include "utils/TimerManager.h"
+
+using android::sp;
+using kelvo::HandlerThread;
+using kelvo::ParcelMessage;
+using kelvo::TimerCallback;
+using kelvo::TimerManager;
+using kelvo::test::LogCapture;
+using kelvo::test::waitFor;
+using namespace std::chrono_literals;
+
+namespace {
+
+constexpr int32_t kMarker = -1;
+
+// Records (type, what) of every message it handles.
+class RecordingThread : public HandlerThread {
+public:
+    explicit RecordingThread(const char* name) : HandlerThread(name, 11) {}
+
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.emplace_back(msg.type, msg.what);
+        return 0;
+    }
+
+    // Timer messages received for the timer id.
+    size_t timerCount(int32_t id) {
+        std::lock_guard<std::mutex> guard(mLock);
+        size_t n = 0;
+        for (const auto& got : mGot) {
+            n += (got.first == kelvo::MESSAGE_TIMER && got.second == id) ? 1 : 0;
+        }
+        return n;
+    }
+
+    std::vector<std::pair<int32_t, int32_t>> got() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mGot;
+    }
+
+    // Waits until everything posted to this thread so far has been handled.
+    bool drain() {
+        size_t before = markerCount();
+        if (sendMessage(ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, kMarker)) < 0) {
+            return false;
+        }
+        return waitFor([&] { return markerCount() > before; });
+    }
+
+private:
+    size_t markerCount() {
+        std::lock_guard<std::mutex> guard(mLock);
+        size_t n = 0;
+        for (const auto& got : mGot) {
+            n += (got.first == kelvo::MESSAGE_CUSTOMIZED && got.second == kMarker) ? 1 : 0;
+        }
+        return n;
+    }
+
+    std::mutex mLock;
+    std::vector<std::pair<int32_t, int32_t>> mGot;
+};
+
+// Timer descriptors currently open in this process.
+std::set<int> openTimerFds() {
+    std::set<int> fds;
+    DIR* dir = opendir("/proc/self/fd");
+    if (dir == nullptr) {
+        return fds;
+    }
+    while (struct dirent* entry = readdir(dir)) {
+        std::string path = std::string("/proc/self/fd/") + entry->d_name;
+        char target[64] = {};
+        ssize_t n = readlink(path.c_str(), target, sizeof(target) - 1);
+        if (n > 0 && std::string(target, n) == "anon_inode:[timerfd]") {
+            fds.insert(atoi(entry->d_name));
+        }
+    }
+    closedir(dir);
+    return fds;
+}
+
+class TimerManagerTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mInfoWas = kelvo::gLogInfoEnable.load();
+        kelvo::gLogInfoEnable.store(1);
+        mManager = TimerManager::getInstance();
+        mThread = new RecordingThread("TimerTarget");
+    }
+
+    void TearDown() override {
+        for (const sp<TimerCallback>& callback : mCallbacks) {
+            mManager->removeTimer(callback);
+        }
+        mThread->requestThreadExit();
+        mThread->join();
+        kelvo::gLogInfoEnable.store(mInfoWas);
+    }
+
+    sp<TimerCallback> makeCallback(int32_t id) {
+        sp<TimerCallback> callback = new TimerCallback(mThread, id);
+        mCallbacks.push_back(callback);
+        return callback;
+    }
+
+    TimerManager* mManager = nullptr;
+    sp<RecordingThread> mThread;
+    std::vector<sp<TimerCallback>> mCallbacks;
+    int32_t mInfoWas = 0;
+};
+
+TEST_F(TimerManagerTest, OneShotWithoutDelayFiresAtOnceAndOnlyOnce) {
+    sp<TimerCallback> callback = makeCallback(7);
+    ASSERT_EQ(0, mManager->addTimer(0, 0, callback));
+    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(7) >= 1; }, 2000ms));
+
+    std::this_thread::sleep_for(200ms);
+    ASSERT_TRUE(mThread->drain());
+    EXPECT_EQ(1u, mThread->timerCount(7));
+    // Spent: nothing left to wait for.
+    EXPECT_EQ(0, mManager->getExpireTime(callback));
+    for (const auto& got : mThread->got()) {
+        if (got.first == kelvo::MESSAGE_TIMER) {
+            EXPECT_EQ(7, got.second);
+        }
+    }
+}
+
+TEST_F(TimerManagerTest, PeriodicTimerFiresRepeatedlyWithItsId) {
+    sp<TimerCallback> a = makeCallback(1);
+    sp<TimerCallback> b = makeCallback(2);
+    ASSERT_EQ(0, mManager->addTimer(10, 20, a));
+    ASSERT_EQ(0, mManager->addTimer(0, 25, b));
+    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(1) >= 5 && mThread->timerCount(2) >= 5; },
+                        3000ms));
+    for (const auto& got : mThread->got()) {
+        if (got.first == kelvo::MESSAGE_TIMER) {
+            EXPECT_TRUE(got.second == 1 || got.second == 2) << got.second;
+        }
+    }
+    // Still armed for the next period.
+    int64_t left = mManager->getExpireTime(a);
+    EXPECT_GE(left, 0);
+    EXPECT_LE(left, 20);
+}
+
+TEST_F(TimerManagerTest, DuplicateAddIsRefusedAndTheFirstTimerKeepsWorking) {
+    LogCapture log;
+    sp<TimerCallback> callback = makeCallback(3);
+    ASSERT_EQ(0, mManager->addTimer(0, 20, callback));
+    EXPECT_EQ(-13, mManager->addTimer(60000, 0, callback));
+    EXPECT_TRUE(log.contains("[TimerManager.cpp] addTimer# This callback has been added",
+                             ANDROID_LOG_INFO));
+
+    // Had the second add replaced the first timer, nothing would come for a
+    // minute.
+    size_t before = mThread->timerCount(3);
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(3) >= before + 3; }, 2000ms));
+    EXPECT_LE(mManager->getExpireTime(callback), 20);
+}
+
+TEST_F(TimerManagerTest, RemovalStopsDelivery) {
+    LogCapture log;
+    sp<TimerCallback> callback = makeCallback(4);
+    ASSERT_EQ(0, mManager->addTimer(0, 10, callback));
+    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(4) >= 2; }, 2000ms));
+
+    ASSERT_EQ(0, mManager->removeTimer(callback));
+    ASSERT_TRUE(mThread->drain());
+    size_t settled = mThread->timerCount(4);
+    std::this_thread::sleep_for(200ms);
+    ASSERT_TRUE(mThread->drain());
+    EXPECT_EQ(settled, mThread->timerCount(4));
+
+    // Gone from the manager: removing again is harmless, the rest refuse.
+    log.clear();
+    EXPECT_EQ(0, mManager->removeTimer(callback));
+    EXPECT_EQ(-4, mManager->rescheduleTimer(callback));
+    EXPECT_EQ(-4, mManager->rescheduleTimer(10, 10, callback));
+    EXPECT_EQ(-4, mManager->getExpireTime(callback));
+    EXPECT_EQ(4u, log.count("Can not find timer of callback", ANDROID_LOG_INFO));
+    EXPECT_TRUE(log.contains("[TimerManager.cpp] removeTimer# Can not find timer of callback"));
+
+    // The same callback can be added again afterwards.
+    ASSERT_EQ(0, mManager->addTimer(0, 0, callback));
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(4) > settled; }, 2000ms));
+}
+
+TEST_F(TimerManagerTest, ExpireTimeFollowsReschedules) {
+    sp<TimerCallback> callback = makeCallback(5);
+    ASSERT_EQ(0, mManager->addTimer(3000, 0, callback));
+    int64_t left = mManager->getExpireTime(callback);
+    EXPECT_GT(left, 2000);
+    EXPECT_LE(left, 3000);
+
+    // Stored times, counted again from now.
+    std::this_thread::sleep_for(300ms);
+    left = mManager->getExpireTime(callback);
+    EXPECT_LE(left, 2700);
+    ASSERT_EQ(0, mManager->rescheduleTimer(callback));
+    left = mManager->getExpireTime(callback);
+    EXPECT_GT(left, 2800);
+    EXPECT_LE(left, 3000);
+
+    // New times replace the stored ones.
+    ASSERT_EQ(0, mManager->rescheduleTimer(60000, 0, callback));
+    left = mManager->getExpireTime(callback);
+    EXPECT_GT(left, 59000);
+    EXPECT_LE(left, 60000);
+    std::this_thread::sleep_for(150ms);
+    ASSERT_TRUE(mThread->drain());
+    EXPECT_EQ(0u, mThread->timerCount(5));
+
+    // From a one-shot far away to a periodic one firing now.
+    ASSERT_EQ(0, mManager->rescheduleTimer(0, 15, callback));
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(5) >= 3; }, 2000ms));
+    // And the stored times are now the new ones.
+    ASSERT_EQ(0, mManager->rescheduleTimer(callback));
+    EXPECT_LE(mManager->getExpireTime(callback), 15);
+}
+
+TEST_F(TimerManagerTest, InvalidParametersAreRefused) {
+    LogCapture log;
+    sp<TimerCallback> callback = makeCallback(6);
+    EXPECT_EQ(-5, mManager->addTimer(-1, 0, callback));
+    EXPECT_EQ(-5, mManager->addTimer(0, -1, callback));
+    EXPECT_EQ(-5, mManager->addTimer(0, 0, nullptr));
+    EXPECT_EQ(3u, log.count("[TimerManager.cpp] addTimer# Invalid parameter", ANDROID_LOG_ERROR));
+    // None of the refused adds left a timer behind.
+    EXPECT_EQ(-4, mManager->getExpireTime(callback));
+
+    EXPECT_EQ(-5, mManager->removeTimer(nullptr));
+    EXPECT_EQ(-5, mManager->rescheduleTimer(nullptr));
+    EXPECT_EQ(-5, mManager->rescheduleTimer(0, 0, nullptr));
+    EXPECT_EQ(-5, mManager->getExpireTime(nullptr));
+    EXPECT_TRUE(
+        log.contains("[TimerManager.cpp] removeTimer# Invalid parameter", ANDROID_LOG_ERROR));
+    EXPECT_TRUE(
+        log.contains("[TimerManager.cpp] getExpireTime# Invalid parameter", ANDROID_LOG_ERROR));
+
+    // Negative new times leave a registered timer as it was.
+    ASSERT_EQ(0, mManager->addTimer(60000, 0, callback));
+    EXPECT_EQ(-5, mManager->rescheduleTimer(-5, 0, callback));
+    EXPECT_EQ(-5, mManager->rescheduleTimer(0, -5, callback));
+    EXPECT_EQ(4u, log.count("rescheduleTimer# Invalid parameter", ANDROID_LOG_ERROR));
+    EXPECT_GT(mManager->getExpireTime(callback), 59000);
+    std::this_thread::sleep_for(150ms);
+    ASSERT_TRUE(mThread->drain());
+    EXPECT_EQ(0u, mThread->timerCount(6));
+}
+
+TEST_F(TimerManagerTest, CallbackReadsOnlyTheDescriptorItIsRegisteredWith) {
+    LogCapture log;
+    sp<TimerCallback> callback = makeCallback(8);
+    sp<TimerCallback> stranger = makeCallback(9);
+    std::set<int> before = openTimerFds();
+    ASSERT_EQ(0, mManager->addTimer(60000, 0, callback));
+    std::set<int> after = openTimerFds();
+    std::vector<int> added;
+    for (int fd : after) {
+        if (before.count(fd) == 0) {
+            added.push_back(fd);
+        }
+    }
+    ASSERT_EQ(1u, added.size());
+    int timerFd = added[0];
+
+    // Woken although nothing expired (re-armed meanwhile): keep watching,
+    // post nothing.
+    EXPECT_EQ(1, callback->handleEvent(timerFd, android::Looper::EVENT_INPUT, nullptr));
+
+    // A descriptor the callback does not own, e.g. a number reused after its
+    // timer was removed: not read, dropped from the looper.
+    int pipeFds[2];
+    ASSERT_EQ(0, pipe(pipeFds));
+    uint64_t eight = 8;
+    ASSERT_EQ(static_cast<ssize_t>(sizeof(eight)), write(pipeFds[1], &eight, sizeof(eight)));
+    EXPECT_EQ(0, callback->handleEvent(pipeFds[0], android::Looper::EVENT_INPUT, nullptr));
+    EXPECT_EQ(0, stranger->handleEvent(pipeFds[0], android::Looper::EVENT_INPUT, nullptr));
+    EXPECT_EQ(0, stranger->handleEvent(timerFd, android::Looper::EVENT_INPUT, nullptr));
+    int unread = 0;
+    ASSERT_EQ(0, ioctl(pipeFds[0], FIONREAD, &unread));
+    EXPECT_EQ(static_cast<int>(sizeof(eight)), unread);
+    close(pipeFds[0]);
+    close(pipeFds[1]);
+
+    EXPECT_EQ(0, callback->handleEvent(timerFd, android::Looper::EVENT_HANGUP, nullptr));
+    EXPECT_EQ(0, callback->handleEvent(timerFd, android::Looper::EVENT_ERROR, nullptr));
+    EXPECT_EQ(2u,
+              log.count("[TimerCallback.cpp] handleEvent# Unexpected events", ANDROID_LOG_ERROR));
+    EXPECT_FALSE(log.contains("Failed to read"));
+
+    ASSERT_TRUE(mThread->drain());
+    EXPECT_EQ(0u, mThread->timerCount(8));
+    EXPECT_EQ(0u, mThread->timerCount(9));
+
+    // The timer itself is unharmed.
+    ASSERT_EQ(0, mManager->rescheduleTimer(0, 0, callback));
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(8) == 1; }, 2000ms));
+}
+
+TEST_F(TimerManagerTest, RescheduleRacingExpiryDoesNotFreezeTheTimerThread) {
+    LogCapture log;
+    sp<TimerCallback> racing = makeCallback(10);
+    ASSERT_EQ(0, mManager->addTimer(1, 1, racing));
+
+    // Due at once, then a minute away: an expiry the poll saw may be gone by
+    // the time the timer thread reads it.
+    std::atomic<bool> stop{false};
+    std::atomic<bool> done{false};
+    std::atomic<int> failures{0};
+    std::thread rearm([&] {
+        for (bool soon = true; !stop.load(); soon = !soon) {
+            if (mManager->rescheduleTimer(soon ? 0 : 60000, soon ? 1 : 0, racing) != 0) {
+                failures++;
+            }
+        }
+        if (mManager->rescheduleTimer(60000, 0, racing) != 0) {
+            failures++;
+        }
+        done.store(true);
+    });
+    std::this_thread::sleep_for(300ms);
+    stop.store(true);
+    EXPECT_TRUE(waitFor([&] { return done.load(); }, 2000ms)) << "re-arming got stuck";
+    rearm.join();
+    EXPECT_EQ(0, failures.load());
+
+    // The timer thread still serves other timers.
+    sp<TimerCallback> probe = makeCallback(11);
+    ASSERT_EQ(0, mManager->addTimer(0, 0, probe));
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(11) == 1; }, 2000ms));
+    EXPECT_FALSE(log.contains("Failed to read"));
+    EXPECT_FALSE(log.contains("Unexpected events"));
+    EXPECT_EQ(0, mManager->removeTimer(racing));
+}
+
+TEST_F(TimerManagerTest, TimersRemovedWhileTheirExpiriesArePendingStayQuiet) {
+    LogCapture log;
+    constexpr int kTimers = 24;
+    std::set<int> fdsBefore = openTimerFds();
+    std::vector<sp<TimerCallback>> callbacks;
+    for (int i = 0; i < kTimers; ++i) {
+        callbacks.push_back(makeCallback(100 + i));
+        ASSERT_EQ(0, mManager->addTimer(0, 1, callbacks.back()));
+    }
+
+    // Two threads remove and add back halves of the timers while they fire,
+    // so descriptors close and their numbers are reused within one poll
+    // batch.
+    std::atomic<bool> stop{false};
+    std::atomic<int> failures{0};
+    auto churn = [&](int first) {
+        while (!stop.load()) {
+            for (int i = first; i < kTimers; i += 2) {
+                if (mManager->removeTimer(callbacks[i]) != 0 ||
+                    mManager->addTimer(0, 1, callbacks[i]) != 0) {
+                    failures++;
+                }
+            }
+        }
+    };
+    std::thread even(churn, 0);
+    std::thread odd(churn, 1);
+    std::this_thread::sleep_for(300ms);
+    stop.store(true);
+    even.join();
+    odd.join();
+    EXPECT_EQ(0, failures.load());
+
+    for (const sp<TimerCallback>& callback : callbacks) {
+        ASSERT_EQ(0, mManager->removeTimer(callback));
+    }
+    ASSERT_TRUE(mThread->drain());
+    std::vector<size_t> settled;
+    for (int i = 0; i < kTimers; ++i) {
+        settled.push_back(mThread->timerCount(100 + i));
+    }
+    std::this_thread::sleep_for(200ms);
+    ASSERT_TRUE(mThread->drain());
+    for (int i = 0; i < kTimers; ++i) {
+        EXPECT_EQ(settled[i], mThread->timerCount(100 + i)) << "timer " << 100 + i;
+    }
+    EXPECT_FALSE(log.contains("Failed to read"));
+
+    // Every descriptor was closed, and the timer thread still works.
+    sp<TimerCallback> probe = makeCallback(200);
+    ASSERT_EQ(0, mManager->addTimer(0, 0, probe));
+    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(200) == 1; }, 2000ms));
+    ASSERT_EQ(0, mManager->removeTimer(probe));
+    EXPECT_EQ(fdsBefore, openTimerFds());
+}
+
+} // namespace

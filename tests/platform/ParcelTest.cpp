@@ -1,0 +1,798 @@
+#include <gtest/gtest.h>
+
+#include <binder/Parcel.h>
+
+#include <cmath>
+#include <cstdint>
+#include <cstring>
+#include <limits>
+#include <string>
+#include <vector>
+
+#include "utils/ParcelMessage.h"
+
+using android::Parcel;
+using android::String16;
+using android::String8;
+using Bytes = std::vector<uint8_t>;
+
+namespace {
+
+Bytes bytesOf(const Parcel& p) {
+    return Bytes(p.data(), p.data() + p.dataSize());
+}
+
+// A parcel holding exactly these bytes (capacity == size, so any read past
+// the end leaves the heap block).
+void load(Parcel* p, const Bytes& bytes) {
+    ASSERT_EQ(android::NO_ERROR, p->setData(bytes.data(), bytes.size()));
+    ASSERT_EQ(bytes.size(), p->dataSize());
+    ASSERT_EQ(0u, p->dataPosition());
+}
+
+Bytes le32(uint32_t v) {
+    return {static_cast<uint8_t>(v), static_cast<uint8_t>(v >> 8), static_cast<uint8_t>(v >> 16),
+            static_cast<uint8_t>(v >> 24)};
+}
+
+Bytes cat(std::initializer_list<Bytes> parts) {
+    Bytes out;
+    for (const Bytes& part : parts) {
+        out.insert(out.end(), part.begin(), part.end());
+    }
+    return out;
+}
+
+Bytes ascii(const char* s) {
+    return Bytes(s, s + strlen(s));
+}
+
+std::u16string toU16(const String16& s) {
+    return std::u16string(s.string(), s.size());
+}
+
+std::string toStd(const String8& s) {
+    return std::string(s.string(), s.size());
+}
+
+} // namespace
+
+// ---------------------------------------------------------------------------
+// The wire layout, byte by byte.
+
+TEST(ParcelLayoutTest, NumbersAreLittleEndianAndBoolIsAnInt32) {
+    Parcel p;
+    p.writeInt32(0x01020304);
+    p.writeUint32(0xfffffffeu);
+    p.writeInt64(0x0102030405060708LL);
+    p.writeUint64(0xf0debc9a78563412ULL);
+    p.writeBool(true);
+    p.writeBool(false);
+    p.writeFloat(1.0f);
+    p.writeDouble(-2.0);
+    Bytes expected = {
+            0x04, 0x03, 0x02, 0x01,                         // int32
+            0xfe, 0xff, 0xff, 0xff,                         // uint32
+            0x08, 0x07, 0x06, 0x05, 0x04, 0x03, 0x02, 0x01, // int64
+            0x12, 0x34, 0x56, 0x78, 0x9a, 0xbc, 0xde, 0xf0, // uint64
+            0x01, 0x00, 0x00, 0x00,                         // true
+            0x00, 0x00, 0x00, 0x00,                         // false
+            0x00, 0x00, 0x80, 0x3f,                         // 1.0f
+            0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0x00, 0xc0, // -2.0
+    };
+    EXPECT_EQ(expected, bytesOf(p));
+    EXPECT_EQ(expected.size(), p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+TEST(ParcelLayoutTest, String8IsLengthBytesNulAndZeroPadding) {
+    struct Case {
+        const char* text;
+        Bytes wire;
+    } cases[] = {
+            {"", {0, 0, 0, 0, 0, 0, 0, 0}},
+            {"abc", {3, 0, 0, 0, 'a', 'b', 'c', 0}},
+            {"abcd", {4, 0, 0, 0, 'a', 'b', 'c', 'd', 0, 0, 0, 0}},
+            {"abcde", {5, 0, 0, 0, 'a', 'b', 'c', 'd', 'e', 0, 0, 0}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.text);
+        Parcel p;
+        ASSERT_EQ(android::NO_ERROR, p.writeString8(String8(c.text)));
+        EXPECT_EQ(c.wire, bytesOf(p));
+    }
+}
+
+TEST(ParcelLayoutTest, String16IsUnitCountUnitsNulUnitAndPadding) {
+    Parcel hi;
+    ASSERT_EQ(android::NO_ERROR, hi.writeString16(String16(u"hi")));
+    EXPECT_EQ((Bytes{0x02, 0, 0, 0, 0x68, 0, 0x69, 0, 0, 0, 0, 0}), bytesOf(hi));
+
+    // One unit plus its NUL needs no padding.
+    Parcel h;
+    h.writeString16(String16(u"h"));
+    EXPECT_EQ((Bytes{0x01, 0, 0, 0, 0x68, 0, 0, 0}), bytesOf(h));
+
+    // Units beyond Latin-1 keep both bytes.
+    Parcel wide;
+    wide.writeString16(String16(u"\u4e2d"));
+    EXPECT_EQ((Bytes{0x01, 0, 0, 0, 0x2d, 0x4e, 0, 0}), bytesOf(wide));
+
+    Parcel empty;
+    empty.writeString16(String16());
+    EXPECT_EQ((Bytes{0, 0, 0, 0, 0, 0, 0, 0}), bytesOf(empty));
+
+    Parcel null;
+    ASSERT_EQ(android::NO_ERROR, null.writeString16(nullptr, 0));
+    EXPECT_EQ((Bytes{0xff, 0xff, 0xff, 0xff}), bytesOf(null));
+}
+
+TEST(ParcelLayoutTest, CStringKeepsItsNulAndIsPaddedToFour) {
+    struct Case {
+        const char* text;
+        Bytes wire;
+    } cases[] = {
+            {"", {0, 0, 0, 0}},
+            {"ab", {'a', 'b', 0, 0}},
+            {"abc", {'a', 'b', 'c', 0}},
+            {"abcd", {'a', 'b', 'c', 'd', 0, 0, 0, 0}},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.text);
+        Parcel p;
+        ASSERT_EQ(android::NO_ERROR, p.writeCString(c.text));
+        EXPECT_EQ(c.wire, bytesOf(p));
+    }
+    Parcel p;
+    EXPECT_EQ(android::BAD_VALUE, p.writeCString(nullptr));
+    EXPECT_EQ(0u, p.dataSize());
+}
+
+TEST(ParcelLayoutTest, RawBlockPaddingIsZeroedEvenOverOldBytes) {
+    Parcel p;
+    // Fill the buffer with ones, then rewrite from the start.
+    for (int i = 0; i < 4; ++i) {
+        p.writeInt32(-1);
+    }
+    p.setDataPosition(0);
+    const uint8_t five[] = {1, 2, 3, 4, 5};
+    ASSERT_EQ(android::NO_ERROR, p.write(five, sizeof(five)));
+    EXPECT_EQ(8u, p.dataPosition());
+    void* block = p.writeInplace(1);
+    ASSERT_NE(nullptr, block);
+    memset(block, 9, 1);
+    EXPECT_EQ(12u, p.dataPosition());
+    EXPECT_EQ((Bytes{1, 2, 3, 4, 5, 0, 0, 0, 9, 0, 0, 0, 0xff, 0xff, 0xff, 0xff}), bytesOf(p));
+
+    // An empty block takes no room.
+    p.setDataPosition(16);
+    ASSERT_EQ(android::NO_ERROR, p.write(nullptr, 0));
+    EXPECT_EQ(16u, p.dataSize());
+    EXPECT_EQ(android::BAD_VALUE, p.write(nullptr, 4));
+    EXPECT_EQ(16u, p.dataSize());
+}
+
+// ---------------------------------------------------------------------------
+// What is written reads back.
+
+TEST(ParcelRoundTripTest, EveryKindReadsBackInOrder) {
+    const double kNan = std::numeric_limits<double>::quiet_NaN();
+    const uint8_t raw[] = {0xde, 0xad, 0xbe, 0xef, 0x01, 0x02};
+    String8 withNul("a\0b", 3);
+
+    Parcel p;
+    p.writeInt32(INT32_MIN);
+    p.writeInt32(INT32_MAX);
+    p.writeUint32(UINT32_MAX);
+    p.writeInt64(INT64_MIN);
+    p.writeUint64(UINT64_MAX);
+    p.writeFloat(-0.5f);
+    p.writeDouble(kNan);
+    p.writeDouble(-std::numeric_limits<double>::infinity());
+    p.writeBool(true);
+    p.writeBool(false);
+    p.writeCString("cpu0");
+    p.writeString8(String8("caf\xc3\xa9"));
+    p.writeString8(withNul);
+    p.writeString8(String8());
+    p.writeString16(String16(u"gr\u00fc\u00dfe \U0001f600"));
+    p.writeString16(String16());
+    p.writeString16(nullptr, 0);
+    p.write(raw, sizeof(raw));
+    p.writeInt32(77);
+    size_t written = p.dataSize();
+
+    p.setDataPosition(0);
+    EXPECT_EQ(INT32_MIN, p.readInt32());
+    int32_t i32 = 0;
+    EXPECT_EQ(android::NO_ERROR, p.readInt32(&i32));
+    EXPECT_EQ(INT32_MAX, i32);
+    EXPECT_EQ(UINT32_MAX, p.readUint32());
+    EXPECT_EQ(INT64_MIN, p.readInt64());
+    uint64_t u64 = 0;
+    EXPECT_EQ(android::NO_ERROR, p.readUint64(&u64));
+    EXPECT_EQ(UINT64_MAX, u64);
+    EXPECT_EQ(-0.5f, p.readFloat());
+    EXPECT_TRUE(std::isnan(p.readDouble()));
+    double d = 0;
+    EXPECT_EQ(android::NO_ERROR, p.readDouble(&d));
+    EXPECT_TRUE(std::isinf(d) && d < 0);
+    EXPECT_TRUE(p.readBool());
+    bool b = true;
+    EXPECT_EQ(android::NO_ERROR, p.readBool(&b));
+    EXPECT_FALSE(b);
+    EXPECT_STREQ("cpu0", p.readCString());
+    EXPECT_EQ("caf\xc3\xa9", toStd(p.readString8()));
+    String8 s8;
+    EXPECT_EQ(android::NO_ERROR, p.readString8(&s8));
+    EXPECT_EQ(std::string("a\0b", 3), toStd(s8));
+    EXPECT_EQ(android::NO_ERROR, p.readString8(&s8));
+    EXPECT_EQ(0u, s8.size());
+    EXPECT_EQ(u"gr\u00fc\u00dfe \U0001f600", toU16(p.readString16()));
+    size_t len = 99;
+    const char16_t* units = p.readString16Inplace(&len);
+    ASSERT_NE(nullptr, units);
+    EXPECT_EQ(0u, len);
+    // The null string reads as null, distinct from the empty one.
+    String16 s16(u"old");
+    EXPECT_EQ(android::UNEXPECTED_NULL, p.readString16(&s16));
+    EXPECT_EQ(0u, s16.size());
+    uint8_t back[sizeof(raw)] = {};
+    EXPECT_EQ(android::NO_ERROR, p.read(back, sizeof(back)));
+    EXPECT_EQ(0, memcmp(raw, back, sizeof(raw)));
+    EXPECT_EQ(77, p.readInt32());
+    EXPECT_EQ(written, p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+TEST(ParcelRoundTripTest, InplaceReadsPointIntoTheParcelAndAdvancePadded) {
+    Parcel p;
+    p.writeString16(String16(u"abc"));
+    void* block = p.writeInplace(6);
+    ASSERT_NE(nullptr, block);
+    memcpy(block, "xyzuvw", 6);
+    p.writeInt32(5);
+
+    p.setDataPosition(0);
+    size_t len = 0;
+    const char16_t* units = p.readString16Inplace(&len);
+    ASSERT_NE(nullptr, units);
+    EXPECT_EQ(u"abc", std::u16string(units, len));
+    EXPECT_EQ(12u, p.dataPosition());
+    const void* raw = p.readInplace(6);
+    ASSERT_NE(nullptr, raw);
+    EXPECT_EQ(p.data() + 12, raw);
+    EXPECT_EQ(0, memcmp(raw, "xyzuvw", 6));
+    EXPECT_EQ(20u, p.dataPosition());
+    EXPECT_EQ(5, p.readInt32());
+}
+
+TEST(ParcelRoundTripTest, LongStringsGrowTheBuffer) {
+    std::string big(100000, 'x');
+    big[12345] = 'y';
+    std::u16string big16(50001, u'\u00e9');
+    Parcel p;
+    ASSERT_EQ(android::NO_ERROR, p.writeString8(String8(big.c_str())));
+    ASSERT_EQ(android::NO_ERROR, p.writeString16(big16.data(), big16.size()));
+    ASSERT_EQ(android::NO_ERROR, p.writeCString(big.c_str()));
+    EXPECT_GE(p.dataCapacity(), p.dataSize());
+
+    p.setDataPosition(0);
+    EXPECT_EQ(big, toStd(p.readString8()));
+    EXPECT_EQ(big16, toU16(p.readString16()));
+    EXPECT_EQ(big, std::string(p.readCString()));
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+// ---------------------------------------------------------------------------
+// Reads past the end: nothing is read from outside the buffer, the value
+// reads return zero or empty, the status reads report NOT_ENOUGH_DATA.
+
+TEST(ParcelReadPastEndTest, EmptyParcelYieldsZeroesAndErrors) {
+    Parcel p;
+    EXPECT_EQ(0, p.readInt32());
+    EXPECT_EQ(0u, p.readUint32());
+    EXPECT_EQ(0, p.readInt64());
+    EXPECT_EQ(0u, p.readUint64());
+    EXPECT_EQ(0.0f, p.readFloat());
+    EXPECT_EQ(0.0, p.readDouble());
+    EXPECT_FALSE(p.readBool());
+    EXPECT_EQ(nullptr, p.readCString());
+    EXPECT_EQ(0u, p.readString8().size());
+    EXPECT_EQ(0u, p.readString16().size());
+    size_t len = 7;
+    EXPECT_EQ(nullptr, p.readString16Inplace(&len));
+    EXPECT_EQ(0u, len);
+    EXPECT_EQ(nullptr, p.readInplace(4));
+
+    int32_t i32 = 11;
+    uint32_t u32 = 12;
+    int64_t i64 = 13;
+    uint64_t u64 = 14;
+    float f = 15;
+    double d = 16;
+    bool b = true;
+    String8 s8("keep");
+    String16 s16(u"keep");
+    uint8_t buf[4] = {1, 2, 3, 4};
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readInt32(&i32));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readUint32(&u32));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readInt64(&i64));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readUint64(&u64));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readFloat(&f));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readDouble(&d));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readBool(&b));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readString8(&s8));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readString16(&s16));
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.read(buf, sizeof(buf)));
+    // Failed numeric reads leave the output alone.
+    EXPECT_EQ(11, i32);
+    EXPECT_EQ(12u, u32);
+    EXPECT_EQ(13, i64);
+    EXPECT_EQ(14u, u64);
+    EXPECT_EQ(15.0f, f);
+    EXPECT_EQ(16.0, d);
+    EXPECT_TRUE(b);
+    EXPECT_EQ((Bytes{1, 2, 3, 4}), Bytes(buf, buf + 4));
+    EXPECT_EQ(0u, p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+TEST(ParcelReadPastEndTest, ShortTailFailsWithoutMovingTheCursor) {
+    Parcel p;
+    load(&p, {1, 0, 0, 0, 2, 0, 0});
+    int64_t i64 = -1;
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readInt64(&i64));
+    EXPECT_EQ(-1, i64);
+    EXPECT_EQ(0u, p.dataPosition());
+    EXPECT_EQ(1, p.readInt32());
+    EXPECT_EQ(4u, p.dataPosition());
+    EXPECT_EQ(3u, p.dataAvail());
+
+    // Three bytes left: every read of four or more fails and stays put.
+    int32_t i32 = -1;
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readInt32(&i32));
+    EXPECT_EQ(0, p.readInt32());
+    EXPECT_EQ(0.0, p.readDouble());
+    EXPECT_EQ(0u, p.readString8().size());
+    EXPECT_EQ(nullptr, p.readInplace(4));
+    // A raw block needs its padding too.
+    EXPECT_EQ(nullptr, p.readInplace(3));
+    uint8_t two[2] = {};
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.read(two, sizeof(two)));
+    EXPECT_EQ(4u, p.dataPosition());
+    EXPECT_EQ(-1, i32);
+}
+
+TEST(ParcelReadPastEndTest, CursorBeyondTheEndOfAConstParcel) {
+    Parcel writable;
+    writable.writeInt32(42);
+    const Parcel& p = writable;
+
+    p.setDataPosition(1000);
+    EXPECT_EQ(1000u, p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+    EXPECT_EQ(0, p.readInt32());
+    EXPECT_EQ(nullptr, p.readCString());
+    EXPECT_EQ(nullptr, p.readInplace(0));
+    String8 s8;
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.readString8(&s8));
+    EXPECT_EQ(1000u, p.dataPosition());
+
+    // Far positions are held at the largest parcel size, never wrap.
+    p.setDataPosition(SIZE_MAX);
+    EXPECT_GT(p.dataPosition(), p.dataSize());
+    EXPECT_EQ(0u, p.dataAvail());
+    EXPECT_EQ(0u, p.readUint64());
+    EXPECT_EQ(nullptr, p.readInplace(SIZE_MAX));
+    size_t len = 3;
+    EXPECT_EQ(nullptr, p.readString16Inplace(&len));
+    EXPECT_EQ(0u, len);
+
+    // Back inside, reading works again.
+    p.setDataPosition(0);
+    EXPECT_EQ(4u, p.dataAvail());
+    EXPECT_EQ(42, p.readInt32());
+}
+
+TEST(ParcelReadPastEndTest, CStringWithoutTerminatorIsRejected) {
+    Parcel p;
+    load(&p, ascii("abcdefg"));
+    EXPECT_EQ(nullptr, p.readCString());
+    EXPECT_EQ(0u, p.dataPosition());
+
+    // A terminated string that ends the data without padding is accepted; the
+    // cursor stops at the end.
+    Parcel tail;
+    load(&tail, {'x', 'y', 0});
+    EXPECT_STREQ("xy", tail.readCString());
+    EXPECT_EQ(3u, tail.dataPosition());
+    EXPECT_EQ(nullptr, tail.readCString());
+}
+
+// ---------------------------------------------------------------------------
+// Malformed lengths: a bad string never reads outside the data and leaves the
+// cursor at its length word.
+
+TEST(ParcelMalformedTest, String8BadLengthsAreRejected) {
+    struct Case {
+        const char* what;
+        Bytes wire;
+        android::status_t status;
+    } cases[] = {
+            {"negative", cat({le32(static_cast<uint32_t>(-2)), ascii("abcd")}),
+             android::BAD_VALUE},
+            {"minus one", cat({le32(0xffffffffu), ascii("abcd")}), android::BAD_VALUE},
+            {"largest", cat({le32(0x7fffffffu), ascii("abcd")}), android::BAD_VALUE},
+            {"huge", cat({le32(0x7ffffffeu), ascii("abcd")}), android::NOT_ENOUGH_DATA},
+            {"longer than data", cat({le32(8), ascii("abcdefg")}), android::NOT_ENOUGH_DATA},
+            {"no room for NUL", cat({le32(4), ascii("abcd")}), android::NOT_ENOUGH_DATA},
+            {"no NUL", cat({le32(3), ascii("abcd")}), android::BAD_VALUE},
+            {"length only", le32(1), android::NOT_ENOUGH_DATA},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.what);
+        Parcel p;
+        load(&p, c.wire);
+        String8 out("untouched");
+        EXPECT_EQ(c.status, p.readString8(&out));
+        EXPECT_EQ(0u, p.dataPosition());
+        EXPECT_EQ(0u, p.readString8().size());
+        EXPECT_EQ(0u, p.dataPosition());
+        // The length word is still there to be read.
+        uint32_t word = 0;
+        EXPECT_EQ(android::NO_ERROR, p.readUint32(&word));
+        EXPECT_EQ(le32(word), Bytes(c.wire.begin(), c.wire.begin() + 4));
+    }
+}
+
+TEST(ParcelMalformedTest, String16BadLengthsAreRejected) {
+    const Bytes hiUnits = {0x68, 0, 0x69, 0};
+    struct Case {
+        const char* what;
+        Bytes wire;
+    } cases[] = {
+            {"negative", cat({le32(static_cast<uint32_t>(-2)), hiUnits, {0, 0, 0, 0}})},
+            {"most negative", cat({le32(0x80000000u), hiUnits, {0, 0, 0, 0}})},
+            {"largest", cat({le32(0x7fffffffu), hiUnits, {0, 0, 0, 0}})},
+            {"half of largest", cat({le32(0x40000000u), hiUnits, {0, 0, 0, 0}})},
+            {"longer than data", cat({le32(5), hiUnits, {0, 0, 0, 0}})},
+            {"no room for NUL", cat({le32(2), hiUnits})},
+            {"no NUL", cat({le32(2), hiUnits, {0x21, 0, 0, 0}})},
+            {"length only", le32(0)},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.what);
+        Parcel p;
+        load(&p, c.wire);
+        String16 out(u"untouched");
+        android::status_t status = p.readString16(&out);
+        EXPECT_NE(android::NO_ERROR, status);
+        // Only -1 is the null string.
+        EXPECT_NE(android::UNEXPECTED_NULL, status);
+        EXPECT_EQ(0u, out.size());
+        EXPECT_EQ(0u, p.dataPosition());
+        size_t len = 9;
+        EXPECT_EQ(nullptr, p.readString16Inplace(&len));
+        EXPECT_EQ(0u, len);
+        EXPECT_EQ(0u, p.dataPosition());
+        EXPECT_EQ(0u, p.readString16().size());
+        EXPECT_EQ(0u, p.dataPosition());
+    }
+}
+
+TEST(ParcelMalformedTest, RawReadsOfImpossibleLengths) {
+    Parcel p;
+    load(&p, ascii("abcdefgh"));
+    for (size_t len : {static_cast<size_t>(9), static_cast<size_t>(INT32_MAX),
+                       static_cast<size_t>(INT32_MAX) + 1, SIZE_MAX - 2, SIZE_MAX}) {
+        SCOPED_TRACE(len);
+        EXPECT_EQ(nullptr, p.readInplace(len));
+        EXPECT_EQ(0u, p.dataPosition());
+    }
+    uint8_t out[16];
+    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.read(out, 9));
+    EXPECT_NE(android::NO_ERROR, p.read(out, SIZE_MAX));
+    EXPECT_EQ(android::BAD_VALUE, p.read(nullptr, 4));
+    EXPECT_EQ(0u, p.dataPosition());
+    // The whole buffer is still readable.
+    EXPECT_EQ(android::NO_ERROR, p.read(out, 8));
+    EXPECT_EQ(0, memcmp(out, "abcdefgh", 8));
+}
+
+TEST(ParcelMalformedTest, StringsAtAnOddPositionReadCleanly) {
+    // A cursor moved to an odd offset must still give the bytes that are
+    // there, without relying on the buffer's alignment.
+    Parcel p;
+    load(&p, cat({{0x55}, le32(2), {0x68, 0, 0x69, 0, 0, 0, 0, 0}}));
+    p.setDataPosition(1);
+    EXPECT_EQ(u"hi", toU16(p.readString16()));
+    EXPECT_EQ(13u, p.dataPosition());
+
+    p.setDataPosition(1);
+    size_t len = 0;
+    const char16_t* units = p.readString16Inplace(&len);
+    ASSERT_NE(nullptr, units);
+    ASSERT_EQ(2u, len);
+    char16_t copy[2];
+    memcpy(copy, units, sizeof(copy));
+    EXPECT_EQ(u'h', copy[0]);
+    EXPECT_EQ(u'i', copy[1]);
+
+    Parcel q;
+    load(&q, cat({{0x55, 0x66, 0x77}, le32(0x05060708), le32(0x01020304), le32(0x0a0b0c0d),
+                  le32(3), ascii("abc"), {0}}));
+    q.setDataPosition(3);
+    EXPECT_EQ(0x0102030405060708LL, q.readInt64());
+    EXPECT_EQ(0x0a0b0c0du, q.readUint32());
+    EXPECT_EQ("abc", toStd(q.readString8()));
+    EXPECT_EQ(q.dataSize(), q.dataPosition());
+}
+
+// ---------------------------------------------------------------------------
+// Buffer management.
+
+TEST(ParcelBufferTest, AppendFromChecksTheRange) {
+    Parcel src;
+    src.writeInt32(1);
+    src.writeInt32(2);
+    src.writeInt32(3);
+
+    Parcel dst;
+    dst.writeInt32(9);
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(nullptr, 0, 4));
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(&src, 13, 1));
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(&src, 0, 13));
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(&src, 8, 5));
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(&src, 4, SIZE_MAX));
+    EXPECT_EQ(android::BAD_VALUE, dst.appendFrom(&src, SIZE_MAX, 2));
+    EXPECT_EQ(android::NO_ERROR, dst.appendFrom(&src, 12, 0));
+    EXPECT_EQ(4u, dst.dataSize());
+
+    // A valid range lands at the cursor; the source's cursor is left alone.
+    src.setDataPosition(8);
+    EXPECT_EQ(android::NO_ERROR, dst.appendFrom(&src, 4, 8));
+    EXPECT_EQ(8u, src.dataPosition());
+    EXPECT_EQ(12u, dst.dataPosition());
+    EXPECT_EQ(cat({le32(9), le32(2), le32(3)}), bytesOf(dst));
+
+    // In the middle it overwrites, past the end it extends.
+    dst.setDataPosition(4);
+    EXPECT_EQ(android::NO_ERROR, dst.appendFrom(&src, 0, 12));
+    EXPECT_EQ(cat({le32(9), le32(1), le32(2), le32(3)}), bytesOf(dst));
+}
+
+TEST(ParcelBufferTest, AppendFromItself) {
+    Parcel p;
+    load(&p, cat({le32(1), le32(2), le32(3)}));
+    // The buffer is exactly full, so the append must grow it before copying.
+    p.setDataPosition(p.dataSize());
+    ASSERT_EQ(android::NO_ERROR, p.appendFrom(&p, 0, p.dataSize()));
+    EXPECT_EQ(cat({le32(1), le32(2), le32(3), le32(1), le32(2), le32(3)}), bytesOf(p));
+
+    // Overlapping source and destination.
+    p.setDataPosition(4);
+    ASSERT_EQ(android::NO_ERROR, p.appendFrom(&p, 0, 12));
+    EXPECT_EQ(cat({le32(1), le32(1), le32(2), le32(3), le32(2), le32(3)}), bytesOf(p));
+    p.setDataPosition(0);
+    ASSERT_EQ(android::NO_ERROR, p.appendFrom(&p, 8, 16));
+    EXPECT_EQ(cat({le32(2), le32(3), le32(2), le32(3), le32(2), le32(3)}), bytesOf(p));
+    EXPECT_EQ(16u, p.dataPosition());
+}
+
+TEST(ParcelBufferTest, SetDataSizeGrowsWithZeroesAndShrinksTheCursor) {
+    Parcel p;
+    p.writeInt64(-1);
+    p.writeInt64(-1);
+    ASSERT_EQ(16u, p.dataPosition());
+
+    ASSERT_EQ(android::NO_ERROR, p.setDataSize(6));
+    EXPECT_EQ(6u, p.dataSize());
+    EXPECT_EQ(6u, p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+
+    // Growing again, within the capacity and beyond it, never brings the
+    // dropped bytes back.
+    ASSERT_EQ(android::NO_ERROR, p.setDataSize(12));
+    EXPECT_EQ((Bytes{0xff, 0xff, 0xff, 0xff, 0xff, 0xff, 0, 0, 0, 0, 0, 0}), bytesOf(p));
+    ASSERT_EQ(android::NO_ERROR, p.setDataSize(2));
+    size_t big = p.dataCapacity() + 100;
+    ASSERT_EQ(android::NO_ERROR, p.setDataSize(big));
+    ASSERT_EQ(big, p.dataSize());
+    Bytes expected(big, 0);
+    expected[0] = expected[1] = 0xff;
+    EXPECT_EQ(expected, bytesOf(p));
+    EXPECT_EQ(2u, p.dataPosition());
+
+    // So does writing past the end after a shrink: the gap is zero.
+    ASSERT_EQ(android::NO_ERROR, p.setDataSize(0));
+    p.setDataPosition(8);
+    p.writeInt32(7);
+    EXPECT_EQ(cat({le32(0), le32(0), le32(7)}), bytesOf(p));
+
+    EXPECT_EQ(android::BAD_VALUE, p.setDataSize(SIZE_MAX));
+    EXPECT_EQ(12u, p.dataSize());
+}
+
+TEST(ParcelBufferTest, SetDataCopiesAndRejectsNull) {
+    Parcel p;
+    EXPECT_EQ(android::BAD_VALUE, p.setData(nullptr, 4));
+    EXPECT_EQ(android::NO_ERROR, p.setData(nullptr, 0));
+    EXPECT_EQ(0u, p.dataSize());
+
+    Bytes in = cat({le32(5), le32(6), le32(7)});
+    load(&p, in);
+    in[0] = 0;
+    EXPECT_EQ(5, p.readInt32());
+
+    // Taking a slice of its own data.
+    ASSERT_EQ(android::NO_ERROR, p.setData(p.data() + 4, 8));
+    EXPECT_EQ(cat({le32(6), le32(7)}), bytesOf(p));
+    EXPECT_EQ(0u, p.dataPosition());
+}
+
+TEST(ParcelBufferTest, WritesFromItsOwnBytesSurviveGrowth) {
+    // Strings read in place point into the parcel; writing them back to the
+    // same parcel grows (and moves) the buffer under them.
+    Parcel p;
+    load(&p, cat({ascii("hello"), {0, 0, 0}, le32(2), {0x68, 0, 0x69, 0, 0, 0, 0, 0}}));
+    const char* text = p.readCString();
+    ASSERT_STREQ("hello", text);
+    size_t len = 0;
+    const char16_t* units = p.readString16Inplace(&len);
+    ASSERT_NE(nullptr, units);
+    ASSERT_EQ(p.dataSize(), p.dataPosition());
+    ASSERT_EQ(p.dataSize(), p.dataCapacity());
+
+    ASSERT_EQ(android::NO_ERROR, p.writeString16(units, len));
+    // The earlier pointers are stale now; fetch the text again.
+    p.setDataPosition(0);
+    text = p.readCString();
+    p.setDataPosition(p.dataSize());
+    ASSERT_EQ(android::NO_ERROR, p.writeCString(text));
+    p.setDataPosition(0);
+    ASSERT_EQ(android::NO_ERROR, p.write(p.data(), 8));
+
+    p.setDataPosition(0);
+    EXPECT_STREQ("hello", p.readCString());
+    EXPECT_EQ(u"hi", toU16(p.readString16()));
+    EXPECT_EQ(u"hi", toU16(p.readString16()));
+    EXPECT_STREQ("hello", p.readCString());
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+TEST(ParcelBufferTest, FreeDataEmptiesTheParcelForReuse) {
+    Parcel p;
+    p.writeString8(String8("something"));
+    p.freeData();
+    EXPECT_EQ(nullptr, p.data());
+    EXPECT_EQ(0u, p.dataSize());
+    EXPECT_EQ(0u, p.dataCapacity());
+    EXPECT_EQ(0u, p.dataPosition());
+    EXPECT_EQ(0u, p.dataAvail());
+    EXPECT_EQ(0u, p.readString8().size());
+    p.freeData();
+
+    p.writeInt32(3);
+    EXPECT_EQ(le32(3), bytesOf(p));
+    p.setDataPosition(0);
+    EXPECT_EQ(3, p.readInt32());
+}
+
+TEST(ParcelBufferTest, DataAvailFollowsTheCursor) {
+    Parcel p;
+    EXPECT_EQ(0u, p.dataAvail());
+    p.writeInt32(1);
+    p.writeInt64(2);
+    EXPECT_EQ(0u, p.dataAvail());
+    p.setDataPosition(0);
+    EXPECT_EQ(12u, p.dataAvail());
+    p.readInt32();
+    EXPECT_EQ(8u, p.dataAvail());
+    p.setDataPosition(11);
+    EXPECT_EQ(1u, p.dataAvail());
+    p.setDataPosition(12);
+    EXPECT_EQ(0u, p.dataAvail());
+    p.setDataPosition(13);
+    EXPECT_EQ(0u, p.dataAvail());
+}
+
+TEST(ParcelBufferTest, CapacityOnlyGrows) {
+    Parcel p;
+    ASSERT_EQ(android::NO_ERROR, p.setDataCapacity(256));
+    EXPECT_GE(p.dataCapacity(), 256u);
+    EXPECT_EQ(0u, p.dataSize());
+    p.writeInt32(1);
+    ASSERT_EQ(android::NO_ERROR, p.setDataCapacity(8));
+    EXPECT_GE(p.dataCapacity(), 256u);
+    EXPECT_EQ(le32(1), bytesOf(p));
+}
+
+// ---------------------------------------------------------------------------
+// The message record between threads.
+
+namespace {
+
+kelvo::ParcelMessage messageWithBody(Parcel* reply) {
+    Parcel body;
+    body.writeInt32(10);
+    body.writeString8(String8("body"));
+    return kelvo::ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, 3, body, reply);
+}
+
+} // namespace
+
+TEST(ParcelMessageTest, ConstructionCopiesTheBodyFromItsStart) {
+    Parcel body;
+    body.writeInt32(1);
+    body.writeInt32(2);
+    body.setDataPosition(4);
+    Parcel reply;
+    kelvo::ParcelMessage msg(kelvo::MESSAGE_TIMER, 8, body, &reply);
+    EXPECT_EQ(kelvo::MESSAGE_TIMER, msg.type);
+    EXPECT_EQ(8, msg.what);
+    EXPECT_EQ(&reply, msg.getReply());
+    EXPECT_EQ(4u, body.dataPosition());
+    EXPECT_EQ(0u, msg.getParcel().dataPosition());
+    EXPECT_EQ(bytesOf(body), bytesOf(msg.getParcel()));
+    EXPECT_NE(body.data(), msg.getParcel().data());
+
+    kelvo::ParcelMessage empty(kelvo::MESSAGE_TIMER, 1);
+    EXPECT_EQ(0u, empty.getParcel().dataSize());
+    EXPECT_EQ(nullptr, empty.getReply());
+    kelvo::ParcelMessage blank;
+    EXPECT_EQ(-1, blank.type);
+    EXPECT_EQ(-1, blank.what);
+}
+
+TEST(ParcelMessageTest, CopyRewindsTheBodyAndSharesTheReply) {
+    Parcel reply;
+    kelvo::ParcelMessage original = messageWithBody(&reply);
+    EXPECT_EQ(10, original.getParcel().readInt32());
+    ASSERT_EQ(4u, original.getParcel().dataPosition());
+
+    kelvo::ParcelMessage copy(original);
+    EXPECT_EQ(original.type, copy.type);
+    EXPECT_EQ(original.what, copy.what);
+    EXPECT_EQ(&reply, copy.getReply());
+    EXPECT_EQ(0u, copy.getParcel().dataPosition());
+    EXPECT_EQ(4u, original.getParcel().dataPosition());
+    EXPECT_EQ(10, copy.getParcel().readInt32());
+    EXPECT_EQ("body", toStd(copy.getParcel().readString8()));
+    // The bodies are independent.
+    EXPECT_NE(original.getParcel().data(), copy.getParcel().data());
+    copy.data.setDataPosition(0);
+    copy.data.writeInt32(99);
+    original.getParcel().setDataPosition(0);
+    EXPECT_EQ(10, original.getParcel().readInt32());
+}
+
+TEST(ParcelMessageTest, AssignmentReplacesTheBody) {
+    Parcel reply;
+    kelvo::ParcelMessage source = messageWithBody(&reply);
+    source.getParcel().readInt32();
+
+    Parcel longer;
+    for (int i = 0; i < 32; ++i) {
+        longer.writeInt64(i);
+    }
+    kelvo::ParcelMessage target(kelvo::MESSAGE_LOGGER, 1, longer);
+    target.getParcel().setDataPosition(40);
+    target = source;
+    EXPECT_EQ(kelvo::MESSAGE_CUSTOMIZED, target.type);
+    EXPECT_EQ(3, target.what);
+    EXPECT_EQ(&reply, target.getReply());
+    EXPECT_EQ(bytesOf(source.getParcel()), bytesOf(target.getParcel()));
+    EXPECT_EQ(0u, target.getParcel().dataPosition());
+
+    // Assigning a message to itself keeps its body.
+    kelvo::ParcelMessage& alias = target;
+    target = alias;
+    EXPECT_EQ(bytesOf(source.getParcel()), bytesOf(target.getParcel()));
+
+    // An empty body replaces a full one.
+    kelvo::ParcelMessage none(kelvo::MESSAGE_TIMER, 2);
+    target = none;
+    EXPECT_EQ(0u, target.getParcel().dataSize());
+    EXPECT_EQ(nullptr, target.getReply());
+}
