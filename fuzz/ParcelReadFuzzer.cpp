@@ -18,7 +18,7 @@ using android::status_t;
 namespace {
 
 // Largest parcel the self-appends may build.
-constexpr size_t kMaxGrownSize = 1 << 16;
+constexpr size_t kMaxGrownSize = 1 << 14;
 constexpr int kMaxSteps = 512;
 
 void check(bool condition) {

@@ -1,4 +1,5 @@
 #include <dirent.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/ioctl.h>
 #include <unistd.h>
@@ -292,7 +293,7 @@ TEST_F(TimerManagerTest, CallbackReadsOnlyTheDescriptorItIsRegisteredWith) {
     // A descriptor the callback does not own, e.g. a number reused after its
     // timer was removed: not read, dropped from the looper.
     int pipeFds[2];
-    ASSERT_EQ(0, pipe(pipeFds));
+    ASSERT_EQ(0, pipe2(pipeFds, O_NONBLOCK));
     uint64_t eight = 8;
     ASSERT_EQ(static_cast<ssize_t>(sizeof(eight)), write(pipeFds[1], &eight, sizeof(eight)));
     EXPECT_EQ(0, callback->handleEvent(pipeFds[0], android::Looper::EVENT_INPUT, nullptr));
