@@ -8,7 +8,13 @@ FdObserver::FdObserver(const char* name) : android::Thread() {
     mLooper = new android::Looper(true);
     if (name != nullptr && name[0] != '\0') {
         mName = name;
-        run(name, 11);
+    }
+}
+
+void FdObserver::onFirstRef() {
+    android::Thread::onFirstRef();
+    if (!mName.isEmpty()) {
+        run(mName.string(), 11);
     }
 }
 

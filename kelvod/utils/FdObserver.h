@@ -16,6 +16,7 @@ public:
     int32_t addFd(int fd, const android::sp<android::LooperCallback>& callback);
     int32_t removeFd(int fd);
 
+    void onFirstRef() override;
     bool threadLoop() override;
 
 private:

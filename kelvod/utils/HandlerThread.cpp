@@ -19,7 +19,7 @@ void HandlerThread::setSyncTimeoutMs(int64_t ms) {
 }
 
 HandlerThread::HandlerThread(const char* name, int32_t priority)
-    : android::Thread(), mLastId(0) {
+    : android::Thread(), mPriority(0), mLastId(0) {
     if (name == nullptr || name[0] == '\0') {
         KLOGE("Handler name is empty");
         return;
@@ -31,7 +31,16 @@ HandlerThread::HandlerThread(const char* name, int32_t priority)
     }
     // The looper and the name exist before the thread runs.
     mLooper = new android::Looper(false);
-    run(mName.string(), priority);
+    mPriority = priority;
+}
+
+void HandlerThread::onFirstRef() {
+    android::Thread::onFirstRef();
+    // Started once the object is fully built and owned, so the new thread
+    // never sees a half-constructed handler.
+    if (mLooper != nullptr) {
+        run(mName.string(), mPriority);
+    }
 }
 
 HandlerThread::~HandlerThread() {

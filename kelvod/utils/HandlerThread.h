@@ -15,7 +15,8 @@
 
 namespace kelvo {
 
-// A named worker thread with its own looper. Every message gets an id; its
+// A named worker thread with its own looper. The thread starts as soon as the
+// object is first held by a strong pointer. Every message gets an id; its
 // body waits in the pending table until the thread takes it, so the looper
 // message carries nothing but that id. Sends are asynchronous, delayed or
 // synchronous (the caller waits for the handler's status and reply).
@@ -52,6 +53,7 @@ public:
     // Shortens the synchronous wait (tests); 0 or less restores the default.
     static void setSyncTimeoutMs(int64_t ms);
 
+    void onFirstRef() override;
     bool threadLoop() override;
     void handleMessage(const android::Message& message) override;
     virtual int32_t handleParcelMessage(const ParcelMessage& msg) = 0;
@@ -68,6 +70,7 @@ private:
     void releaseWaiters(const int32_t* ids, size_t count);
 
     android::String8 mName;
+    int32_t mPriority;
     android::sp<android::Looper> mLooper;
 
     std::mutex mMessageLock;

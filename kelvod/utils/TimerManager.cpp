@@ -92,8 +92,12 @@ int32_t TimerManager::rescheduleLocked(TimerMap::iterator it, bool replaceTimes,
         KLOGE("Reschedule an invalid timer");
         return -11;
     }
-    int32_t ret =
-        replaceTimes ? it->second->reschedule(firstMs, intervalMs) : it->second->schedule();
+    // Watch the descriptor again: a read failure may have made the looper
+    // drop it, and a re-armed timer that nobody watches would never fire.
+    int32_t ret = mObserver->addFd(it->second->getFd(), it->first);
+    if (ret == 0) {
+        ret = replaceTimes ? it->second->reschedule(firstMs, intervalMs) : it->second->schedule();
+    }
     if (ret != 0) {
         KLOGE("Failed to reschedule timer: %d", ret);
         eraseLocked(it);
