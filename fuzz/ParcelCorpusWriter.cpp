@@ -1,7 +1,7 @@
 // Writes the seed parcels of fuzz_parcel_read, each a well-formed parcel as
 // the daemon's threads exchange them, into the folder given as argument.
 //
-//   fuzz_parcel_corpus_writer fuzz/corpus/parcel_read
+//   parcel_corpus_writer fuzz/corpus/parcel_read
 
 #include <binder/Parcel.h>
 
