@@ -1,6 +1,10 @@
 #include "core/KelvoAgent.h"
 
+#include <atomic>
+#include <cstdlib>
+
 #include "KelvoLog.h"
+#include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
 
 namespace kelvo {
@@ -24,6 +28,8 @@ Factories& factories() {
     static Factories* f = new Factories();
     return *f;
 }
+
+std::atomic<KelvoAgent::ExitHook> gExitHook{&exit};
 
 std::mutex gInstanceLock;
 android::sp<KelvoAgent>* gInstance = nullptr;
@@ -70,7 +76,13 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
     factories().routines[id] = factory;
 }
 
-KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {}
+void KelvoAgent::setExitHook(ExitHook hook) {
+    gExitHook = hook != nullptr ? hook : &exit;
+}
+
+KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {
+    mStorage = new KelvoStorage(this);
+}
 
 android::sp<KelvoOperator> KelvoAgent::getHandler(int32_t id) {
     if (id < 0 || id >= HANDLER_COUNT) {
@@ -150,8 +162,25 @@ void KelvoAgent::startRoutines() {
 }
 
 void KelvoAgent::startStorage() {
-    // Operators register their tables and the storage thread opens the
-    // database here.
+    for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
+        android::sp<KelvoOperator> handler = getHandler(id);
+        if (handler != nullptr) {
+            handler->addSchemaTable();
+        }
+    }
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        android::sp<KelvoOperator> routine = getRoutine(id);
+        if (routine != nullptr) {
+            routine->addSchemaTable();
+        }
+    }
+    if (mStorage->startConnection() < 0) {
+        KLOGE("Failed to start storage");
+        mStorage->closeConnection();
+        // The next start builds a fresh database; its journal goes with it.
+        KelvoUtils::deleteDatabaseFiles(KelvoStorage::kDatabasePath);
+        gExitHook.load()(0);
+    }
 }
 
 void KelvoAgent::startHidlService() {}
@@ -214,14 +243,18 @@ int32_t KelvoAgent::sendToRoutine(int32_t id, int32_t code, const android::Parce
 void KelvoAgent::requestQuery(int32_t code, const android::Parcel& data) {}
 
 int32_t KelvoAgent::noteSamplingUpload(const android::String8& a, const android::String8& b) {
-    return -1;
+    return mStorage == nullptr ? -1 : mStorage->samplingUpload(a, b);
 }
 
 int32_t KelvoAgent::noteRemoteDebug(int32_t kind, const android::String8& text) {
-    return -1;
+    return mStorage == nullptr ? -1 : mStorage->remoteDebug(kind, text);
 }
 
-void KelvoAgent::forceFlushDatabase() {}
+void KelvoAgent::forceFlushDatabase() {
+    if (mStorage != nullptr) {
+        mStorage->flushAllEntries();
+    }
+}
 
 void KelvoAgent::logError(const android::Parcel& data) {
     android::sp<KelvoOperator> system = getHandler(HANDLER_SYSTEM);
@@ -245,6 +278,19 @@ void KelvoAgent::handleDump(android::String8& out) {
     }
 }
 
-void KelvoAgent::cleanTables(int64_t time) {}
+void KelvoAgent::cleanTables(int64_t time) {
+    for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
+        android::sp<KelvoOperator> handler = getHandler(id);
+        if (handler != nullptr) {
+            handler->cleanTables(time);
+        }
+    }
+    for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
+        android::sp<KelvoOperator> routine = getRoutine(id);
+        if (routine != nullptr) {
+            routine->cleanTables(time);
+        }
+    }
+}
 
 } // namespace kelvo

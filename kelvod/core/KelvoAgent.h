@@ -9,6 +9,7 @@
 #include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
+#include "storage/KelvoStorage.h"
 
 namespace kelvo {
 
@@ -45,6 +46,9 @@ public:
     static constexpr const char* kVersion = "000.1.4.0";
 
     typedef android::sp<KelvoOperator> (*OperatorFactory)();
+    // Ends the process when the database cannot be started (replaceable so
+    // tests can watch it).
+    typedef void (*ExitHook)(int status);
 
     // The process-wide agent, created on first use.
     static android::sp<KelvoAgent> getInstance();
@@ -67,6 +71,7 @@ public:
     void cleanTables(int64_t time);
     int64_t getSystemBootTime() const { return mStartTime; }
 
+    android::sp<KelvoStorage> getStorage() const { return mStorage; }
     android::sp<KelvoOperator> getHandler(int32_t id);
     android::sp<KelvoOperator> getRoutine(int32_t id);
 
@@ -74,6 +79,7 @@ public:
     // a null factory leaves the slot empty.
     static void setHandlerFactory(int32_t id, OperatorFactory factory);
     static void setRoutineFactory(int32_t id, OperatorFactory factory);
+    static void setExitHook(ExitHook hook);
 
     KelvoAgent();
 
@@ -93,6 +99,7 @@ private:
     void setRoutine(int32_t id, const android::sp<KelvoOperator>& op);
 
     int64_t mStartTime;
+    android::sp<KelvoStorage> mStorage;
     // Written only during start-up, but read by any thread that logs an
     // error meanwhile: every access goes through the slot lock.
     std::mutex mSlotLock;

@@ -5,13 +5,14 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "storage/StorageOperator.h"
 #include "utils/HandlerThread.h"
 
 namespace kelvo {
 
 // Base of every handler and routine: one worker thread each, started by the
 // agent through early initialization and initialization.
-class KelvoOperator : public HandlerThread {
+class KelvoOperator : public HandlerThread, public StorageOperator {
 public:
     KelvoOperator(const char* name, int32_t accounterType, uint32_t elector);
 

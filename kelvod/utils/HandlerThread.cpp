@@ -19,7 +19,7 @@ void HandlerThread::setSyncTimeoutMs(int64_t ms) {
 }
 
 HandlerThread::HandlerThread(const char* name, int32_t priority)
-    : android::Thread(), mPriority(0), mLastId(0) {
+    : android::Thread(), mPriority(0), mLastId(0), mWakeAt(LLONG_MAX), mDraining(false) {
     if (name == nullptr || name[0] == '\0') {
         KLOGE("Handler name is empty");
         return;
@@ -69,8 +69,30 @@ int32_t HandlerThread::queueMessage(const ParcelMessage& msg) {
     return id;
 }
 
+bool HandlerThread::needWakeLocked(nsecs_t when) {
+    if (mDraining || when >= mWakeAt) {
+        return false;
+    }
+    mWakeAt = when;
+    return true;
+}
+
 void HandlerThread::postMessage(int32_t id, nsecs_t when) {
-    mLooper->sendMessageAtTime(when, this, android::Message(id));
+    bool wake = false;
+    {
+        std::lock_guard<std::mutex> guard(mMessageLock);
+        auto it = mPending.find(id);
+        if (it == mPending.end()) {
+            return;
+        }
+        // Equal times keep their order of arrival.
+        it->second.position = mQueue.emplace(when, id);
+        it->second.queued = true;
+        wake = it->second.position == mQueue.begin() && needWakeLocked(when);
+    }
+    if (wake) {
+        mLooper->sendMessageAtTime(when, this, android::Message(0));
+    }
 }
 
 int32_t HandlerThread::sendMessage(const ParcelMessage& msg) {
@@ -96,7 +118,7 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
         KLOGE("%s is not running or is pending to exit", mName.string());
         return -2;
     }
-    // Queued only: the looper message is posted once the waiter is in place.
+    // Queued only: it is posted once the waiter is in place.
     int32_t id = queueMessage(msg);
 
     std::unique_lock<std::mutex> lock(mSyncLock);
@@ -132,19 +154,22 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
 int32_t HandlerThread::removeMessage(int32_t id) {
     {
         std::lock_guard<std::mutex> guard(mMessageLock);
-        if (mPending.erase(id) == 0) {
+        auto it = mPending.find(id);
+        if (it == mPending.end()) {
             KLOGE("Invalid message id[%d] in %s", id, mName.string());
             return -4;
         }
-    }
-    if (mLooper != nullptr) {
-        mLooper->removeMessages(this, id);
+        if (it->second.queued) {
+            mQueue.erase(it->second.position);
+        }
+        mPending.erase(it);
     }
     releaseWaiters(&id, 1);
     return 0;
 }
 
 void HandlerThread::removeAllMessages() {
+    // The looper's wake-ups hold a reference to this handler.
     if (mLooper != nullptr) {
         mLooper->removeMessages(this);
     }
@@ -156,6 +181,8 @@ void HandlerThread::removeAllMessages() {
             ids.push_back(entry.first);
         }
         mPending.clear();
+        mQueue.clear();
+        mWakeAt = LLONG_MAX;
     }
     releaseWaiters(ids.data(), ids.size());
 }
@@ -184,23 +211,51 @@ void HandlerThread::requestThreadExit() {
 }
 
 void HandlerThread::handleMessage(const android::Message& message) {
-    int32_t id = message.what;
-    std::unordered_map<int32_t, ParcelMessage>::node_type node;
-    {
-        std::lock_guard<std::mutex> guard(mMessageLock);
+    std::unique_lock<std::mutex> lock(mMessageLock);
+    mWakeAt = LLONG_MAX;
+    mDraining = true;
+    for (;;) {
+        if (mQueue.empty()) {
+            break;
+        }
+        Queue::iterator head = mQueue.begin();
+        if (head->first > systemTime(SYSTEM_TIME_MONOTONIC)) {
+            break;
+        }
+        int32_t id = head->second;
+        mQueue.erase(head);
         // The entry leaves the table with its body: no copy.
-        node = mPending.extract(id);
+        auto node = mPending.extract(id);
+        lock.unlock();
+        if (!node.empty()) {
+            node.mapped().queued = false;
+            deliver(id, node.mapped());
+        }
+        lock.lock();
+        if (exitPending()) {
+            break;
+        }
     }
-    if (node.empty()) {
-        KLOGE("Invalid message id[%d] in %s", id, mName.string());
-        return;
+    mDraining = false;
+    bool wake = false;
+    nsecs_t when = 0;
+    if (!mQueue.empty()) {
+        when = mQueue.begin()->first;
+        wake = needWakeLocked(when);
     }
+    lock.unlock();
+    if (wake) {
+        mLooper->sendMessageAtTime(when, this, android::Message(0));
+    }
+}
+
+void HandlerThread::deliver(int32_t id, pending_message& entry) {
     if (exitPending()) {
         // The thread is going away: what is still queued is dropped.
         releaseWaiters(&id, 1);
         return;
     }
-    ParcelMessage& msg = node.mapped();
+    ParcelMessage& msg = entry.msg;
     android::Parcel* callerReply = msg.reply;
     android::Parcel reply;
     msg.reply = &reply;

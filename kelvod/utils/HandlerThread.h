@@ -4,6 +4,7 @@
 
 #include <atomic>
 #include <condition_variable>
+#include <map>
 #include <mutex>
 #include <unordered_map>
 
@@ -17,9 +18,11 @@ namespace kelvo {
 
 // A named worker thread with its own looper. The thread starts as soon as the
 // object is first held by a strong pointer. Every message gets an id; its
-// body waits in the pending table until the thread takes it, so the looper
-// message carries nothing but that id. Sends are asynchronous, delayed or
-// synchronous (the caller waits for the handler's status and reply).
+// body waits in the pending table and its id in a time-ordered queue until
+// the thread takes it. The looper carries at most a wake-up or two for the
+// queue's head, so a deep queue costs log(n) per message, not a looper scan.
+// Sends are asynchronous, delayed or synchronous (the caller waits for the
+// handler's status and reply).
 class HandlerThread : public android::Thread, public android::MessageHandler {
 public:
     // Longest wait of a synchronous send.
@@ -65,8 +68,22 @@ private:
         std::condition_variable cond;
     };
 
+    typedef std::multimap<nsecs_t, int32_t> Queue;
+
+    struct pending_message {
+        explicit pending_message(const ParcelMessage& m) : msg(m) {}
+        ParcelMessage msg;
+        bool queued = false;
+        Queue::iterator position;
+    };
+
     int32_t queueMessage(const ParcelMessage& msg);
     void postMessage(int32_t id, nsecs_t when);
+    // Asks the looper to wake the thread at `when` unless an earlier wake-up
+    // is already due; called with the message lock held, returns whether the
+    // caller must post the wake-up after unlocking.
+    bool needWakeLocked(nsecs_t when);
+    void deliver(int32_t id, pending_message& entry);
     void releaseWaiters(const int32_t* ids, size_t count);
 
     android::String8 mName;
@@ -75,7 +92,13 @@ private:
 
     std::mutex mMessageLock;
     int32_t mLastId;
-    std::unordered_map<int32_t, ParcelMessage> mPending;
+    std::unordered_map<int32_t, pending_message> mPending;
+    Queue mQueue;
+    // Earliest wake-up posted to the looper (LLONG_MAX: none), and whether
+    // the thread is draining the queue right now (then it picks up new
+    // messages itself).
+    nsecs_t mWakeAt;
+    bool mDraining;
 
     std::mutex mSyncLock;
     std::unordered_map<int32_t, sync_result*> mWaiting;

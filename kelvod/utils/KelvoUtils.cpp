@@ -20,4 +20,42 @@ int32_t KelvoUtils::deleteFile(const char* path) {
     return 0;
 }
 
+void KelvoUtils::deleteDatabaseFiles(const char* path) {
+    if (path == nullptr) {
+        return;
+    }
+    deleteFile(path);
+    for (const char* suffix : {"-journal", "-wal", "-shm"}) {
+        std::string companion = std::string(path) + suffix;
+        if (access(RootPath::resolve(companion).c_str(), F_OK) == 0) {
+            deleteFile(companion.c_str());
+        }
+    }
+}
+
+namespace {
+
+android::String8 quote(const char* value, char mark) {
+    android::String8 out;
+    out.append(&mark, 1);
+    for (const char* p = value != nullptr ? value : ""; *p != '\0'; ++p) {
+        if (*p == mark) {
+            out.append(&mark, 1);
+        }
+        out.append(p, 1);
+    }
+    out.append(&mark, 1);
+    return out;
+}
+
+} // namespace
+
+android::String8 KelvoUtils::quoteSqlText(const char* value) {
+    return quote(value, '\'');
+}
+
+android::String8 KelvoUtils::quoteSqlIdentifier(const char* name) {
+    return quote(name, '"');
+}
+
 } // namespace kelvo

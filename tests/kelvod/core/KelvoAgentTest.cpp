@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
+#include <dirent.h>
+#include <unistd.h>
+#include <memory>
 #include <mutex>
 #include <thread>
 #include <string>
@@ -15,6 +18,7 @@ using android::sp;
 using android::String8;
 using kelvo::KelvoAgent;
 using kelvo::KelvoOperator;
+using kelvo::KelvoStorage;
 using kelvo::test::LogCapture;
 using kelvo::test::waitFor;
 
@@ -76,16 +80,41 @@ sp<KelvoOperator> makeRoutine() {
     return new FakeOperator(name.c_str(), true);
 }
 
+std::atomic<int> gExitStatus{-1};
+
+void recordExit(int status) {
+    gExitStatus = status;
+}
+
 class KelvoAgentTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        std::lock_guard<std::mutex> guard(gEventsLock);
-        gEvents.clear();
+        {
+            std::lock_guard<std::mutex> guard(gEventsLock);
+            gEvents.clear();
+        }
+        mRoot.reset(new kelvo::test::TempRoot());
+        gExitStatus = -1;
+        KelvoAgent::setExitHook(recordExit);
     }
     void TearDown() override {
         for (int i = 0; i < kelvo::HANDLER_COUNT; ++i) KelvoAgent::setHandlerFactory(i, nullptr);
         for (int i = 0; i < kelvo::ROUTINE_COUNT; ++i) KelvoAgent::setRoutineFactory(i, nullptr);
+        for (const sp<KelvoAgent>& agent : mAgents) {
+            agent->getStorage()->closeConnection();
+            agent->getStorage()->requestThreadExit();
+        }
+        KelvoAgent::setExitHook(nullptr);
+        mRoot.reset();
     }
+    sp<KelvoAgent> makeAgent() {
+        sp<KelvoAgent> agent = new KelvoAgent();
+        mAgents.push_back(agent);
+        return agent;
+    }
+
+    std::unique_ptr<kelvo::test::TempRoot> mRoot;
+    std::vector<sp<KelvoAgent>> mAgents;
     void installAll() {
         KelvoAgent::OperatorFactory handlers[] = {
                 makeHandler<0>, makeHandler<1>,  makeHandler<2>,  makeHandler<3>,
@@ -105,7 +134,7 @@ protected:
 
 TEST_F(KelvoAgentTest, StartsOperatorsInOrderAndDropsUnsupportedOnes) {
     installAll();
-    sp<KelvoAgent> agent = new KelvoAgent();
+    sp<KelvoAgent> agent = makeAgent();
     LogCapture log;
     EXPECT_EQ(0, agent->initiate());
 
@@ -143,7 +172,7 @@ TEST_F(KelvoAgentTest, StartsOperatorsInOrderAndDropsUnsupportedOnes) {
 TEST_F(KelvoAgentTest, RoutesRequestsByIdAndRefusesBadIds) {
     KelvoAgent::setHandlerFactory(5, makeHandler<5>);
     KelvoAgent::setRoutineFactory(1, makeRoutine<1>);
-    sp<KelvoAgent> agent = new KelvoAgent();
+    sp<KelvoAgent> agent = makeAgent();
     agent->initiate();
 
     Parcel reply;
@@ -168,7 +197,7 @@ TEST_F(KelvoAgentTest, RoutesRequestsByIdAndRefusesBadIds) {
     EXPECT_EQ(0u, log.linesWith("[KelvoAgent.cpp]").size());
     EXPECT_EQ(-11, agent->sendToRoutine(0, 1, Parcel(), &reply, true));
     EXPECT_TRUE(log.contains("sendToRoutine# Invalid routine", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, agent->noteSamplingUpload(String8("a"), String8("b")));
+    EXPECT_GE(agent->noteSamplingUpload(String8("a"), String8("b")), 0);
 
     agent->getHandler(5)->requestThreadExit();
     agent->getRoutine(1)->requestThreadExit();
@@ -176,7 +205,7 @@ TEST_F(KelvoAgentTest, RoutesRequestsByIdAndRefusesBadIds) {
 
 TEST_F(KelvoAgentTest, ErrorLinesReachTheSystemHandlerWhileStartUpRuns) {
     KelvoAgent::setHandlerFactory(0, makeHandler<0>);
-    sp<KelvoAgent> agent = new KelvoAgent();
+    sp<KelvoAgent> agent = makeAgent();
     // Errors are forwarded from other threads while the slots are written.
     std::atomic<bool> stop{false};
     std::thread noisy([&] {
@@ -205,4 +234,27 @@ TEST_F(KelvoAgentTest, ErrorLinesReachTheSystemHandlerWhileStartUpRuns) {
         return false;
     }));
     agent->getHandler(0)->requestThreadExit();
+}
+
+TEST_F(KelvoAgentTest, AnUnusableDatabaseIsMovedAsideAndTheProcessEnds) {
+    mRoot->writeFile(KelvoStorage::kDatabasePath, std::string(8192, '\x5a'));
+    mRoot->writeFile(std::string(KelvoStorage::kDatabasePath) + "-journal", "stale");
+    sp<KelvoAgent> agent = makeAgent();
+    LogCapture log;
+    agent->initiate();
+    EXPECT_EQ(0, gExitStatus.load());
+    EXPECT_TRUE(log.contains("Failed to start storage", ANDROID_LOG_ERROR));
+    // Neither the file nor its journal is left for the next start.
+    EXPECT_NE(0, access((mRoot->path() + KelvoStorage::kDatabasePath).c_str(), F_OK));
+    EXPECT_NE(0, access((mRoot->path() + KelvoStorage::kDatabasePath + "-journal").c_str(), F_OK));
+    // The unusable file was kept aside in the backup folder.
+    std::string backup = mRoot->path() + "/data/log/kelvo/backup";
+    bool kept = false;
+    if (DIR* d = opendir(backup.c_str())) {
+        while (struct dirent* e = readdir(d)) {
+            kept = kept || std::string(e->d_name).rfind("kelvo-", 0) == 0;
+        }
+        closedir(d);
+    }
+    EXPECT_TRUE(kept);
 }

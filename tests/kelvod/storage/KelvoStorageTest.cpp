@@ -1,0 +1,353 @@
+#include <gtest/gtest.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "kelvo/HostProperties.h"
+#include "kelvod/storage/StorageTestUtil.h"
+#include "storage/KelvoStorage.h"
+#include "storage/SchemaTable.h"
+#include "utils/KelvoUtils.h"
+
+using android::Parcel;
+using android::sp;
+using android::String8;
+using kelvo::KelvoStorage;
+using kelvo::column_attribute;
+using kelvo::table_attribute;
+using kelvo::test::DirectDb;
+using kelvo::test::LogCapture;
+using kelvo::test::TempRoot;
+using kelvo::test::waitFor;
+
+namespace {
+
+const column_attribute kScreenColumns[] = {
+        {kelvo::COLUMN_TIME, "timestamp"},
+        {kelvo::COLUMN_INT, "state"},
+};
+const table_attribute kScreenState = {"1.0", 1, 2, kScreenColumns, "raw_screen_state"};
+const table_attribute kScreenStateV11 = {"1.1", 1, 2, kScreenColumns, "raw_screen_state"};
+const table_attribute kScreenStateV110 = {"1.10", 1, 2, kScreenColumns, "raw_screen_state"};
+
+const column_attribute kAboutColumns[] = {
+        {kelvo::COLUMN_TIME, "timestamp"},
+        {kelvo::COLUMN_TEXT, "key"},
+        {kelvo::COLUMN_TEXT, "value"},
+};
+const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
+
+const column_attribute kMixedColumns[] = {
+        {kelvo::COLUMN_TEXT, "name"},
+        {kelvo::COLUMN_LONG, "energy"},
+};
+const table_attribute kMixed = {"2.0", 1, 2, kMixedColumns, "hourly_component_test"};
+
+// An insert parcel of one raw_screen_state row per call.
+void insertScreenRow(KelvoStorage* storage, int64_t time, int32_t state) {
+    Parcel p;
+    p.writeString8(String8(kScreenState.name));
+    p.writeInt32(2);
+    p.writeString8(String8("timestamp"));
+    p.writeInt32(kelvo::COLUMN_TIME);
+    p.writeString8(String8("state"));
+    p.writeInt32(kelvo::COLUMN_INT);
+    p.writeInt32(1);
+    p.writeInt64(time);
+    p.writeInt32(state);
+    ASSERT_GE(storage->insertEntries(p), 0);
+}
+
+void insertAbout(KelvoStorage* storage, const char* key, const char* value) {
+    Parcel p;
+    p.writeString8(String8(kAbout.name));
+    p.writeInt32(3);
+    p.writeString8(String8("timestamp"));
+    p.writeInt32(kelvo::COLUMN_TIME);
+    p.writeString8(String8("key"));
+    p.writeInt32(kelvo::COLUMN_TEXT);
+    p.writeString8(String8("value"));
+    p.writeInt32(kelvo::COLUMN_TEXT);
+    p.writeInt32(1);
+    p.writeInt64(1000);
+    p.writeString8(String8(key));
+    p.writeString8(String8(value));
+    ASSERT_GE(storage->insertEntries(p), 0);
+}
+
+// Rows of raw_screen_state as the daemon's own connection sees them.
+int64_t countThroughStorage(KelvoStorage* storage) {
+    Parcel reply;
+    if (storage->queryEntries(String8("SELECT COUNT(*) FROM raw_screen_state"), &reply) != 0) {
+        return -1;
+    }
+    reply.readInt32();
+    reply.readInt32();
+    return reply.readInt64();
+}
+
+class KelvoStorageTest : public ::testing::Test {
+protected:
+    void SetUp() override { mRoot.reset(new TempRoot()); }
+    void TearDown() override {
+        stop();
+        mRoot.reset();
+    }
+
+    // A storage thread with the given definitions, started on the root.
+    sp<KelvoStorage> start(std::vector<const table_attribute*> tables, int32_t* result = nullptr) {
+        stop();
+        mStorage = new KelvoStorage(nullptr);
+        for (const table_attribute* t : tables) {
+            mStorage->addSchema(*t);
+        }
+        int32_t ret = mStorage->startConnection();
+        if (result != nullptr) {
+            *result = ret;
+        } else {
+            EXPECT_EQ(0, ret);
+        }
+        return mStorage;
+    }
+
+    void stop() {
+        if (mStorage != nullptr) {
+            mStorage->flushAllEntries();
+            mStorage->closeConnection();
+            mStorage->requestThreadExit();
+            mStorage->join();
+            mStorage.clear();
+        }
+    }
+
+    std::string dbPath() const { return mRoot->path() + KelvoStorage::kDatabasePath; }
+
+    std::vector<std::string> backupZips() const {
+        std::vector<std::string> names;
+        std::string dir = mRoot->path() + "/data/log/kelvo/backup";
+        for (const std::string& n : listDir(dir)) {
+            if (n.size() > 4 && n.compare(n.size() - 4, 4, ".zip") == 0) names.push_back(n);
+        }
+        return names;
+    }
+
+    static std::vector<std::string> listDir(const std::string& dir) {
+        std::vector<std::string> names;
+        if (DIR* d = opendir(dir.c_str())) {
+            while (struct dirent* e = readdir(d)) {
+                if (e->d_name[0] != '.') names.push_back(e->d_name);
+            }
+            closedir(d);
+        }
+        return names;
+    }
+
+    std::unique_ptr<TempRoot> mRoot;
+    sp<KelvoStorage> mStorage;
+};
+
+} // namespace
+
+TEST_F(KelvoStorageTest, CreatesTablesWithExactTextsAndOneVersionRowEach) {
+    start({&kScreenState, &kMixed});
+    DirectDb db(dbPath());
+    ASSERT_TRUE(db.ok());
+    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE raw_screen_state(id INTEGER PRIMARY KEY, "
+                                       "timestamp INTEGER, formatted_timestamp VARCHAR, state "
+                                       "INTEGER)"},
+              db.column("SELECT sql FROM sqlite_master WHERE name = 'raw_screen_state'"));
+    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE hourly_component_test(id INTEGER PRIMARY "
+                                       "KEY, name VARCHAR, energy INTEGER)"},
+              db.column("SELECT sql FROM sqlite_master WHERE name = 'hourly_component_test'"));
+    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE schema_version(module VARCHAR, version "
+                                       "VARCHAR)"},
+              db.column("SELECT sql FROM sqlite_master WHERE name = 'schema_version'"));
+    EXPECT_EQ((std::vector<std::string>{"hourly_component_test=2.0", "raw_screen_state=1.0",
+                                        "schema_version=1.0"}),
+              db.column("SELECT module || '=' || version FROM schema_version ORDER BY module"));
+    // The directory and file modes of the database.
+    struct stat st = {};
+    ASSERT_EQ(0, stat(dbPath().c_str(), &st));
+    EXPECT_EQ(0664u, st.st_mode & 0777);
+}
+
+TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlush) {
+    start({&kScreenState});
+    for (int i = 0; i < 300; ++i) {
+        insertScreenRow(mStorage.get(), 1000 + i, i % 2);
+    }
+    // Queries read the disk only: 300 buffered requests are not there yet.
+    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    insertScreenRow(mStorage.get(), 5000, 1);
+    EXPECT_EQ(301, countThroughStorage(mStorage.get()));
+
+    insertScreenRow(mStorage.get(), 6000, 0);
+    EXPECT_EQ(301, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(302, countThroughStorage(mStorage.get()));
+
+    DirectDb db(dbPath());
+    EXPECT_EQ(1, db.scalar("SELECT COUNT(*) FROM raw_screen_state WHERE timestamp = 5000 AND "
+                           "state = 1"));
+}
+
+TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
+    kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.A");
+    start({&kScreenState, &kAbout});
+    insertScreenRow(mStorage.get(), 1000, 1);
+    insertAbout(mStorage.get(), "software_version", "BUILD.A");
+
+    // Same definitions, same build: the rows stay.
+    start({&kScreenState, &kAbout});
+    EXPECT_EQ(1, countThroughStorage(mStorage.get()));
+    EXPECT_TRUE(backupZips().empty());
+
+    // "1.1" is not "1.10": rebuilt, the old database backed up as a zip.
+    start({&kScreenStateV11, &kAbout});
+    insertScreenRow(mStorage.get(), 2000, 1);
+    insertAbout(mStorage.get(), "software_version", "BUILD.A");
+    start({&kScreenStateV110, &kAbout});
+    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    // One backup per rebuild.
+    EXPECT_EQ(2u, backupZips().size());
+    {
+        DirectDb db(dbPath());
+        EXPECT_EQ(std::vector<std::string>{"1.10"},
+                  db.column("SELECT version FROM schema_version WHERE module = "
+                            "'raw_screen_state'"));
+    }
+    insertScreenRow(mStorage.get(), 3000, 1);
+    insertAbout(mStorage.get(), "software_version", "BUILD.A");
+    stop();
+
+    // One version row missing: rebuilt although every present row matches.
+    {
+        DirectDb db(dbPath());
+        ASSERT_EQ(SQLITE_OK, db.exec("DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'"));
+    }
+    start({&kScreenStateV110, &kAbout});
+    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    insertScreenRow(mStorage.get(), 4000, 1);
+    insertAbout(mStorage.get(), "software_version", "BUILD.A");
+    stop();
+
+    // A duplicate module row: rebuilt.
+    {
+        DirectDb db(dbPath());
+        // The right number of rows, each matching on its own.
+        ASSERT_EQ(SQLITE_OK, db.exec("UPDATE schema_version SET module = 'raw_screen_state', "
+                                     "version = '1.10' WHERE module = 'about_kelvo_daemon'"));
+    }
+    LogCapture log;
+    start({&kScreenStateV110, &kAbout});
+    EXPECT_TRUE(log.contains("schema mismatch, duplicate records", ANDROID_LOG_ERROR));
+    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    insertScreenRow(mStorage.get(), 5000, 1);
+    insertAbout(mStorage.get(), "software_version", "BUILD.A");
+    stop();
+
+    // A new build: rebuilt.
+    kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.B");
+    log.clear();
+    start({&kScreenStateV110, &kAbout});
+    EXPECT_TRUE(log.contains("Software version: BUILD.A, current is BUILD.B", ANDROID_LOG_INFO));
+    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+}
+
+TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
+    start({&kScreenState});
+    stop();
+    {
+        DirectDb db(dbPath());
+        ASSERT_EQ(SQLITE_OK, db.exec("CREATE INDEX idx_state ON raw_screen_state(state)"));
+        ASSERT_EQ(SQLITE_OK,
+                  db.exec("CREATE TABLE legacy(id INTEGER PRIMARY KEY AUTOINCREMENT, v TEXT)"));
+        ASSERT_EQ(SQLITE_OK, db.exec("INSERT INTO legacy(v) VALUES ('x')"));
+    }
+    start({&kScreenStateV11});
+    DirectDb db(dbPath());
+    EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
+                                                    "'legacy'"));
+    EXPECT_EQ(std::vector<std::string>{"1.1"},
+              db.column("SELECT version FROM schema_version WHERE module = 'raw_screen_state'"));
+}
+
+TEST_F(KelvoStorageTest, FlushPeriodComesFromItsPropertyWithAFloorOfOneSecond) {
+    kelvo::HostProperties::setForTest("persist.storage.timer.duration", "500000000");
+    {
+        sp<KelvoStorage> s = new KelvoStorage(nullptr);
+        EXPECT_EQ(180000000000LL, s->getFlushPeriodNs());
+        s->requestThreadExit();
+    }
+    kelvo::HostProperties::setForTest("persist.storage.timer.duration", "1000000000");
+    // The periodic flush also runs after a start that kept the database.
+    start({&kScreenState});
+    EXPECT_EQ(1000000000LL, mStorage->getFlushPeriodNs());
+    stop();
+    start({&kScreenState});
+    insertScreenRow(mStorage.get(), 1000, 1);
+    EXPECT_TRUE(waitFor([&] { return countThroughStorage(mStorage.get()) == 1; },
+                        std::chrono::milliseconds(5000)));
+}
+
+TEST_F(KelvoStorageTest, RowsQueuedBeforeTheStartWaitForTheTables) {
+    mStorage = new KelvoStorage(nullptr);
+    mStorage->addSchema(kScreenState);
+    LogCapture log;
+    for (int i = 0; i < 350; ++i) {
+        insertScreenRow(mStorage.get(), 1000 + i, 1);
+    }
+    ASSERT_EQ(0, mStorage->startConnection());
+    EXPECT_FALSE(log.contains("reach upper limit"));
+    EXPECT_EQ(350, countThroughStorage(mStorage.get()));
+}
+
+TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
+    start({&kScreenState});
+    insertScreenRow(mStorage.get(), 1000, 1);
+    {
+        // Another connection reads inside a transaction through the whole
+        // flush: the insert gets its write lock, the commit never does.
+        DirectDb other(dbPath());
+        ASSERT_EQ(SQLITE_OK, other.exec("BEGIN"));
+        ASSERT_EQ(0, other.scalar("SELECT COUNT(*) FROM raw_screen_state"));
+        EXPECT_EQ(-17, mStorage->flushAllEntries());
+        other.exec("COMMIT");
+    }
+    insertScreenRow(mStorage.get(), 2000, 0);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    insertScreenRow(mStorage.get(), 3000, 0);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    DirectDb db(dbPath());
+    EXPECT_EQ(2, db.scalar("SELECT COUNT(*) FROM raw_screen_state WHERE timestamp >= 2000"));
+}
+
+TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {
+    start({&kScreenState});
+    LogCapture log;
+    EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_STORAGE_ENTRY, 8)));
+    EXPECT_TRUE(log.contains("Unknow entry type: 8", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, 9)));
+    EXPECT_TRUE(log.contains("Invalid tag: 9", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_TIMER, 0)));
+    EXPECT_TRUE(log.contains("Unknow message type: 2", ANDROID_LOG_ERROR));
+    Parcel reply;
+    EXPECT_EQ(-17, mStorage->queryEntries(String8("SELECT * FROM nothing_here"), &reply));
+    EXPECT_EQ(-17, mStorage->executeEntry(String8("DELETE FROM raw_screen_state; DROP TABLE x"),
+                                          true));
+}
+
+TEST_F(KelvoStorageTest, CleaningFlushesBacksUpAndVacuums) {
+    start({&kScreenState});
+    insertScreenRow(mStorage.get(), 1000, 1);
+    EXPECT_GE(mStorage->cleanDatabase(86400000), 0);
+    // The clean runs on the storage thread; a flush after it has returned.
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(1, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(1u, backupZips().size());
+}

@@ -1,0 +1,235 @@
+#include <gtest/gtest.h>
+
+#include <string>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "core/KelvoAgent.h"
+#include "kelvod/storage/StorageTestUtil.h"
+#include "storage/StorageOperator.h"
+#include "utils/KelvoUtils.h"
+
+using android::Parcel;
+using android::sp;
+using android::String8;
+using kelvo::KelvoAgent;
+using kelvo::KelvoStorage;
+using kelvo::StorageOperator;
+using kelvo::column_attribute;
+using kelvo::table_attribute;
+using kelvo::test::DirectDb;
+using kelvo::test::LogCapture;
+using kelvo::test::TempRoot;
+
+namespace {
+
+const column_attribute kForegroundColumns[] = {
+        {kelvo::COLUMN_TIME, "timestamp"},
+        {kelvo::COLUMN_TEXT, "name"},
+};
+const table_attribute kForeground = {"1.0", 1, 2, kForegroundColumns, "raw_foreground"};
+
+const column_attribute kHourlyColumns[] = {
+        {kelvo::COLUMN_TIME, "timestamp"},
+        {kelvo::COLUMN_TEXT, "name"},
+        {kelvo::COLUMN_INT, "count"},
+        {kelvo::COLUMN_LONG, "energy"},
+};
+const table_attribute kHourly = {"1.0", 1, 4, kHourlyColumns, "hourly_test"};
+
+const column_attribute kAboutColumns[] = {
+        {kelvo::COLUMN_TIME, "timestamp"},
+        {kelvo::COLUMN_TEXT, "key"},
+        {kelvo::COLUMN_TEXT, "value"},
+};
+const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
+
+class StorageOperatorTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mRoot.reset(new TempRoot());
+        mStorage = KelvoAgent::getInstance()->getStorage();
+        ASSERT_NE(nullptr, mStorage.get());
+        StorageOperator::addSchema(kForeground);
+        StorageOperator::addSchema(kHourly);
+        StorageOperator::addSchema(kAbout);
+        ASSERT_EQ(0, mStorage->startConnection());
+    }
+    void TearDown() override {
+        mStorage->flushAllEntries();
+        mStorage->closeConnection();
+        mRoot.reset();
+    }
+    DirectDb db() const { return DirectDb(mRoot->path() + KelvoStorage::kDatabasePath); }
+
+    std::unique_ptr<TempRoot> mRoot;
+    sp<KelvoStorage> mStorage;
+};
+
+void foregroundRow(Parcel* rows, int64_t time, const char* name) {
+    rows->writeInt64(time);
+    rows->writeString8(String8(name));
+}
+
+} // namespace
+
+TEST_F(StorageOperatorTest, InsertsBatchesWithinTheLimit) {
+    Parcel empty;
+    EXPECT_EQ(0, StorageOperator::insertEntries(kForeground, empty, 3, false));
+    Parcel one;
+    foregroundRow(&one, 1000, "com.example.a");
+    EXPECT_EQ(0, StorageOperator::insertEntries(kForeground, one, 0, false));
+
+    Parcel many;
+    for (int i = 0; i < 5000; ++i) foregroundRow(&many, 1000 + i, "com.example.many");
+    EXPECT_EQ(0, StorageOperator::insertEntries(kForeground, many, 5000, false));
+    LogCapture log;
+    foregroundRow(&many, 99999, "com.example.many");
+    EXPECT_EQ(-5, StorageOperator::insertEntries(kForeground, many, 5001, false));
+    EXPECT_TRUE(log.contains("Insert entries count(5001) reach limit(5000), table: raw_foreground",
+                             ANDROID_LOG_ERROR));
+
+    // From the current position: a prefix the caller has read is skipped.
+    Parcel prefixed;
+    prefixed.writeInt32(42);
+    foregroundRow(&prefixed, 7, "com.example.after");
+    prefixed.setDataPosition(0);
+    prefixed.readInt32();
+    EXPECT_EQ(0, StorageOperator::insertEntries(kForeground, prefixed, 1, true));
+
+    EXPECT_EQ(0, StorageOperator::forceFlushEntries());
+    EXPECT_EQ(5000, db().scalar("SELECT COUNT(*) FROM raw_foreground WHERE name = "
+                                "'com.example.many'"));
+    EXPECT_EQ(std::vector<std::string>{"7"},
+              db().column("SELECT timestamp FROM raw_foreground WHERE name = "
+                          "'com.example.after'"));
+    EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground WHERE timestamp = 1000 AND "
+                             "name = 'com.example.a'"));
+}
+
+TEST_F(StorageOperatorTest, QueriesCheckTheirShape) {
+    Parcel rows;
+    foregroundRow(&rows, 1000, "a");
+    foregroundRow(&rows, 2000, "b");
+    StorageOperator::insertEntries(kForeground, rows, 2, false);
+    StorageOperator::forceFlushEntries();
+
+    Parcel reply;
+    int32_t count = -1;
+    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
+                         String8("SELECT timestamp, name FROM raw_foreground ORDER BY timestamp"),
+                         &reply, 2, count));
+    ASSERT_EQ(2, count);
+    EXPECT_EQ(1000, reply.readInt64());
+    EXPECT_STREQ("a", reply.readString8().string());
+    EXPECT_EQ(2000, reply.readInt64());
+    EXPECT_STREQ("b", reply.readString8().string());
+
+    LogCapture log;
+    Parcel mismatch;
+    EXPECT_EQ(-16, StorageOperator::queryEntriesSimple(
+                           String8("SELECT id, timestamp, name FROM raw_foreground"), &mismatch, 2,
+                           count));
+    EXPECT_TRUE(log.contains("Mismatch columns: 3, 2", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8(""), &mismatch, 2, count));
+    EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8("SELECT 1"), nullptr, 1, count));
+    EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8("SELECT 1"), &mismatch, 0, count));
+}
+
+TEST_F(StorageOperatorTest, UpdateReplacesTheRowOfItsKeyAndQuotesValues) {
+    std::string key = "software_version";
+    String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText(key.c_str());
+    for (const char* value : {"A", "B", "it's C"}) {
+        Parcel row;
+        row.writeInt64(1000);
+        row.writeString8(String8(key.c_str()));
+        row.writeString8(String8(value));
+        EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, condition.string()));
+    }
+    // A key whose value carries a quote is still matched exactly.
+    String8 odd = String8("key = ") + kelvo::KelvoUtils::quoteSqlText("o'key");
+    Parcel row;
+    row.writeInt64(1000);
+    row.writeString8(String8("o'key"));
+    row.writeString8(String8("v1"));
+    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, odd.string()));
+    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, odd.string()));
+    StorageOperator::forceFlushEntries();
+    EXPECT_EQ((std::vector<std::string>{"o'key=v1", "software_version=it's C"}),
+              db().column("SELECT key || '=' || value FROM about_kelvo_daemon ORDER BY key"));
+}
+
+TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
+    Parcel old;
+    foregroundRow(&old, 100, "old");
+    StorageOperator::insertEntries(kForeground, old, 1, false);
+    StorageOperator::forceFlushEntries();
+    Parcel buffered;
+    foregroundRow(&buffered, 200, "buffered");
+    StorageOperator::insertEntries(kForeground, buffered, 1, false);
+    // The buffered old row survives a clean queued right after it.
+    EXPECT_EQ(0, StorageOperator::cleanObsoleteEntries("raw_foreground", 500, "timestamp"));
+    StorageOperator::forceFlushEntries();
+    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
+
+    // A delete flushes first, so buffered rows are subject to it.
+    Parcel more;
+    foregroundRow(&more, 300, "more");
+    StorageOperator::insertEntries(kForeground, more, 1, false);
+    EXPECT_EQ(0, StorageOperator::deleteEntries("raw_foreground", "timestamp >= 300"));
+    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
+
+    EXPECT_EQ(0, StorageOperator::cleanAllEntries("raw_foreground"));
+    StorageOperator::forceFlushEntries();
+    EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground"));
+    EXPECT_EQ(-5, StorageOperator::deleteEntries(nullptr, "1"));
+    EXPECT_EQ(-5, StorageOperator::cleanObsoleteEntries("raw_foreground", 1, nullptr));
+    EXPECT_EQ(-5, StorageOperator::cleanAllEntries(nullptr));
+}
+
+TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
+    Parcel rows;
+    foregroundRow(&rows, 1000, "a");
+    foregroundRow(&rows, 2000, "a");
+    foregroundRow(&rows, 3000, "b");
+    StorageOperator::insertEntries(kForeground, rows, 3, false);
+    StorageOperator::forceFlushEntries();
+
+    Parcel reply;
+    int32_t count = 0;
+    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
+                         String8("SELECT name, COUNT(*), SUM(timestamp) FROM raw_foreground "
+                                 "GROUP BY name ORDER BY name"),
+                         &reply, 3, count));
+    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, reply, 3600000));
+    StorageOperator::forceFlushEntries();
+    EXPECT_EQ((std::vector<std::string>{"3600000 a 2 3000", "3600000 b 1 3000"}),
+              db().column("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
+                          "hourly_test ORDER BY name"));
+
+    // An empty result inserts nothing; a result of the wrong shape neither.
+    Parcel none;
+    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
+                         String8("SELECT name, COUNT(*), SUM(timestamp) FROM raw_foreground "
+                                 "WHERE name = 'zzz' GROUP BY name"),
+                         &none, 3, count));
+    EXPECT_EQ(0, count);
+    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, none, 7200000));
+    LogCapture log;
+    Parcel wrong;
+    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(String8("SELECT name FROM raw_foreground"),
+                                                     &wrong, 1, count));
+    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, wrong, 7200000));
+    EXPECT_TRUE(log.contains("Table column count not match", ANDROID_LOG_ERROR));
+    // A reply that announces more rows than it holds stores nothing.
+    Parcel truncated;
+    truncated.writeInt32(3);
+    truncated.writeInt32(2);
+    truncated.writeString8(String8("x"));
+    truncated.writeInt64(1);
+    truncated.writeInt64(2);
+    EXPECT_EQ(-9, StorageOperator::logSimpleQueryResult(kHourly, truncated, 7200000));
+    StorageOperator::forceFlushEntries();
+    EXPECT_EQ(2, db().scalar("SELECT COUNT(*) FROM hourly_test"));
+}

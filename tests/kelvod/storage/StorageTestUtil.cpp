@@ -1,0 +1,52 @@
+#include "kelvod/storage/StorageTestUtil.h"
+
+namespace kelvo {
+namespace test {
+
+DirectDb::DirectDb(const std::string& path) {
+    if (sqlite3_open_v2(path.c_str(), &mDb, SQLITE_OPEN_READWRITE, nullptr) != SQLITE_OK) {
+        sqlite3_close(mDb);
+        mDb = nullptr;
+        return;
+    }
+    sqlite3_busy_timeout(mDb, 2000);
+}
+
+DirectDb::~DirectDb() {
+    sqlite3_close(mDb);
+}
+
+std::vector<std::string> DirectDb::column(const std::string& sql) const {
+    std::vector<std::string> out;
+    sqlite3_stmt* stmt = nullptr;
+    if (mDb == nullptr || sqlite3_prepare_v2(mDb, sql.c_str(), -1, &stmt, nullptr) != SQLITE_OK) {
+        out.push_back(std::string("error: ") + (mDb != nullptr ? sqlite3_errmsg(mDb) : "closed"));
+        sqlite3_finalize(stmt);
+        return out;
+    }
+    int rc;
+    while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
+        const unsigned char* text = sqlite3_column_text(stmt, 0);
+        out.push_back(text != nullptr ? reinterpret_cast<const char*>(text) : "");
+    }
+    if (rc != SQLITE_DONE) {
+        out.push_back(std::string("error: ") + sqlite3_errmsg(mDb));
+    }
+    sqlite3_finalize(stmt);
+    return out;
+}
+
+long long DirectDb::scalar(const std::string& sql) const {
+    std::vector<std::string> rows = column(sql);
+    if (rows.empty() || rows[0].rfind("error:", 0) == 0) {
+        return -1;
+    }
+    return std::stoll(rows[0]);
+}
+
+int DirectDb::exec(const std::string& sql) const {
+    return mDb == nullptr ? SQLITE_ERROR : sqlite3_exec(mDb, sql.c_str(), nullptr, nullptr, nullptr);
+}
+
+} // namespace test
+} // namespace kelvo

@@ -1,0 +1,197 @@
+#include <gtest/gtest.h>
+#include <stdio.h>
+#include <sys/stat.h>
+#include <unistd.h>
+#include <ziparchive/zip_archive.h>
+#include <ziparchive/zip_writer.h>
+
+#include <fstream>
+#include <map>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "common/TestEnv.h"
+#include "utils/ZipUtils.h"
+
+using kelvo::ZipUtils;
+using kelvo::test::LogCapture;
+using kelvo::test::TempRoot;
+
+namespace {
+
+constexpr int64_t kNoLimit = 1 << 30;
+
+void writeFile(const std::string& path, const std::string& content) {
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << content;
+}
+
+std::string readFile(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream ss;
+    ss << in.rdbuf();
+    return ss.str();
+}
+
+bool exists(const std::string& path) {
+    struct stat st = {};
+    return lstat(path.c_str(), &st) == 0;
+}
+
+// Entry name -> content, read with the library's own reader.
+std::map<std::string, std::string> readZip(const std::string& path) {
+    std::map<std::string, std::string> entries;
+    ZipArchiveHandle handle = nullptr;
+    if (OpenArchive(path.c_str(), &handle) != 0) {
+        if (handle != nullptr) {
+            CloseArchive(handle);
+        }
+        return entries;
+    }
+    void* cookie = nullptr;
+    if (StartIteration(handle, &cookie) == 0) {
+        ZipEntry entry = {};
+        std::string name;
+        while (Next(cookie, &entry, &name) == 0) {
+            std::string data(entry.uncompressed_length, '\0');
+            ExtractToMemory(handle, &entry, reinterpret_cast<uint8_t*>(&data[0]),
+                            entry.uncompressed_length);
+            entries[name] = data;
+        }
+        EndIteration(cookie);
+    }
+    CloseArchive(handle);
+    return entries;
+}
+
+// A zip with entries named at will, as a hostile or broken one could be.
+void craftZip(const std::string& path,
+              const std::vector<std::pair<std::string, std::string>>& entries) {
+    FILE* fp = fopen(path.c_str(), "wb");
+    ASSERT_NE(nullptr, fp);
+    {
+        ZipWriter writer(fp);
+        for (const auto& entry : entries) {
+            ASSERT_EQ(0, writer.StartEntry(entry.first, ZipWriter::kCompress));
+            ASSERT_EQ(0, writer.WriteBytes(entry.second.data(), entry.second.size()));
+            ASSERT_EQ(0, writer.FinishEntry());
+        }
+        ASSERT_EQ(0, writer.Finish());
+    }
+    fclose(fp);
+}
+
+class ZipUtilsTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mDir = mRoot.path() + "/work";
+        mDest = mRoot.path() + "/dest";
+        mkdir(mDir.c_str(), 0775);
+        mkdir(mDest.c_str(), 0775);
+    }
+
+    TempRoot mRoot;
+    LogCapture mLog;
+    std::string mDir;
+    std::string mDest;
+};
+
+} // namespace
+
+TEST_F(ZipUtilsTest, ZippedFilesComeBackUnchanged) {
+    std::string big;
+    for (int i = 0; i < 5000; ++i) {
+        big += std::to_string(i * 7919 % 104729) + ",";
+    }
+    writeFile(mDir + "/kelvo-1.db", big);
+    writeFile(mDir + "/kelvo-2.db", "");
+    writeFile(mDir + "/notes.txt", "not a database");
+    std::string zip = mDir + "/out.zip";
+
+    ASSERT_EQ(0, ZipUtils::zipFiles(
+                     zip.c_str(), {mDir + "/kelvo-1.db", mDir + "/kelvo-2.db", mDir + "/notes.txt"},
+                     false));
+    std::map<std::string, std::string> entries = readZip(zip);
+    ASSERT_EQ(3u, entries.size());
+    EXPECT_EQ(big, entries["kelvo-1.db"]);
+    EXPECT_EQ("", entries["kelvo-2.db"]);
+
+    // Only the entries with the suffix are extracted, readable by the group.
+    ASSERT_EQ(0, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
+    EXPECT_EQ(big, readFile(mDest + "/kelvo-1.db"));
+    EXPECT_TRUE(exists(mDest + "/kelvo-2.db"));
+    EXPECT_FALSE(exists(mDest + "/notes.txt"));
+    struct stat st = {};
+    ASSERT_EQ(0, stat((mDest + "/kelvo-1.db").c_str(), &st));
+    EXPECT_EQ(0664u, st.st_mode & 0777);
+
+    // With the parent directory kept, the entry carries it.
+    std::string withParent = mDir + "/parent.zip";
+    ASSERT_EQ(0, ZipUtils::zipFiles(withParent.c_str(), {mDir + "/kelvo-2.db"}, true));
+    EXPECT_EQ(1u, readZip(withParent).count("work/kelvo-2.db"));
+}
+
+TEST_F(ZipUtilsTest, AZipMissingAFileIsAFailure) {
+    writeFile(mDir + "/kelvo-1.db", "first");
+    std::string zip = mDir + "/out.zip";
+    std::string missing = mDir + "/kelvo-2.db";
+    EXPECT_EQ(-14, ZipUtils::zipFiles(zip.c_str(), {mDir + "/kelvo-1.db", missing}, false));
+    EXPECT_TRUE(mLog.contains("Failed to add file: " + missing, ANDROID_LOG_ERROR));
+
+    EXPECT_EQ(-5, ZipUtils::zipFiles(zip.c_str(), {}, false));
+    EXPECT_EQ(-5, ZipUtils::zipFiles(nullptr, {mDir + "/kelvo-1.db"}, false));
+    EXPECT_EQ(-14, ZipUtils::zipFiles(zip.c_str(), {mDir + "/"}, false));
+    EXPECT_TRUE(mLog.contains("Empty src file name", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-14, ZipUtils::zipFiles(zip.c_str(), {""}, false));
+    EXPECT_TRUE(mLog.contains("Empty src file", ANDROID_LOG_ERROR));
+}
+
+TEST_F(ZipUtilsTest, NeverWritesThroughExistingNames) {
+    std::string victim = mRoot.path() + "/victim";
+    writeFile(victim, "precious");
+    writeFile(mDir + "/kelvo-1.db", "first");
+    std::string softLink = mDir + "/soft.zip";
+    std::string hardLink = mDir + "/hard.zip";
+    ASSERT_EQ(0, symlink(victim.c_str(), softLink.c_str()));
+    ASSERT_EQ(0, link(victim.c_str(), hardLink.c_str()));
+    EXPECT_EQ(-14, ZipUtils::zipFiles(softLink.c_str(), {mDir + "/kelvo-1.db"}, false));
+    EXPECT_EQ(-14, ZipUtils::zipFiles(hardLink.c_str(), {mDir + "/kelvo-1.db"}, false));
+
+    // Extraction leaves links and other files of the same name alone too.
+    std::string zip = mDir + "/in.zip";
+    craftZip(zip, {{"linked.db", "payload"}, {"taken.db", "payload"}});
+    ASSERT_EQ(0, symlink(victim.c_str(), (mDest + "/linked.db").c_str()));
+    writeFile(mDest + "/taken.db", "someone else's");
+    EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
+    EXPECT_EQ("someone else's", readFile(mDest + "/taken.db"));
+    EXPECT_TRUE(exists(mDest + "/linked.db"));
+    EXPECT_EQ("precious", readFile(victim));
+}
+
+TEST_F(ZipUtilsTest, UnzipRefusesEntriesLeavingTheDestination) {
+    std::string zip = mDir + "/hostile.zip";
+    craftZip(zip, {{"../x.db", "escape"}, {"a/b.db", "nested"}, {"..", "dots"}, {"ok.db", "fine"}});
+
+    EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
+    EXPECT_EQ("fine", readFile(mDest + "/ok.db"));
+    EXPECT_FALSE(exists(mRoot.path() + "/x.db"));
+    EXPECT_FALSE(exists(mDest + "/a"));
+    EXPECT_EQ(2u, mLog.count("Refuse zip entry", ANDROID_LOG_ERROR));
+}
+
+TEST_F(ZipUtilsTest, UnzipRefusesOversizedEntriesAndBrokenZips) {
+    std::string zip = mDir + "/in.zip";
+    craftZip(zip, {{"small.db", std::string(100, 's')}, {"large.db", std::string(4096, 'l')}});
+    EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", 1000));
+    EXPECT_EQ(std::string(100, 's'), readFile(mDest + "/small.db"));
+    EXPECT_FALSE(exists(mDest + "/large.db"));
+    EXPECT_TRUE(mLog.contains("Zip entry is too large: large.db", ANDROID_LOG_ERROR));
+
+    std::string broken = mDir + "/broken.zip";
+    writeFile(broken, "PK but not really a zip");
+    EXPECT_EQ(-14, ZipUtils::unzipFiles(broken.c_str(), mDest.c_str(), ".db", kNoLimit));
+    EXPECT_TRUE(mLog.contains("Failed to open zip file: " + broken, ANDROID_LOG_ERROR));
+    std::string missing = mDir + "/missing.zip";
+    EXPECT_EQ(-14, ZipUtils::unzipFiles(missing.c_str(), mDest.c_str(), ".db", kNoLimit));
+}
