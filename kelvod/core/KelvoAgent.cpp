@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdlib>
 
+#include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -185,7 +186,9 @@ void KelvoAgent::startStorage() {
 
 void KelvoAgent::startHidlService() {}
 
-void KelvoAgent::startLibrary() {}
+void KelvoAgent::startLibrary() {
+    kelvo::startLibrary(mStartTime);
+}
 
 void KelvoAgent::publishService() {}
 

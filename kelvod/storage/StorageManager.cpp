@@ -362,6 +362,13 @@ int32_t StorageManager::checkHostFileSize(const std::string& dir, const std::str
         if (FileUtils::deleteFile(path.c_str()) != 0) {
             return -2;
         }
+        // A database goes with its journal files, or they would be taken for
+        // the journal of the next database of that name.
+        if (endsWith(name, kDbExtension)) {
+            for (const std::string& companion : existingCompanions(path)) {
+                FileUtils::deleteFile(companion.c_str());
+            }
+        }
     }
     return 0;
 }

@@ -33,6 +33,9 @@ constexpr size_t kTimeTextSize = 20;
 
 // Every insert parcel runs inside this savepoint, so that a parcel is stored
 // whole or not at all, inside or outside the caller's transaction.
+// Prepared statements kept per connection; the daemon has fewer tables.
+constexpr size_t kMaxCachedStatements = 256;
+
 const char* const kInsertSavepoint = "SAVEPOINT kelvo_insert;";
 const char* const kInsertRelease = "RELEASE kelvo_insert;";
 const char* const kInsertRollback = "ROLLBACK TO kelvo_insert;";
@@ -153,7 +156,16 @@ int32_t SqlOperator::openConnection(const Parcel* in) {
     // copies and uploads.
     sqlite3_busy_timeout(database, kBusyTimeoutMs);
     mDatabase = database;
-    executeStatement(String8("PRAGMA cache_size=100;"));
+    if (executeStatement(String8("PRAGMA cache_size=100;")) < 0) {
+        // sqlite3_open reads nothing; the pragma is the first read of the
+        // file. A file that is no database is not a connection.
+        const int error = sqlite3_errcode(database);
+        if (error == SQLITE_NOTADB || error == SQLITE_CORRUPT) {
+            LLOGE("Error: %s(%s)", sqlite3_errmsg(database), path);
+            closeConnection();
+            return -1;
+        }
+    }
     return 0;
 }
 
@@ -161,6 +173,7 @@ int32_t SqlOperator::closeConnection() {
     if (mDatabase == nullptr) {
         return 0;
     }
+    finalizeCachedStatements();
     if (sqlite3_close(mDatabase) != SQLITE_OK) {
         LLOGE("Error: %s", sqlite3_errmsg(mDatabase));
         return -1;
@@ -418,13 +431,41 @@ int32_t SqlOperator::prepareStatement(const String8& statement, sqlite3_stmt** s
     return 0;
 }
 
-int32_t SqlOperator::executeStatement(const String8& statement) {
+sqlite3_stmt* SqlOperator::cachedStatement(const String8& statement) {
+    auto it = mStatements.find(statement.string());
+    if (it != mStatements.end()) {
+        return it->second;
+    }
+    sqlite3_stmt* stmt = nullptr;
+    if (prepareStatement(statement, &stmt) < 0) {
+        return nullptr;
+    }
+    if (mStatements.size() >= kMaxCachedStatements) {
+        finalizeCachedStatements();
+    }
+    mStatements.emplace(statement.string(), stmt);
+    return stmt;
+}
+
+void SqlOperator::finalizeCachedStatements() {
+    for (auto& entry : mStatements) {
+        sqlite3_finalize(entry.second);
+    }
+    mStatements.clear();
+}
+
+int32_t SqlOperator::executeStatement(const String8& statement, bool cached) {
     if (checkStatement(statement) < 0) {
         return -1;
     }
     LLOGD("%s", statement.string());
     sqlite3_stmt* stmt = nullptr;
-    if (prepareStatement(statement, &stmt) < 0) {
+    if (cached) {
+        stmt = cachedStatement(statement);
+        if (stmt == nullptr) {
+            return -1;
+        }
+    } else if (prepareStatement(statement, &stmt) < 0) {
         return -1;
     }
     int32_t result = 0;
@@ -432,7 +473,11 @@ int32_t SqlOperator::executeStatement(const String8& statement) {
         LLOGE("Execute statement error: %s", sqlite3_errmsg(mDatabase));
         result = -1;
     }
-    sqlite3_finalize(stmt);
+    if (cached) {
+        sqlite3_reset(stmt);
+    } else {
+        sqlite3_finalize(stmt);
+    }
     return result;
 }
 
@@ -442,31 +487,39 @@ int32_t SqlOperator::executeStatement(const String8& statement, const std::vecto
         return -1;
     }
     LLOGD("%s", statement.string());
-    sqlite3_stmt* stmt = nullptr;
-    if (prepareStatement(statement, &stmt) < 0) {
+    // One prepared form per table, kept for the connection: a flush of many
+    // small requests prepares each insert once.
+    sqlite3_stmt* stmt = cachedStatement(statement);
+    if (stmt == nullptr) {
         return -1;
     }
     int32_t rows = 0;
     if (in->readInt32(&rows) != android::NO_ERROR) {
         LLOGE("Missing entry count, statement: %s", statement.string());
-        sqlite3_finalize(stmt);
+        sqlite3_reset(stmt);
+        sqlite3_clear_bindings(stmt);
         return -1;
     }
     if (rows > kMaxInsertRows) {
         LLOGE("Insert entries count(%d) reach limit(%d), statement: %s", rows, kMaxInsertRows,
               statement.string());
-        sqlite3_finalize(stmt);
+        sqlite3_reset(stmt);
+        sqlite3_clear_bindings(stmt);
         return -1;
     }
     if (rows < 1) {
-        sqlite3_finalize(stmt);
+        sqlite3_reset(stmt);
+        sqlite3_clear_bindings(stmt);
         return 0;
     }
-    // Outside a transaction the savepoint is the transaction: releasing it
-    // commits.
+    // A parcel is stored whole or not at all. One row is atomic by itself;
+    // more rows go inside a savepoint. Outside a transaction the savepoint is
+    // the transaction: releasing it commits.
+    const bool savepoint = rows > 1;
     const bool nested = sqlite3_get_autocommit(mDatabase) == 0;
-    if (executeStatement(String8(kInsertSavepoint)) < 0) {
-        sqlite3_finalize(stmt);
+    if (savepoint && executeStatement(String8(kInsertSavepoint), true) < 0) {
+        sqlite3_reset(stmt);
+        sqlite3_clear_bindings(stmt);
         return -1;
     }
     int32_t result = SQLITE_DONE;
@@ -487,16 +540,20 @@ int32_t SqlOperator::executeStatement(const String8& statement, const std::vecto
             break;
         }
     }
-    sqlite3_finalize(stmt);
+    sqlite3_reset(stmt);
+    sqlite3_clear_bindings(stmt);
+    if (!savepoint) {
+        return result;
+    }
     if (result < 0) {
-        executeStatement(String8(kInsertRollback));
-        executeStatement(String8(kInsertRelease));
+        executeStatement(String8(kInsertRollback), true);
+        executeStatement(String8(kInsertRelease), true);
         if (!nested) {
             rollbackOpenTranscation();
         }
         return result;
     }
-    if (executeStatement(String8(kInsertRelease)) < 0) {
+    if (executeStatement(String8(kInsertRelease), true) < 0) {
         if (!nested) {
             rollbackOpenTranscation();
         }

@@ -2,6 +2,8 @@
 
 #include <stdint.h>
 
+#include <string>
+#include <unordered_map>
 #include <vector>
 
 #include <binder/Parcel.h>
@@ -46,8 +48,10 @@ private:
     int32_t translateInsert(const android::Parcel* in, android::String8* statement,
                             std::vector<int32_t>* types);
 
-    // Runs a statement that returns no rows.
-    int32_t executeStatement(const android::String8& statement);
+    // Runs a statement that returns no rows. A cached statement keeps its
+    // prepared form for the life of the connection (the fixed statements of
+    // the insert path).
+    int32_t executeStatement(const android::String8& statement, bool cached = false);
     // Runs an insert statement once per row of the parcel.
     int32_t executeStatement(const android::String8& statement, const std::vector<int32_t>& types,
                              const android::Parcel* in);
@@ -58,6 +62,10 @@ private:
     // without a connection.
     int32_t checkStatement(const android::String8& statement);
     int32_t prepareStatement(const android::String8& statement, sqlite3_stmt** stmt);
+    // The prepared form of a statement run again and again (inserts into the
+    // same table, savepoints); null when it does not prepare. Reset after use.
+    sqlite3_stmt* cachedStatement(const android::String8& statement);
+    void finalizeCachedStatements();
     int32_t bindEntryValues(sqlite3_stmt* stmt, const std::vector<int32_t>& types,
                             const android::Parcel* in);
     int32_t writeColumnValue(sqlite3_stmt* stmt, int32_t column, android::Parcel* out);
@@ -65,6 +73,7 @@ private:
     void rollbackOpenTranscation();
 
     sqlite3* mDatabase;
+    std::unordered_map<std::string, sqlite3_stmt*> mStatements;
 };
 
 } // namespace kelvo

@@ -293,13 +293,15 @@ TEST_F(StorageManagerTest, SizeLimitsDependOnUserType) {
     for (const Case& c : cases) {
         SCOPED_TRACE(testing::Message() << c.userType << " " << c.fileType << " " << c.size);
         setUserType(c.userType);
-        std::string path = mBackup + "/kelvo-1.db";
-        writeFile(path, "");
-        ASSERT_EQ(0, truncate(path.c_str(), c.size));
+        // The live database, as checked before it is opened.
+        writeFile(mLive, "");
+        ASSERT_EQ(0, truncate(mLive.c_str(), c.size));
+        writeFile(mLive + "-journal", "journal");
         ASSERT_EQ(0,
-                  StorageManager::checkFileSize(StorageManager::kBackupDir, "kelvo-1.db",
+                  StorageManager::checkFileSize(StorageManager::kDatabaseDir, "kelvo.db",
                                                 StorageManager::getFileSizeThreshold(c.fileType)));
-        EXPECT_EQ(c.kept, exists(path));
+        EXPECT_EQ(c.kept, exists(mLive));
+        EXPECT_EQ(c.kept, exists(mLive + "-journal"));
     }
     EXPECT_EQ(2u, mLog.count("is too large", ANDROID_LOG_ERROR));
     EXPECT_EQ(0, StorageManager::getFileSizeThreshold(7));

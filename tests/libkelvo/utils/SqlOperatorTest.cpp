@@ -309,6 +309,9 @@ TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
     const std::string missing = mRoot.path() + "/missing/kelvo.db";
     EXPECT_EQ(-1, runPath(kelvo::SQL_OPEN_CONNECTION, missing));
     EXPECT_TRUE(log.contains("Error: unable to open database file(" + missing + ")"));
+    mRoot.writeFile("/garbage.db", std::string(8192, 'Z'));
+    EXPECT_EQ(-1, runPath(kelvo::SQL_OPEN_CONNECTION, mRoot.path() + "/garbage.db"));
+    EXPECT_TRUE(log.contains("Error: file is not a database(" + mRoot.path() + "/garbage.db)"));
     // A failed open leaves no connection behind.
     ASSERT_EQ(0, runPath(kelvo::SQL_OPEN_CONNECTION, mPath));
     EXPECT_EQ(Rows{"still_open"}, query("SELECT name FROM sqlite_master"));
