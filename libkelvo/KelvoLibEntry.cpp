@@ -1,6 +1,8 @@
 #include "KelvoLibEntry.h"
 
+#include "LibKelvoLog.h"
 #include "core/KelvoLibAgent.h"
+#include "utils/XmlParser.h"
 
 namespace kelvo {
 
@@ -10,6 +12,19 @@ void startLibrary(int64_t systemBootTime) {
 
 int32_t doSqliteOperation(int32_t action, const android::Parcel* in, android::Parcel* out) {
     return KelvoLibAgent::getInstance()->doSqliteOperation(action, in, out);
+}
+
+int32_t getXmlConfig(int32_t element, const android::Parcel& request, android::Parcel* reply) {
+    // The power profile (element 0) belongs to the accounters alone.
+    if (element < CONFIG_ABNORMALITY_THRESHOLD || element > CONFIG_TEXT) {
+        LLOGE("Invalid element: %d", element);
+        return -1;
+    }
+    if (XmlParser::getInstance()->getXmlConfig(element, request, reply) < 0) {
+        LLOGE("Failed to get xml configuation");
+        return -1;
+    }
+    return 0;
 }
 
 } // namespace kelvo

@@ -15,4 +15,30 @@ void startLibrary(int64_t systemBootTime);
 // Only the storage thread calls it. Negative on failure.
 int32_t doSqliteOperation(int32_t action, const android::Parcel* in, android::Parcel* out);
 
+// Elements of the configuration file.
+enum ConfigElement {
+    CONFIG_POWER_PROFILE = 0,         // the library's own: refused by getXmlConfig
+    CONFIG_ABNORMALITY_THRESHOLD = 1, // grouped
+    CONFIG_COMPONENT_POLICY = 2,      // simple; components: ConfigPolicyComponent
+    CONFIG_FILTER = 3,                // simple; 0 abnormality routine, 1 system handler
+    CONFIG_SETTINGS = 4,              // simple; 0 energy compensation
+    CONFIG_TEXT = 1000,               // text; 0 the configuration's version
+};
+
+// Components of CONFIG_COMPONENT_POLICY: each handler's data-source policy.
+enum ConfigPolicyComponent {
+    POLICY_DISPLAY = 0,
+    POLICY_GPU = 1,
+    POLICY_AUDIO = 2,
+    POLICY_MODEM = 3,
+    POLICY_DPM = 4,
+    POLICY_CAMERA = 5,
+};
+
+// Reads one piece of the configuration file (elements 1 to 1000). Request:
+// int32 component id, and for grouped elements int32 parameter id (-1 for
+// all) and bool keyed. The reply is rewound to 0; a reply shorter than the
+// caller needs counts as a failed lookup. 0, or -1 on failure.
+int32_t getXmlConfig(int32_t element, const android::Parcel& request, android::Parcel* reply);
+
 } // namespace kelvo

@@ -4,7 +4,11 @@
 #include <sys/stat.h>
 #include <unistd.h>
 
+#include <dirent.h>
+
+#include <algorithm>
 #include <fstream>
+#include <regex>
 #include <sstream>
 #include <thread>
 
@@ -27,13 +31,51 @@ CaptureState& capture() {
     return *s;
 }
 
-void makeParents(const std::string& path) {
-    for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1)) {
-        mkdir(path.substr(0, pos).c_str(), 0775);
+} // namespace
+
+void makeHostDirs(const std::string& dir) {
+    for (size_t pos = dir.find('/', 1); pos != std::string::npos; pos = dir.find('/', pos + 1)) {
+        mkdir(dir.substr(0, pos).c_str(), 0775);
     }
+    mkdir(dir.c_str(), 0775);
 }
 
-} // namespace
+void writeHostFile(const std::string& path, const std::string& content) {
+    size_t slash = path.find_last_of('/');
+    if (slash != std::string::npos && slash > 0) {
+        makeHostDirs(path.substr(0, slash));
+    }
+    std::ofstream out(path, std::ios::binary | std::ios::trunc);
+    out << content;
+}
+
+std::string readHostFile(const std::string& path) {
+    std::ifstream in(path, std::ios::binary);
+    std::stringstream ss;
+    ss << in.rdbuf();
+    return ss.str();
+}
+
+bool hostPathExists(const std::string& path) {
+    struct stat st = {};
+    return lstat(path.c_str(), &st) == 0;
+}
+
+std::vector<std::string> listDir(const std::string& dir, const std::string& pattern) {
+    std::vector<std::string> names;
+    std::regex re(pattern);
+    if (DIR* d = opendir(dir.c_str())) {
+        while (struct dirent* ent = readdir(d)) {
+            std::string name = ent->d_name;
+            if (name != "." && name != ".." && std::regex_match(name, re)) {
+                names.push_back(name);
+            }
+        }
+        closedir(d);
+    }
+    std::sort(names.begin(), names.end());
+    return names;
+}
 
 TempRoot::TempRoot() {
     char tmpl[] = "/tmp/kelvo-test-XXXXXX";
@@ -54,17 +96,11 @@ TempRoot::~TempRoot() {
 }
 
 void TempRoot::writeFile(const std::string& devicePath, const std::string& content) const {
-    std::string full = mPath + devicePath;
-    makeParents(full);
-    std::ofstream out(full, std::ios::binary | std::ios::trunc);
-    out << content;
+    writeHostFile(mPath + devicePath, content);
 }
 
 std::string TempRoot::readFile(const std::string& devicePath) const {
-    std::ifstream in(mPath + devicePath, std::ios::binary);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
+    return readHostFile(mPath + devicePath);
 }
 
 LogCapture::LogCapture() {

@@ -52,6 +52,16 @@ private:
     static void logger(const struct __android_logger_data* data, const char* message);
 };
 
+// Host file helpers of the tests (paths are host paths, not device paths).
+void makeHostDirs(const std::string& dir);
+// Writes the file, creating its parent directories.
+void writeHostFile(const std::string& path, const std::string& content);
+std::string readHostFile(const std::string& path);
+// True when something, a dangling link included, has this name.
+bool hostPathExists(const std::string& path);
+// The sorted names in dir (without "." and "..") that match the pattern.
+std::vector<std::string> listDir(const std::string& dir, const std::string& pattern = ".*");
+
 // Polls the condition until it holds or the time-out passes.
 bool waitFor(const std::function<bool()>& condition,
              std::chrono::milliseconds timeout = std::chrono::milliseconds(5000));

@@ -248,13 +248,5 @@ TEST_F(KelvoAgentTest, AnUnusableDatabaseIsMovedAsideAndTheProcessEnds) {
     EXPECT_NE(0, access((mRoot->path() + KelvoStorage::kDatabasePath).c_str(), F_OK));
     EXPECT_NE(0, access((mRoot->path() + KelvoStorage::kDatabasePath + "-journal").c_str(), F_OK));
     // The unusable file was kept aside in the backup folder.
-    std::string backup = mRoot->path() + "/data/log/kelvo/backup";
-    bool kept = false;
-    if (DIR* d = opendir(backup.c_str())) {
-        while (struct dirent* e = readdir(d)) {
-            kept = kept || std::string(e->d_name).rfind("kelvo-", 0) == 0;
-        }
-        closedir(d);
-    }
-    EXPECT_TRUE(kept);
+    EXPECT_FALSE(kelvo::test::listDir(mRoot->path() + "/data/log/kelvo/backup", "kelvo-.*").empty());
 }

@@ -128,23 +128,8 @@ protected:
     std::string dbPath() const { return mRoot->path() + KelvoStorage::kDatabasePath; }
 
     std::vector<std::string> backupZips() const {
-        std::vector<std::string> names;
         std::string dir = mRoot->path() + "/data/log/kelvo/backup";
-        for (const std::string& n : listDir(dir)) {
-            if (n.size() > 4 && n.compare(n.size() - 4, 4, ".zip") == 0) names.push_back(n);
-        }
-        return names;
-    }
-
-    static std::vector<std::string> listDir(const std::string& dir) {
-        std::vector<std::string> names;
-        if (DIR* d = opendir(dir.c_str())) {
-            while (struct dirent* e = readdir(d)) {
-                if (e->d_name[0] != '.') names.push_back(e->d_name);
-            }
-            closedir(d);
-        }
-        return names;
+        return kelvo::test::listDir(dir, ".*\\.zip");
     }
 
     std::unique_ptr<TempRoot> mRoot;

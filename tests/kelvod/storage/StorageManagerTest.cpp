@@ -31,59 +31,22 @@ using kelvo::RootPath;
 using kelvo::StorageManager;
 using kelvo::test::LogCapture;
 using kelvo::test::TempRoot;
+using kelvo::test::hostPathExists;
+using kelvo::test::listDir;
+using kelvo::test::makeHostDirs;
+using kelvo::test::readHostFile;
+using kelvo::test::writeHostFile;
 
 namespace {
 
 constexpr int64_t kDayMs = 86400000;
 constexpr int64_t kFirstDay = 1700000000000;
 
-void makeDirs(const std::string& path) {
-    for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1)) {
-        mkdir(path.substr(0, pos).c_str(), 0775);
-    }
-    mkdir(path.c_str(), 0775);
-}
-
-void writeFile(const std::string& path, const std::string& content) {
-    makeDirs(path.substr(0, path.find_last_of('/')));
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
-    out << content;
-}
-
-std::string readFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
-}
-
-bool exists(const std::string& path) {
-    struct stat st = {};
-    return lstat(path.c_str(), &st) == 0;
-}
-
-// The sorted names in dir that match the pattern.
-std::vector<std::string> listDir(const std::string& dir, const std::string& pattern = ".*") {
-    std::vector<std::string> names;
-    std::regex re(pattern);
-    if (DIR* d = opendir(dir.c_str())) {
-        while (struct dirent* ent = readdir(d)) {
-            std::string name = ent->d_name;
-            if (name != "." && name != ".." && std::regex_match(name, re)) {
-                names.push_back(name);
-            }
-        }
-        closedir(d);
-    }
-    std::sort(names.begin(), names.end());
-    return names;
-}
-
 // Contents of the database copies in dir, sorted.
 std::vector<std::string> copiesIn(const std::string& dir) {
     std::vector<std::string> contents;
     for (const std::string& name : listDir(dir, "kelvo-[0-9]+\\.db")) {
-        contents.push_back(readFile(dir + "/" + name));
+        contents.push_back(readHostFile(dir + "/" + name));
     }
     std::sort(contents.begin(), contents.end());
     return contents;
@@ -124,7 +87,7 @@ public:
         if (mFail) {
             return -1;
         }
-        writeFile(dest, readFile(RootPath::resolve(StorageManager::kDatabasePath)));
+        writeHostFile(dest, readHostFile(RootPath::resolve(StorageManager::kDatabasePath)));
         if (mAfterCopy) {
             mAfterCopy();
         }
@@ -150,7 +113,7 @@ protected:
 
     void SetUp() override {
         std::string root = mTemp.path() + "/my-root";
-        makeDirs(root);
+        makeHostDirs(root);
         RootPath::setRoot(root.c_str());
         kelvo::HostProperties::reload();
         setUserType(1);
@@ -163,7 +126,7 @@ protected:
         mLive = RootPath::resolve(StorageManager::kDatabasePath);
         mBackup = RootPath::resolve(StorageManager::kBackupDir);
         mUpload = RootPath::resolve(StorageManager::kUploadDir);
-        writeFile(mLive, "live database");
+        writeHostFile(mLive, "live database");
     }
 
     void TearDown() override {
@@ -193,14 +156,14 @@ protected:
     // Daily cleans on days 1..days, each backing up "database of day N".
     void runDailyCleans(int days) {
         for (int day = 1; day <= days; ++day) {
-            writeFile(mLive, "database of day " + std::to_string(day));
+            writeHostFile(mLive, "database of day " + std::to_string(day));
             ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + day * kDayMs));
         }
-        writeFile(mLive, "live database");
+        writeHostFile(mLive, "live database");
     }
 
     std::string collectDir(const std::string& devicePath) {
-        makeDirs(RootPath::resolve(devicePath));
+        makeHostDirs(RootPath::resolve(devicePath));
         return RootPath::resolve(devicePath);
     }
 
@@ -218,7 +181,7 @@ protected:
 TEST_F(StorageManagerTest, DailyCleansKeepSixRotatingZips) {
     for (int day = 1; day <= 8; ++day) {
         SCOPED_TRACE(day);
-        writeFile(mLive, "database of day " + std::to_string(day));
+        writeHostFile(mLive, "database of day " + std::to_string(day));
         ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + day * kDayMs));
 
         std::map<int, std::string> zips = backupZips();
@@ -243,15 +206,15 @@ TEST_F(StorageManagerTest, DailyCleansKeepSixRotatingZips) {
 
 TEST_F(StorageManagerTest, ListingKeepsWholeNamesOfCopiesAndZipsOnly) {
     std::string outside = mTemp.path() + "/outside.db";
-    writeFile(outside, "not ours");
+    writeHostFile(outside, "not ours");
     for (const char* name :
          {"kelvo-12.db", "kelvo-12.db-wal", "kelvo-12-3.zip", "notes.txt", "kelvo-12.dbx",
           "kelvo-12-3.zipx", "kelvo-x.db", "kelvo- 12.db", "kelvo-12--3.zip", "kelvo-12.zip",
           "kelvo-12.db.db", "kelvo-12-3.zip.zip", "kelvo-9.db-journal"}) {
-        writeFile(mBackup + "/" + name, "x");
+        writeHostFile(mBackup + "/" + name, "x");
     }
     ASSERT_EQ(0, symlink(outside.c_str(), (mBackup + "/kelvo-13.db").c_str()));
-    makeDirs(mBackup + "/kelvo-14.db");
+    makeHostDirs(mBackup + "/kelvo-14.db");
 
     StorageManager::FileList list;
     ASSERT_EQ(0, StorageManager::getValidFileList(StorageManager::kBackupDir, &list));
@@ -260,18 +223,18 @@ TEST_F(StorageManagerTest, ListingKeepsWholeNamesOfCopiesAndZipsOnly) {
     // The journal of a listed copy stays with it; everything else goes.
     EXPECT_EQ((std::vector<std::string>{"kelvo-12-3.zip", "kelvo-12.db", "kelvo-12.db-wal"}),
               listDir(mBackup));
-    EXPECT_EQ("not ours", readFile(outside));
+    EXPECT_EQ("not ours", readHostFile(outside));
     EXPECT_EQ(12u, mLog.count("Error file(" + mBackup + "/", ANDROID_LOG_ERROR));
 
     // A stray file is gone after the next daily clean too.
-    writeFile(mBackup + "/notes.txt", "stray");
+    writeHostFile(mBackup + "/notes.txt", "stray");
     ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
-    EXPECT_FALSE(exists(mBackup + "/notes.txt"));
+    EXPECT_FALSE(hostPathExists(mBackup + "/notes.txt"));
 
     // A missing directory lists as empty; a file in its place cannot be listed.
     EXPECT_EQ(0, StorageManager::getValidFileList("/data/none", &list));
     EXPECT_TRUE(list[kelvo::STORAGE_FILE_DB].empty());
-    writeFile(RootPath::resolve("/data/file"), "x");
+    writeHostFile(RootPath::resolve("/data/file"), "x");
     EXPECT_EQ(-2, StorageManager::getValidFileList("/data/file", &list));
 }
 
@@ -294,14 +257,14 @@ TEST_F(StorageManagerTest, SizeLimitsDependOnUserType) {
         SCOPED_TRACE(testing::Message() << c.userType << " " << c.fileType << " " << c.size);
         setUserType(c.userType);
         // The live database, as checked before it is opened.
-        writeFile(mLive, "");
+        writeHostFile(mLive, "");
         ASSERT_EQ(0, truncate(mLive.c_str(), c.size));
-        writeFile(mLive + "-journal", "journal");
+        writeHostFile(mLive + "-journal", "journal");
         ASSERT_EQ(0,
                   StorageManager::checkFileSize(StorageManager::kDatabaseDir, "kelvo.db",
                                                 StorageManager::getFileSizeThreshold(c.fileType)));
-        EXPECT_EQ(c.kept, exists(mLive));
-        EXPECT_EQ(c.kept, exists(mLive + "-journal"));
+        EXPECT_EQ(c.kept, hostPathExists(mLive));
+        EXPECT_EQ(c.kept, hostPathExists(mLive + "-journal"));
     }
     EXPECT_EQ(2u, mLog.count("is too large", ANDROID_LOG_ERROR));
     EXPECT_EQ(0, StorageManager::getFileSizeThreshold(7));
@@ -316,7 +279,7 @@ TEST_F(StorageManagerTest, FailedZipKeepsCopiesForTheNextZip) {
     for (char& c : payload) {
         c = static_cast<char>(random());
     }
-    writeFile(mLive, payload);
+    writeHostFile(mLive, payload);
     struct rlimit saved = {};
     ASSERT_EQ(0, getrlimit(RLIMIT_FSIZE, &saved));
     sighandler_t oldHandler = signal(SIGXFSZ, SIG_IGN);
@@ -333,9 +296,9 @@ TEST_F(StorageManagerTest, FailedZipKeepsCopiesForTheNextZip) {
     EXPECT_NE(0, ret);
     EXPECT_TRUE(mLog.contains("Failed to zip file", ANDROID_LOG_ERROR));
     EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
-    EXPECT_EQ(payload, readFile(mBackup + "/" + copyName(kFirstDay)));
+    EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
 
-    writeFile(mLive, "next database");
+    writeHostFile(mLive, "next database");
     ASSERT_EQ(0, mManager.moveDatabase());
     std::map<int, std::string> zips = backupZips();
     ASSERT_EQ(1u, zips.size());
@@ -349,11 +312,11 @@ TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     setUserType(3);
     StorageManager::setDailyUploadHook(recordUpload);
     for (int day = 1; day <= 2; ++day) {
-        writeFile(mLive, "beta day " + std::to_string(day));
+        writeHostFile(mLive, "beta day " + std::to_string(day));
         int64_t time = kFirstDay + day * kDayMs;
         ASSERT_EQ(0, mManager.cleanDatabase(time));
         EXPECT_EQ(std::vector<std::string>{copyName(time)}, listDir(mUpload));
-        EXPECT_EQ("beta day " + std::to_string(day), readFile(mUpload + "/" + copyName(time)));
+        EXPECT_EQ("beta day " + std::to_string(day), readHostFile(mUpload + "/" + copyName(time)));
         ASSERT_EQ(static_cast<size_t>(day), gUploads.size());
         EXPECT_EQ(std::make_pair(time - kDayMs, time), gUploads.back());
     }
@@ -393,7 +356,7 @@ TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
         std::string dir = collectDir(device);
         ASSERT_EQ(0, mManager.samplingUpload(String8(device.c_str()), String8(c.extra)));
         EXPECT_EQ(std::vector<std::string>{c.content}, copiesIn(dir));
-        EXPECT_TRUE(exists(dir + "/903"));
+        EXPECT_TRUE(hostPathExists(dir + "/903"));
         EXPECT_EQ(2u, listDir(dir).size());
     }
     EXPECT_EQ(1u, mLog.count("Failed to parse extra message: day=9", ANDROID_LOG_ERROR));
@@ -410,7 +373,7 @@ TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
     mCopier.mFail = true;
     dir = collectDir("/data/log/failed");
     EXPECT_NE(0, mManager.samplingUpload(String8("/data/log/failed"), String8("day=0")));
-    EXPECT_TRUE(exists(dir + "/903"));
+    EXPECT_TRUE(hostPathExists(dir + "/903"));
     EXPECT_EQ(-5, mManager.samplingUpload(String8(""), String8("day=0")));
 }
 
@@ -418,10 +381,10 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
     runDailyCleans(1);
     std::vector<std::string> backupBefore = listDir(mBackup);
     std::string outside = mTemp.path() + "/outside";
-    makeDirs(outside);
-    makeDirs(RootPath::resolve("/data/log"));
+    makeHostDirs(outside);
+    makeHostDirs(RootPath::resolve("/data/log"));
     ASSERT_EQ(0, symlink(outside.c_str(), RootPath::resolve("/data/log/escape").c_str()));
-    makeDirs(RootPath::resolve("/data/elsewhere"));
+    makeHostDirs(RootPath::resolve("/data/elsewhere"));
 
     for (const char* path : {"../evil.db", "data/log/x", "/data/log/../../evil",
                              "/data/log/../elsewhere", "/data/log/escape", "/data/elsewhere",
@@ -435,7 +398,7 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
 
     // The finish marker is never another file's second name.
     std::string victim = mTemp.path() + "/victim";
-    writeFile(victim, "not ours");
+    writeHostFile(victim, "not ours");
     ASSERT_EQ(0, chmod(victim.c_str(), 0600));
     std::string dir = collectDir("/data/log/linked");
     ASSERT_EQ(0, link(victim.c_str(), (dir + "/903").c_str()));
@@ -462,8 +425,8 @@ TEST_F(StorageManagerTest, RemoteDebugCaptureFollowsSessionAndUserType) {
     ASSERT_EQ(0, mManager.remoteDebug(kelvo::REMOTE_DEBUG_CAPTURE, device));
     std::vector<std::string> zips = listDir(dir, "kelvo-[0-9]+-2\\.zip");
     ASSERT_EQ(1u, zips.size());
-    EXPECT_EQ(readFile(backupZips()[1]), readFile(dir + "/" + zips[0]));
-    EXPECT_TRUE(exists(dir + "/903"));
+    EXPECT_EQ(readHostFile(backupZips()[1]), readHostFile(dir + "/" + zips[0]));
+    EXPECT_TRUE(hostPathExists(dir + "/903"));
     EXPECT_EQ(2, mManager.getRemoteDebugDay());
 
     ASSERT_EQ(0, mManager.remoteDebug(kelvo::REMOTE_DEBUG_CLOSE, String8()));
@@ -493,9 +456,9 @@ TEST_F(StorageManagerTest, RemoteDebugCaptureFollowsSessionAndUserType) {
 
 TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
     const char* suffixes[] = {"-journal", "-wal", "-shm"};
-    writeFile(mLive, "moved database");
+    writeHostFile(mLive, "moved database");
     for (const char* suffix : suffixes) {
-        writeFile(mLive + suffix, std::string("old") + suffix);
+        writeHostFile(mLive + suffix, std::string("old") + suffix);
     }
     ASSERT_EQ(0, mManager.moveDatabase());
     EXPECT_EQ(std::vector<std::string>{"backup"},
@@ -503,24 +466,24 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
     std::vector<std::string> copies = listDir(mBackup, "kelvo-[0-9]+\\.db");
     ASSERT_EQ(1u, copies.size());
     std::string moved = copies[0];
-    EXPECT_EQ("moved database", readFile(mBackup + "/" + moved));
+    EXPECT_EQ("moved database", readHostFile(mBackup + "/" + moved));
     for (const char* suffix : suffixes) {
-        EXPECT_EQ(std::string("old") + suffix, readFile(mBackup + "/" + moved + suffix));
+        EXPECT_EQ(std::string("old") + suffix, readHostFile(mBackup + "/" + moved + suffix));
     }
 
     // The next move zips the set together.
-    writeFile(mLive, "second database");
+    writeHostFile(mLive, "second database");
     ASSERT_EQ(0, mManager.moveDatabase());
     std::map<std::string, std::string> entries = readZip(backupZips()[0]);
     EXPECT_EQ(4u, entries.size());
     EXPECT_EQ("moved database", entries[moved]);
     EXPECT_EQ("old-wal", entries[moved + "-wal"]);
-    EXPECT_FALSE(exists(mBackup + "/" + moved + "-journal"));
+    EXPECT_FALSE(hostPathExists(mBackup + "/" + moved + "-journal"));
 
     // Journal files of a database that is gone must not meet the next one.
-    writeFile(mLive + "-wal", "stale");
+    writeHostFile(mLive + "-wal", "stale");
     EXPECT_EQ(-2, mManager.moveDatabase());
-    EXPECT_FALSE(exists(mLive + "-wal"));
+    EXPECT_FALSE(hostPathExists(mLive + "-wal"));
 }
 
 TEST(StorageManagerNameTest, BackupNamesComeFromTheBaseNameOnly) {

@@ -1,6 +1,9 @@
 #include <gtest/gtest.h>
 
+#include <chrono>
+#include <memory>
 #include <string>
+#include <thread>
 #include <vector>
 
 #include "KelvoLog.h"
@@ -232,4 +235,36 @@ TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
     EXPECT_EQ(-9, StorageOperator::logSimpleQueryResult(kHourly, truncated, 7200000));
     StorageOperator::forceFlushEntries();
     EXPECT_EQ(2, db().scalar("SELECT COUNT(*) FROM hourly_test"));
+}
+
+TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
+    Parcel old;
+    old.writeInt64(1000);
+    old.writeString8(String8("xml_version"));
+    old.writeString8(String8("old"));
+    String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText("xml_version");
+    ASSERT_EQ(0, StorageOperator::updateEntries(kAbout, old, condition.string()));
+    StorageOperator::forceFlushEntries();
+
+    // Another connection holds the database while the update runs, so the
+    // storage thread cannot answer before the (shortened) time-out.
+    kelvo::HandlerThread::setSyncTimeoutMs(200);
+    std::unique_ptr<DirectDb> other(new DirectDb(mRoot->path() + KelvoStorage::kDatabasePath));
+    ASSERT_EQ(SQLITE_OK, other->exec("BEGIN EXCLUSIVE"));
+    std::thread release([&] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(600));
+        other->exec("COMMIT");
+    });
+    Parcel fresh;
+    fresh.writeInt64(2000);
+    fresh.writeString8(String8("xml_version"));
+    fresh.writeString8(String8("new"));
+    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, fresh, condition.string()));
+    release.join();
+    kelvo::HandlerThread::setSyncTimeoutMs(0);
+
+    // The queued delete ran before the queued row: exactly the new value.
+    EXPECT_EQ(0, StorageOperator::forceFlushEntries());
+    EXPECT_EQ(std::vector<std::string>{"new"},
+              db().column("SELECT value FROM about_kelvo_daemon WHERE key = 'xml_version'"));
 }

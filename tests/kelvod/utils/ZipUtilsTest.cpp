@@ -17,27 +17,15 @@
 using kelvo::ZipUtils;
 using kelvo::test::LogCapture;
 using kelvo::test::TempRoot;
+using kelvo::test::hostPathExists;
+using kelvo::test::listDir;
+using kelvo::test::makeHostDirs;
+using kelvo::test::readHostFile;
+using kelvo::test::writeHostFile;
 
 namespace {
 
 constexpr int64_t kNoLimit = 1 << 30;
-
-void writeFile(const std::string& path, const std::string& content) {
-    std::ofstream out(path, std::ios::binary | std::ios::trunc);
-    out << content;
-}
-
-std::string readFile(const std::string& path) {
-    std::ifstream in(path, std::ios::binary);
-    std::stringstream ss;
-    ss << in.rdbuf();
-    return ss.str();
-}
-
-bool exists(const std::string& path) {
-    struct stat st = {};
-    return lstat(path.c_str(), &st) == 0;
-}
 
 // Entry name -> content, read with the library's own reader.
 std::map<std::string, std::string> readZip(const std::string& path) {
@@ -104,9 +92,9 @@ TEST_F(ZipUtilsTest, ZippedFilesComeBackUnchanged) {
     for (int i = 0; i < 5000; ++i) {
         big += std::to_string(i * 7919 % 104729) + ",";
     }
-    writeFile(mDir + "/kelvo-1.db", big);
-    writeFile(mDir + "/kelvo-2.db", "");
-    writeFile(mDir + "/notes.txt", "not a database");
+    writeHostFile(mDir + "/kelvo-1.db", big);
+    writeHostFile(mDir + "/kelvo-2.db", "");
+    writeHostFile(mDir + "/notes.txt", "not a database");
     std::string zip = mDir + "/out.zip";
 
     ASSERT_EQ(0, ZipUtils::zipFiles(
@@ -119,9 +107,9 @@ TEST_F(ZipUtilsTest, ZippedFilesComeBackUnchanged) {
 
     // Only the entries with the suffix are extracted, readable by the group.
     ASSERT_EQ(0, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
-    EXPECT_EQ(big, readFile(mDest + "/kelvo-1.db"));
-    EXPECT_TRUE(exists(mDest + "/kelvo-2.db"));
-    EXPECT_FALSE(exists(mDest + "/notes.txt"));
+    EXPECT_EQ(big, readHostFile(mDest + "/kelvo-1.db"));
+    EXPECT_TRUE(hostPathExists(mDest + "/kelvo-2.db"));
+    EXPECT_FALSE(hostPathExists(mDest + "/notes.txt"));
     struct stat st = {};
     ASSERT_EQ(0, stat((mDest + "/kelvo-1.db").c_str(), &st));
     EXPECT_EQ(0664u, st.st_mode & 0777);
@@ -133,7 +121,7 @@ TEST_F(ZipUtilsTest, ZippedFilesComeBackUnchanged) {
 }
 
 TEST_F(ZipUtilsTest, AZipMissingAFileIsAFailure) {
-    writeFile(mDir + "/kelvo-1.db", "first");
+    writeHostFile(mDir + "/kelvo-1.db", "first");
     std::string zip = mDir + "/out.zip";
     std::string missing = mDir + "/kelvo-2.db";
     EXPECT_EQ(-14, ZipUtils::zipFiles(zip.c_str(), {mDir + "/kelvo-1.db", missing}, false));
@@ -149,8 +137,8 @@ TEST_F(ZipUtilsTest, AZipMissingAFileIsAFailure) {
 
 TEST_F(ZipUtilsTest, NeverWritesThroughExistingNames) {
     std::string victim = mRoot.path() + "/victim";
-    writeFile(victim, "precious");
-    writeFile(mDir + "/kelvo-1.db", "first");
+    writeHostFile(victim, "precious");
+    writeHostFile(mDir + "/kelvo-1.db", "first");
     std::string softLink = mDir + "/soft.zip";
     std::string hardLink = mDir + "/hard.zip";
     ASSERT_EQ(0, symlink(victim.c_str(), softLink.c_str()));
@@ -162,11 +150,11 @@ TEST_F(ZipUtilsTest, NeverWritesThroughExistingNames) {
     std::string zip = mDir + "/in.zip";
     craftZip(zip, {{"linked.db", "payload"}, {"taken.db", "payload"}});
     ASSERT_EQ(0, symlink(victim.c_str(), (mDest + "/linked.db").c_str()));
-    writeFile(mDest + "/taken.db", "someone else's");
+    writeHostFile(mDest + "/taken.db", "someone else's");
     EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
-    EXPECT_EQ("someone else's", readFile(mDest + "/taken.db"));
-    EXPECT_TRUE(exists(mDest + "/linked.db"));
-    EXPECT_EQ("precious", readFile(victim));
+    EXPECT_EQ("someone else's", readHostFile(mDest + "/taken.db"));
+    EXPECT_TRUE(hostPathExists(mDest + "/linked.db"));
+    EXPECT_EQ("precious", readHostFile(victim));
 }
 
 TEST_F(ZipUtilsTest, UnzipRefusesEntriesLeavingTheDestination) {
@@ -174,9 +162,9 @@ TEST_F(ZipUtilsTest, UnzipRefusesEntriesLeavingTheDestination) {
     craftZip(zip, {{"../x.db", "escape"}, {"a/b.db", "nested"}, {"..", "dots"}, {"ok.db", "fine"}});
 
     EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", kNoLimit));
-    EXPECT_EQ("fine", readFile(mDest + "/ok.db"));
-    EXPECT_FALSE(exists(mRoot.path() + "/x.db"));
-    EXPECT_FALSE(exists(mDest + "/a"));
+    EXPECT_EQ("fine", readHostFile(mDest + "/ok.db"));
+    EXPECT_FALSE(hostPathExists(mRoot.path() + "/x.db"));
+    EXPECT_FALSE(hostPathExists(mDest + "/a"));
     EXPECT_EQ(2u, mLog.count("Refuse zip entry", ANDROID_LOG_ERROR));
 }
 
@@ -184,12 +172,12 @@ TEST_F(ZipUtilsTest, UnzipRefusesOversizedEntriesAndBrokenZips) {
     std::string zip = mDir + "/in.zip";
     craftZip(zip, {{"small.db", std::string(100, 's')}, {"large.db", std::string(4096, 'l')}});
     EXPECT_EQ(-14, ZipUtils::unzipFiles(zip.c_str(), mDest.c_str(), ".db", 1000));
-    EXPECT_EQ(std::string(100, 's'), readFile(mDest + "/small.db"));
-    EXPECT_FALSE(exists(mDest + "/large.db"));
+    EXPECT_EQ(std::string(100, 's'), readHostFile(mDest + "/small.db"));
+    EXPECT_FALSE(hostPathExists(mDest + "/large.db"));
     EXPECT_TRUE(mLog.contains("Zip entry is too large: large.db", ANDROID_LOG_ERROR));
 
     std::string broken = mDir + "/broken.zip";
-    writeFile(broken, "PK but not really a zip");
+    writeHostFile(broken, "PK but not really a zip");
     EXPECT_EQ(-14, ZipUtils::unzipFiles(broken.c_str(), mDest.c_str(), ".db", kNoLimit));
     EXPECT_TRUE(mLog.contains("Failed to open zip file: " + broken, ANDROID_LOG_ERROR));
     std::string missing = mDir + "/missing.zip";
