@@ -34,6 +34,10 @@ int32_t KelvoOperator::sendCustomizedMessage(int32_t code, const android::Parcel
     return sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, code, data, reply));
 }
 
+int32_t KelvoOperator::sendLoggerMessage(int32_t tag, const android::Parcel& data) {
+    return sendMessage(ParcelMessage(MESSAGE_LOGGER, tag, data));
+}
+
 int32_t KelvoOperator::lateInitialize() {
     return 0;
 }

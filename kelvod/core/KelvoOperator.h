@@ -26,6 +26,9 @@ public:
     // receiver's status and reply (sync true).
     int32_t sendCustomizedMessage(int32_t code, const android::Parcel& data,
                                   android::Parcel* reply, bool sync);
+    // Posts a record of the log device (int64 time ms, C string text) under
+    // its tag id; the message id or a negative code.
+    int32_t sendLoggerMessage(int32_t tag, const android::Parcel& data);
 
     int32_t getAccounterType() const { return mAccounterType; }
     uint32_t getElector() const { return mElector; }
