@@ -14,6 +14,18 @@ int32_t doSqliteOperation(int32_t action, const android::Parcel* in, android::Pa
     return KelvoLibAgent::getInstance()->doSqliteOperation(action, in, out);
 }
 
+int32_t registerLibraryListener(int32_t type, const android::sp<LibraryListener>& listener) {
+    return KelvoLibAgent::getInstance()->registerListener(type, listener);
+}
+
+int32_t unregisterLibraryListener(int32_t type) {
+    return KelvoLibAgent::getInstance()->unregisterListener(type);
+}
+
+int32_t setDataAccounter(const android::Parcel& action) {
+    return KelvoLibAgent::getInstance()->setDataAccounter(action);
+}
+
 int32_t getXmlConfig(int32_t element, const android::Parcel& request, android::Parcel* reply) {
     // The power profile (element 0) belongs to the accounters alone.
     if (element < CONFIG_ABNORMALITY_THRESHOLD || element > CONFIG_TEXT) {

@@ -3,6 +3,10 @@
 #include <stdint.h>
 
 #include <binder/Parcel.h>
+#include <utils/StrongPointer.h>
+
+#include "AccounterTypes.h"
+#include "LibraryListener.h"
 
 namespace kelvo {
 
@@ -14,6 +18,20 @@ void startLibrary(int64_t systemBootTime);
 // Runs one database action (sql_action) on the library's one SQL connection.
 // Only the storage thread calls it. Negative on failure.
 int32_t doSqliteOperation(int32_t action, const android::Parcel* in, android::Parcel* out);
+
+// Sets the one listener that receives the results of the accounter of the
+// type (AccounterType), replacing an earlier one; the accounter is created if
+// needed. 0, or -1 for a null listener or an unknown type.
+int32_t registerLibraryListener(int32_t type, const android::sp<LibraryListener>& listener);
+
+// Clears the accounter's listener. 0, or -1 for an unknown type.
+int32_t unregisterLibraryListener(int32_t type);
+
+// Hands one accounting action to its accounter: int32 AccounterType, int32
+// AccounterAction, then the action's fields (AccounterTypes.h). Read from its
+// start. The accounter's listener gets the results from inside this call, on
+// the caller's thread. 0, or -1 on failure.
+int32_t setDataAccounter(const android::Parcel& action);
 
 // Elements of the configuration file.
 enum ConfigElement {

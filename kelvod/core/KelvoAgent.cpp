@@ -5,6 +5,7 @@
 
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
+#include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
 
@@ -175,6 +176,7 @@ void KelvoAgent::startStorage() {
             routine->addSchemaTable();
         }
     }
+    DataUploader::getInstance()->addSchemaTable();
     if (mStorage->startConnection() < 0) {
         KLOGE("Failed to start storage");
         mStorage->closeConnection();
@@ -294,6 +296,7 @@ void KelvoAgent::cleanTables(int64_t time) {
             routine->cleanTables(time);
         }
     }
+    DataUploader::getInstance()->cleanTables(time);
 }
 
 } // namespace kelvo

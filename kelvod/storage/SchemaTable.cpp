@@ -38,6 +38,8 @@ int32_t SchemaTable::addSchema(const table_attribute& table) {
 void SchemaTable::clearSchema() {
     std::lock_guard<std::mutex> guard(mLock);
     mTables.clear();
+    // The version table is always registered: a later start needs it too.
+    mTables.emplace(kVersionTable.name, &kVersionTable);
 }
 
 size_t SchemaTable::size() {

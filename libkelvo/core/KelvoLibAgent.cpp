@@ -17,7 +17,22 @@ KelvoLibAgent* KelvoLibAgent::getInstance() {
     return sInstance;
 }
 
-KelvoLibAgent::KelvoLibAgent() : mSystemBootTime(0) {}
+namespace {
+
+// The built-in accounter of each type. A type whose accounter does not exist
+// yet has an empty entry.
+KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
+    static const KelvoLibAgent::AccounterFactory kFactories[ACCOUNTER_TYPE_COUNT] = {};
+    return kFactories[type];
+}
+
+} // namespace
+
+KelvoLibAgent::KelvoLibAgent() : mSystemBootTime(0) {
+    for (int32_t type = 0; type < ACCOUNTER_TYPE_COUNT; ++type) {
+        mFactories[type] = builtInFactory(type);
+    }
+}
 
 void KelvoLibAgent::start(int64_t systemBootTime) {
     mSystemBootTime.store(systemBootTime, std::memory_order_relaxed);
@@ -50,6 +65,78 @@ int32_t KelvoLibAgent::doSqliteOperation(int32_t action, const android::Parcel* 
         default:
             LLOGE("Unknown action: %d", action);
             return -1;
+    }
+}
+
+DataAccounter* KelvoLibAgent::findAccounter(int32_t type) {
+    if (type < 0 || type >= ACCOUNTER_TYPE_COUNT) {
+        LLOGE("Invalid accounter type: %d", type);
+        return nullptr;
+    }
+    std::lock_guard<std::mutex> guard(mAccounterLock);
+    if (mAccounters[type] == nullptr) {
+        if (mFactories[type] == nullptr) {
+            LLOGE("Unknown accounter type: %d", type);
+            return nullptr;
+        }
+        mAccounters[type] = mFactories[type]();
+    }
+    return mAccounters[type].get();
+}
+
+int32_t KelvoLibAgent::registerListener(int32_t type,
+                                        const android::sp<LibraryListener>& listener) {
+    if (listener == nullptr) {
+        LLOGE("Invalid parameter");
+        return -1;
+    }
+    DataAccounter* accounter = findAccounter(type);
+    if (accounter == nullptr) {
+        LLOGE("Failed to find accounter by type: %d", type);
+        return -1;
+    }
+    accounter->registerListener(listener);
+    return 0;
+}
+
+int32_t KelvoLibAgent::unregisterListener(int32_t type) {
+    DataAccounter* accounter = findAccounter(type);
+    if (accounter == nullptr) {
+        LLOGE("Failed to find accounter by type: %d", type);
+        return -1;
+    }
+    accounter->unregisterListener();
+    return 0;
+}
+
+int32_t KelvoLibAgent::setDataAccounter(const android::Parcel& action) {
+    action.setDataPosition(0);
+    int32_t type = ACCOUNTER_NONE;
+    if (action.readInt32(&type) != android::NO_ERROR) {
+        LLOGE("Invalid parameter");
+        return -1;
+    }
+    DataAccounter* accounter = findAccounter(type);
+    if (accounter == nullptr) {
+        LLOGE("Failed to find accounter by type: %d", type);
+        return -1;
+    }
+    return accounter->handleAction(action);
+}
+
+void KelvoLibAgent::setAccounterFactoryForTest(int32_t type, AccounterFactory factory) {
+    if (type < 0 || type >= ACCOUNTER_TYPE_COUNT) {
+        return;
+    }
+    std::lock_guard<std::mutex> guard(mAccounterLock);
+    mFactories[type] = factory != nullptr ? std::move(factory) : builtInFactory(type);
+}
+
+void KelvoLibAgent::resetAccountersForTest() {
+    std::lock_guard<std::mutex> guard(mAccounterLock);
+    for (int32_t type = 0; type < ACCOUNTER_TYPE_COUNT; ++type) {
+        mAccounters[type].reset();
+        mFactories[type] = builtInFactory(type);
     }
 }
 

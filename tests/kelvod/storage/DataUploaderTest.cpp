@@ -1,0 +1,214 @@
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "common/TestEnv.h"
+#include "core/KelvoAgent.h"
+#include "kelvo/HostProperties.h"
+#include "kelvo/ZendrelHost.h"
+#include "kelvod/storage/StorageTestUtil.h"
+#include "storage/DataUploader.h"
+
+using android::Parcel;
+using android::String8;
+using kelvo::DataUploader;
+using kelvo::KelvoAgent;
+using kelvo::KelvoStorage;
+using kelvo::ZendrelHost;
+using kelvo::test::DirectDb;
+using kelvo::test::LogCapture;
+using kelvo::test::TempRoot;
+
+namespace {
+
+class DataUploaderTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mRoot.reset(new TempRoot());
+        mStorage = KelvoAgent::getInstance()->getStorage();
+        mUploader = DataUploader::getInstance();
+        mUploader->addSchemaTable();
+        ASSERT_EQ(0, mStorage->startConnection());
+        ZendrelHost::clearFailures();
+        mLiveBefore = ZendrelHost::liveObjects();
+    }
+    void TearDown() override {
+        mUploader->uploadEvent();
+        ZendrelHost::clearFailures();
+        mStorage->flushAllEntries();
+        mStorage->closeConnection();
+        mRoot.reset();
+    }
+
+    std::vector<Json::Value> events() const {
+        std::vector<Json::Value> out;
+        std::istringstream lines(mRoot->readFile(KELVO_ZENDREL_EVENTS_FILE));
+        std::string line;
+        while (std::getline(lines, line)) {
+            Json::Value value;
+            Json::CharReaderBuilder builder;
+            std::string errors;
+            std::istringstream in(line);
+            EXPECT_TRUE(Json::parseFromStream(builder, in, &value, &errors)) << line;
+            out.push_back(value);
+        }
+        return out;
+    }
+
+    std::vector<std::string> results() {
+        mStorage->flushAllEntries();
+        DirectDb db(mRoot->path() + KelvoStorage::kDatabasePath);
+        return db.column("SELECT eventid || ':' || result FROM debug_upload_result ORDER BY id");
+    }
+
+    std::unique_ptr<TempRoot> mRoot;
+    android::sp<KelvoStorage> mStorage;
+    DataUploader* mUploader = nullptr;
+    int32_t mLiveBefore = 0;
+};
+
+} // namespace
+
+TEST_F(DataUploaderTest, NestedClassesArraysAndTextsArriveIntact) {
+    Parcel first;
+    DataUploader::formIntData(3, 42, first);
+    DataUploader::formVarcharData(4, "com.example.app", 64, first);
+    Parcel element;
+    DataUploader::formIntData(0, 7, element);
+    DataUploader::formVarcharData(1, "gnss", 8, element);
+    Parcel other;
+    DataUploader::formIntData(0, 8, other);
+    Parcel klass;
+    DataUploader::formIntData(2, -5, klass);
+    DataUploader::formClassData(5, 903009021, klass, first);
+    DataUploader::formClassArray(6, 903009022, element, first);
+    DataUploader::formClassArray(6, 903009022, other, first);
+    DataUploader::formDynamicPathData("/data/log/kelvo/upload/kelvo-1.db", 128, first);
+    ASSERT_EQ(0, mUploader->setEventData(kelvo::EVENT_HOURLY_COMPONENTS, first, true));
+    // Accumulated: a second operator adds to the same event.
+    Parcel second;
+    DataUploader::formDatetimeData(0, 0, second);
+    ASSERT_EQ(0, mUploader->setEventData(kelvo::EVENT_HOURLY_COMPONENTS, second, false));
+    EXPECT_TRUE(events().empty());
+    EXPECT_EQ(0, mUploader->uploadEvent());
+
+    std::vector<Json::Value> sent = events();
+    ASSERT_EQ(1u, sent.size());
+    const Json::Value& e = sent[0];
+    EXPECT_EQ(903001060u, e["event"].asUInt());
+    EXPECT_EQ(42, e["params"]["3"].asInt64());
+    EXPECT_EQ("com.example.app", e["params"]["4"].asString());
+    EXPECT_EQ(903009021u, e["params"]["5"]["class"].asUInt());
+    EXPECT_EQ(-5, e["params"]["5"]["params"]["2"].asInt64());
+    ASSERT_EQ(2u, e["params"]["6"].size());
+    EXPECT_EQ(7, e["params"]["6"][0]["params"]["0"].asInt64());
+    EXPECT_EQ("gnss", e["params"]["6"][0]["params"]["1"].asString());
+    EXPECT_EQ(8, e["params"]["6"][1]["params"]["0"].asInt64());
+    EXPECT_EQ("/data/log/kelvo/upload/kelvo-1.db", e["dynamic_paths"][0].asString());
+    EXPECT_EQ(19u, e["params"]["0"].asString().size());
+    EXPECT_EQ(std::vector<std::string>{"903001060:0"}, results());
+    // Children are freed right after they are attached; the event after it is sent.
+    EXPECT_EQ(mLiveBefore, ZendrelHost::liveObjects());
+}
+
+TEST_F(DataUploaderTest, TextsAreCutToTheirLimit) {
+    Parcel p;
+    DataUploader::formVarcharData(1, "abcd", 4, p); // as long as its limit: cut by one
+    DataUploader::formVarcharData(2, "abc", 4, p);  // shorter: whole
+    DataUploader::formVarcharData(3, "abc", 0, p);  // no room at all: empty
+    DataUploader::formVarcharData(4, nullptr, 8, p); // refused, nothing written
+    ASSERT_EQ(0, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_SHELL, p, true));
+    std::vector<Json::Value> sent = events();
+    ASSERT_EQ(1u, sent.size());
+    EXPECT_EQ("abc", sent[0]["params"]["1"].asString());
+    EXPECT_EQ("abc", sent[0]["params"]["2"].asString());
+    EXPECT_EQ("", sent[0]["params"]["3"].asString());
+    EXPECT_FALSE(sent[0]["params"].isMember("4"));
+}
+
+TEST_F(DataUploaderTest, NothingIsAddedToAnEventNobodyStarted) {
+    Parcel p;
+    DataUploader::formIntData(0, 1, p);
+    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, p, false));
+    Parcel empty;
+    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, empty, true));
+    EXPECT_EQ(0, mUploader->uploadEvent());
+    EXPECT_TRUE(events().empty());
+    EXPECT_TRUE(results().empty());
+}
+
+TEST_F(DataUploaderTest, BadRecordsDiscardTheEventAndNeverReadPastTheData) {
+    Parcel good;
+    DataUploader::formIntData(0, 1, good);
+    ASSERT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_COMPONENTS, good, true));
+
+    LogCapture log;
+    Parcel bad;
+    DataUploader::formIntData(1, 2, bad);
+    bad.writeUint32(2);
+    bad.writeInt32(5); // unknown kind
+    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_COMPONENTS, bad, true));
+    EXPECT_TRUE(log.contains("Unknown upload type: 5"));
+
+    // A nested length beyond the data left.
+    Parcel lying;
+    lying.writeUint32(3);
+    lying.writeInt32(kelvo::UPLOAD_CLASS);
+    lying.writeUint32(903009021);
+    lying.writeUint32(4096);
+    lying.writeInt64(1);
+    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_APPLICATIONS, lying, true));
+    EXPECT_TRUE(log.contains("Invalid nested length"));
+
+    // A text without its terminator.
+    Parcel unterminated;
+    unterminated.writeUint32(4);
+    unterminated.writeInt32(kelvo::UPLOAD_TEXT);
+    unterminated.write("abcd", 4);
+    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_USERS, unterminated, true));
+
+    // The discarded event is gone with what it held: nothing is sent.
+    EXPECT_EQ(0, mUploader->uploadEvent());
+    EXPECT_TRUE(events().empty());
+    EXPECT_EQ(mLiveBefore, ZendrelHost::liveObjects());
+}
+
+TEST_F(DataUploaderTest, LibraryFailuresAreRecordedAndNotReportedAsSuccess) {
+    ZendrelHost::failCall(ZendrelHost::CALL_SEND, kelvo::EVENT_THERMAL_ABNORMALITY);
+    Parcel p;
+    DataUploader::formIntData(0, 1, p);
+    LogCapture log;
+    EXPECT_EQ(-22, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_ABNORMALITY, p, true));
+    EXPECT_TRUE(log.contains("Failed to send event: 903002050"));
+    EXPECT_FALSE(log.contains("Upload eventid(903002050) success"));
+
+    ZendrelHost::failCall(ZendrelHost::CALL_CREATE, 903009030);
+    Parcel child;
+    DataUploader::formIntData(0, 9, child);
+    Parcel withChild;
+    DataUploader::formIntData(1, 1, withChild);
+    DataUploader::formClassData(2, 903009030, child, withChild);
+    // A child that cannot be made fails the parameters: the event is dropped.
+    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, withChild, true));
+
+    Parcel ok;
+    DataUploader::formIntData(0, 2, ok);
+    EXPECT_EQ(0, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_SCENE, ok, true));
+    EXPECT_EQ((std::vector<std::string>{"903002050:-1", "903001055:0"}), results());
+}
+
+TEST_F(DataUploaderTest, DailyDatabaseCopyIsAnnouncedWithItsDay) {
+    kelvo::HostProperties::setForTest("ro.logsystem.usertype", "3");
+    // The file manager's daily work on a beta device.
+    mStorage->cleanDatabase(2 * 86400000LL);
+    mStorage->flushAllEntries();
+    std::vector<Json::Value> sent = events();
+    ASSERT_EQ(1u, sent.size());
+    EXPECT_EQ(903999001u, sent[0]["event"].asUInt());
+    EXPECT_TRUE(sent[0]["params"].isMember("0"));
+    EXPECT_TRUE(sent[0]["params"].isMember("1"));
+    EXPECT_NE(sent[0]["params"]["0"].asString(), sent[0]["params"]["1"].asString());
+}

@@ -1,0 +1,57 @@
+#include <gtest/gtest.h>
+
+#include <string.h>
+
+#include <cust/CustConfig.h>
+
+#include "common/TestEnv.h"
+
+namespace {
+
+constexpr const char* kSuffix = "xml/tv_kelvo_config.xml";
+
+std::string locate(const char* suffix, int type = 0) {
+    char buffer[CUST_CFG_PATH_MAX];
+    memset(buffer, 'x', sizeof(buffer));
+    const char* found = get_one_cfg_file(suffix, buffer, type);
+    return found != nullptr ? std::string(found) : std::string("(null)");
+}
+
+TEST(CustConfigTest, HighestPriorityExistingCopyWins) {
+    kelvo::test::TempRoot root;
+    EXPECT_EQ("(null)", locate(kSuffix));
+    root.writeFile("/system/etc/xml/tv_kelvo_config.xml", "s");
+    EXPECT_EQ(root.path() + "/system/etc/xml/tv_kelvo_config.xml", locate(kSuffix));
+    root.writeFile("/vendor/etc/xml/tv_kelvo_config.xml", "v");
+    EXPECT_EQ(root.path() + "/vendor/etc/xml/tv_kelvo_config.xml", locate(kSuffix));
+    // A directory of that name is no copy.
+    root.writeFile("/cust/xml/tv_kelvo_config.xml/inner", "d");
+    EXPECT_EQ(root.path() + "/vendor/etc/xml/tv_kelvo_config.xml", locate(kSuffix));
+    root.writeFile("/cust/other.xml", "c");
+    EXPECT_EQ(root.path() + "/cust/other.xml", locate("other.xml"));
+}
+
+TEST(CustConfigTest, RefusesWhatItCannotAnswerExactly) {
+    kelvo::test::TempRoot root;
+    root.writeFile("/cust/a.xml", "c");
+    root.writeFile("/a.xml", "outside");
+    EXPECT_EQ("(null)", locate("a.xml", 1));
+    EXPECT_EQ("(null)", locate("/a.xml"));
+    EXPECT_EQ("(null)", locate("../a.xml"));
+    EXPECT_EQ("(null)", locate(""));
+    char buffer[CUST_CFG_PATH_MAX];
+    EXPECT_EQ(nullptr, get_one_cfg_file(nullptr, buffer, 0));
+    EXPECT_EQ(nullptr, get_one_cfg_file("a.xml", nullptr, 0));
+
+    // The winning path fills the buffer exactly, or is not returned at all.
+    std::string dir = root.path() + "/cust/";
+    size_t fitting = CUST_CFG_PATH_MAX - 1 - dir.size();
+    std::string name(fitting, 'n');
+    root.writeFile("/cust/" + name, "fits");
+    EXPECT_EQ(dir + name, locate(name.c_str()));
+    std::string tooLong = name + "n";
+    root.writeFile("/cust/" + tooLong, "too long");
+    EXPECT_EQ("(null)", locate(tooLong.c_str()));
+}
+
+} // namespace
