@@ -41,6 +41,16 @@ void check(bool condition) {
 
 void quietLogger(const struct __android_logger_data*, const char*) {}
 
+std::string gRoot;
+
+void removeRoot() {
+    if (gRoot.rfind("/tmp/kelvo-fuzz-xml-", 0) == 0) {
+        std::string cmd = "rm -rf '" + gRoot + "'";
+        int ignored = system(cmd.c_str());
+        (void)ignored;
+    }
+}
+
 void makeDirs(const std::string& path) {
     for (size_t pos = path.find('/', 1); pos != std::string::npos; pos = path.find('/', pos + 1)) {
         mkdir(path.substr(0, pos).c_str(), 0775);
@@ -112,6 +122,8 @@ extern "C" int LLVMFuzzerInitialize(int*, char***) {
     char tmpl[] = "/tmp/kelvo-fuzz-xml-XXXXXX";
     const char* root = mkdtemp(tmpl);
     check(root != nullptr);
+    gRoot = root;
+    atexit(removeRoot);
     kelvo::RootPath::setRoot(root);
     makeDirs(kelvo::RootPath::resolve(kDataDir));
     makeDirs(kelvo::RootPath::resolve(kCustDir));

@@ -5,6 +5,7 @@
 
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
+#include "core/Dispatcher.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -215,7 +216,7 @@ void KelvoAgent::initHandlers() {
 }
 
 int32_t KelvoAgent::startDispatcher() {
-    return 0;
+    return Dispatcher::getInstance()->startDispatchMessage();
 }
 
 int32_t KelvoAgent::sendToHandler(int32_t id, int32_t code, const android::Parcel& data,

@@ -185,8 +185,8 @@ int32_t XmlParser::parseElements(int32_t element, const Parcel& request, Parcel*
     return parseComponents(element, node, request, reply);
 }
 
-int32_t XmlParser::parseComponents(int32_t element, const XMLElement* node,
-                                   const Parcel& request, Parcel* reply) {
+int32_t XmlParser::parseComponents(int32_t element, const XMLElement* node, const Parcel& request,
+                                   Parcel* reply) {
     int32_t component = 0;
     if (request.readInt32(&component) != NO_ERROR) {
         LLOGE("Invalid parameter");
@@ -357,8 +357,7 @@ int32_t XmlParser::readGroupedReply(const Parcel& reply, bool keyed,
         }
         read.push_back(std::move(parameter));
     }
-    LLOGE("Incomplete grouped reply: %zu of %zu bytes read", reply.dataPosition(),
-          reply.dataSize());
+    LLOGE("Incomplete grouped reply: %zu of %zu bytes read", reply.dataPosition(), reply.dataSize());
     return -1;
 }
 

@@ -3,7 +3,6 @@
 #include <algorithm>
 #include <atomic>
 #include <fstream>
-#include <map>
 #include <set>
 #include <sstream>
 #include <thread>
@@ -17,8 +16,8 @@
 
 using android::Parcel;
 using android::String8;
-using kelvo::XmlParser;
 using kelvo::config_parameter;
+using kelvo::XmlParser;
 using kelvo::test::LogCapture;
 using kelvo::test::TempRoot;
 
@@ -155,16 +154,15 @@ TEST_F(XmlParserTest, SimpleAndTextRepliesHoldOneEntryPerParameter) {
     EXPECT_EQ(0u, reply.dataSize());
     EXPECT_EQ(-1, simple(1000, 2, &reply));
     EXPECT_EQ(1u, mLog.count("getTextParameters# Failed to get parameter of component"));
-}
 
-TEST_F(XmlParserTest, NonIntegerSimpleValueEndsTheListAfterEarlierValues) {
-    mRoot.writeFile(kDataPath, kTestXml);
-    Parcel reply;
+    // A simple value that is not an integer ends the list; earlier ones stay.
     EXPECT_EQ(0, simple(0, 1, &reply));
     EXPECT_EQ(ints({7}), bytesOf(reply));
-    EXPECT_EQ(1u, mLog.count("[XmlParser.cpp] getSimpleParameters# Failed to get parameter of "
-                             "component",
+    EXPECT_EQ(1u, mLog.count("getSimpleParameters# Failed to get parameter of component",
                              ANDROID_LOG_ERROR));
+    // A reused reply holds the latest answer only.
+    EXPECT_EQ(-1, simple(9, 0, &reply));
+    EXPECT_EQ(0u, reply.dataSize());
 }
 
 TEST_F(XmlParserTest, GroupedRepliesKeyedUnkeyedSingleAndMissing) {
@@ -183,14 +181,12 @@ TEST_F(XmlParserTest, GroupedRepliesKeyedUnkeyedSingleAndMissing) {
     ASSERT_EQ(0, grouped(0, 4, 5, true, &reply));
     EXPECT_EQ(ints({-1}), bytesOf(reply));
 
+    // The reader gives the same back.
     std::vector<config_parameter> all = groups(0, 4, -1, true);
     ASSERT_EQ(2u, all.size());
-    EXPECT_EQ(1, all[0].id);
-    ASSERT_EQ(2u, all[0].values.size());
-    EXPECT_EQ(20, all[0].values[1].key);
-    EXPECT_EQ(-200, all[0].values[1].value);
-    EXPECT_EQ(2, all[1].id);
-    EXPECT_TRUE(groups(0, 4, 5, true).empty());
+    EXPECT_EQ(20, all[0].values.at(1).key);
+    EXPECT_EQ(-200, all[0].values.at(1).value);
+    EXPECT_EQ(300, all[1].values.at(0).value);
 }
 
 TEST_F(XmlParserTest, BadGroupedValuesEndTheirParameterAndLeaveNoLoneMark) {
@@ -285,16 +281,6 @@ TEST_F(XmlParserTest, IdsThatAreNotIntegersAndShortRequestsFailTheLookup) {
     EXPECT_EQ(-1, lookup(1, componentOnly, &reply));
 }
 
-TEST_F(XmlParserTest, ReusedReplyHoldsTheLatestAnswerOnly) {
-    mRoot.writeFile(kDataPath, kTestXml);
-    Parcel reply;
-    ASSERT_EQ(0, grouped(0, 4, -1, true, &reply));
-    ASSERT_EQ(0, simple(0, 0, &reply));
-    EXPECT_EQ(ints({30, 500}), bytesOf(reply));
-    EXPECT_EQ(-1, simple(9, 0, &reply));
-    EXPECT_EQ(0u, reply.dataSize());
-}
-
 TEST_F(XmlParserTest, CutOrEmptyGroupedRepliesReadAsFailures) {
     mRoot.writeFile(kDataPath, kTestXml);
     Parcel reply;
@@ -337,8 +323,9 @@ TEST_F(XmlParserTest, WithoutAnyFileEveryLookupFails) {
 }
 
 TEST_F(XmlParserTest, UnusableFirstFileGivesWayToTheLocatedOne) {
-    mRoot.writeFile(kVendorPath, "<c><element id=\"4\"><component id=\"0\">"
-                                 "<parameter>1</parameter></component></element></c>");
+    mRoot.writeFile(kVendorPath,
+                    "<c><element id=\"4\"><component id=\"0\">"
+                    "<parameter>1</parameter></component></element></c>");
     for (const char* first : {"<c><element id=\"4\">", "<?xml version=\"1.0\"?><!-- none -->"}) {
         XmlParser::resetInstance();
         mRoot.writeFile(kDataPath, first);
@@ -388,115 +375,91 @@ TEST_F(XmlParserTest, ConcurrentFirstUseSharesOneParser) {
     EXPECT_EQ(1u, mLog.count("Using xml:"));
 }
 
-// The sample answers every request the library and the daemon make.
+size_t valuesWithKey(const config_parameter& parameter, int32_t key) {
+    return std::count_if(parameter.values.begin(), parameter.values.end(),
+                         [key](const kelvo::config_value& v) { return v.key == key; });
+}
+
+// The sample answers every request the library and the daemon make, with
+// what each reader needs.
 TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
     std::string sample = readSource("config/tv_kelvo_config.xml");
     ASSERT_FALSE(sample.empty());
     mRoot.writeFile(kDataPath, sample);
     Parcel reply;
-
-    // Brightness slope and intercept, GNSS and flashlight powers.
-    ASSERT_EQ(0, simple(0, kelvo::PROFILE_SCREEN_BRIGHTNESS, &reply));
-    EXPECT_EQ(8u, reply.dataSize());
-    EXPECT_GT(reply.readInt32(), 0);
-    for (int32_t component : {kelvo::PROFILE_GNSS, kelvo::PROFILE_FLASHLIGHT}) {
+    // Brightness slope and intercept; GNSS and flashlight powers.
+    for (int32_t component : {0, 1, 2}) {
         ASSERT_EQ(0, simple(0, component, &reply));
+        EXPECT_EQ(component == 0 ? 8u : 4u, reply.dataSize());
         EXPECT_GT(reply.readInt32(), 0) << component;
     }
-
-    // CPU: clusters whose power grows with the frequency, and the idle power.
-    size_t clusters = 0;
-    bool idle = false;
-    for (const config_parameter& p : groups(0, kelvo::PROFILE_CPU, -1, false)) {
-        ASSERT_FALSE(p.values.empty()) << p.id;
-        if (p.id == 100) {
-            idle = true;
-            continue;
-        }
-        clusters++;
+    // CPU: two clusters whose power grows with the frequency, the idle power.
+    std::vector<config_parameter> cpu = groups(0, kelvo::PROFILE_CPU, -1, false);
+    ASSERT_EQ(3u, cpu.size());
+    EXPECT_EQ(100, cpu[2].id);
+    for (const config_parameter& p : cpu) {
+        ASSERT_FALSE(p.values.empty());
         for (size_t i = 1; i < p.values.size(); ++i) {
             EXPECT_GE(p.values[i].value, p.values[i - 1].value) << p.id;
         }
     }
-    EXPECT_EQ(2u, clusters);
-    EXPECT_TRUE(idle);
-
-    // Keyed readers: every value carries a key, each key once per parameter.
-    for (int32_t component : {kelvo::PROFILE_CAMERA, kelvo::PROFILE_GPU, kelvo::PROFILE_MODEM,
-                              kelvo::PROFILE_AUDIO}) {
-        std::vector<config_parameter> parameters = groups(0, component, -1, true);
-        EXPECT_FALSE(parameters.empty()) << component;
-        for (const config_parameter& p : parameters) {
-            EXPECT_FALSE(p.values.empty()) << component << " " << p.id;
+    // Camera (stream types 0 to 3) and GPU: maps of distinct keys.
+    for (int32_t component : {kelvo::PROFILE_CAMERA, kelvo::PROFILE_GPU}) {
+        std::vector<config_parameter> maps = groups(0, component, -1, true);
+        EXPECT_EQ(component == kelvo::PROFILE_CAMERA ? 4u : 1u, maps.size());
+        for (const config_parameter& p : maps) {
             std::set<int32_t> keys;
             for (const kelvo::config_value& v : p.values) {
+                EXPECT_GT(v.key, 0);
                 keys.insert(v.key);
             }
-            if (component == kelvo::PROFILE_CAMERA || component == kelvo::PROFILE_GPU) {
-                EXPECT_EQ(p.values.size(), keys.size()) << component << " " << p.id;
-            }
+            EXPECT_EQ(p.values.size(), keys.size()) << component << " " << p.id;
         }
     }
-    // Camera: one map per stream type 0 to 3.
-    EXPECT_EQ(4u, groups(0, kelvo::PROFILE_CAMERA, -1, true).size());
-    // Modem: modes 0 to 5 with the idle, voice and data tables of at most ten
-    // levels; the special power under mode 1.
+    // Modem: modes 0 to 5, each with idle, voice and data tables of at most
+    // ten levels; the special power under mode 1 only.
     std::vector<config_parameter> modes = groups(0, kelvo::PROFILE_MODEM, -1, true);
     ASSERT_EQ(6u, modes.size());
     for (size_t m = 0; m < modes.size(); ++m) {
         EXPECT_EQ(static_cast<int32_t>(m), modes[m].id);
-        std::map<int32_t, int> perKey;
-        for (const kelvo::config_value& v : modes[m].values) {
-            perKey[v.key]++;
-        }
         for (int32_t key : {0, 1, 2}) {
-            EXPECT_GE(perKey[key], 1) << m << " " << key;
-            EXPECT_LE(perKey[key], 10) << m << " " << key;
+            EXPECT_GE(valuesWithKey(modes[m], key), 1u) << m;
+            EXPECT_LE(valuesWithKey(modes[m], key), 10u) << m;
         }
-        EXPECT_EQ(m == 1 ? 1 : 0, perKey[3]) << m;
+        EXPECT_EQ(m == 1 ? 1u : 0u, valuesWithKey(modes[m], 3)) << m;
     }
-    // Audio: receiver and speaker, each a slope and intercept (key 0) first
-    // and smart-amplifier scales (key 1) that can divide.
+    // Audio: receiver and speaker, slope and intercept (key 0) first, then
+    // smart-amplifier scales (key 1) that can divide.
     std::vector<config_parameter> outputs = groups(0, kelvo::PROFILE_AUDIO, -1, true);
     ASSERT_EQ(2u, outputs.size());
-    for (size_t d = 0; d < outputs.size(); ++d) {
-        EXPECT_EQ(static_cast<int32_t>(d), outputs[d].id);
-        ASSERT_GE(outputs[d].values.size(), 3u);
-        EXPECT_EQ(0, outputs[d].values[0].key);
-        for (size_t i = 2; i < outputs[d].values.size(); ++i) {
-            EXPECT_EQ(1, outputs[d].values[i].key);
-            EXPECT_GE(outputs[d].values[i].value, 1);
+    for (const config_parameter& p : outputs) {
+        ASSERT_GE(p.values.size(), 3u);
+        EXPECT_EQ(2u, valuesWithKey(p, 0));
+        EXPECT_EQ(0, p.values[0].key);
+        for (size_t i = 2; i < p.values.size(); ++i) {
+            EXPECT_EQ(1, p.values[i].key);
+            EXPECT_GE(p.values[i].value, 1);
         }
     }
-
     // Wi-Fi, one request per parameter as its accounter makes them: four
-    // level weights per band in 1 and 2, a fixed power per band in 4.
+    // level weights per band in 1 and 2, one fixed power per band in 4.
     for (int32_t parameter = 0; parameter <= 4; ++parameter) {
         bool keyed = parameter == 1 || parameter == 2 || parameter == 4;
         std::vector<config_parameter> p = groups(0, kelvo::PROFILE_WIFI, parameter, keyed);
-        ASSERT_EQ(1u, p.size()) << parameter;
+        ASSERT_EQ(1u, p.size());
         EXPECT_EQ(parameter, p[0].id);
-        size_t perBand = parameter == 1 || parameter == 2 ? 4u : 1u;
-        for (int32_t band : {0, 1}) {
-            size_t n = std::count_if(p[0].values.begin(), p[0].values.end(),
-                                     [band](const kelvo::config_value& v) { return v.key == band; });
-            if (keyed) {
-                EXPECT_EQ(perBand, n) << parameter << " " << band;
-            }
+        for (int32_t band = 0; keyed && band <= 1; ++band) {
+            EXPECT_EQ(parameter == 4 ? 1u : 4u, valuesWithKey(p[0], band)) << parameter;
         }
     }
     // Bluetooth activities 0 to 4 and the common sensor types, one by one.
-    for (int32_t kind = 0; kind <= 4; ++kind) {
-        std::vector<config_parameter> p = groups(0, kelvo::PROFILE_BLUETOOTH, kind, false);
+    for (int32_t kind : {0, 1, 2, 3, 4, 101, 102, 104, 105, 108, 117, 119}) {
+        int32_t component = kind < 100 ? kelvo::PROFILE_BLUETOOTH : kelvo::PROFILE_SENSOR;
+        std::vector<config_parameter> p = groups(0, component, kind % 100, false);
         ASSERT_EQ(1u, p.size()) << kind;
         EXPECT_GT(p[0].values.at(0).value, 0);
     }
-    for (int32_t type : {1, 2, 4, 5, 8, 17, 19}) {
-        std::vector<config_parameter> p = groups(0, kelvo::PROFILE_SENSOR, type, false);
-        ASSERT_EQ(1u, p.size()) << type;
-        EXPECT_GT(p[0].values.at(0).value, 0);
-    }
-    // DPM: four coefficients for every IP block 0 to 32.
+    // DPM: four coefficients for each IP block 0 to 32.
     std::vector<config_parameter> blocks = groups(0, kelvo::PROFILE_DPM, -1, false);
     ASSERT_EQ(33u, blocks.size());
     for (size_t i = 0; i < blocks.size(); ++i) {
@@ -504,7 +467,8 @@ TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
         EXPECT_EQ(4u, blocks[i].values.size()) << i;
     }
 
-    // What the daemon reads through the entry.
+    // What the daemon reads through the entry: thresholds 0 to 9 (two values
+    // for 0), a policy each handler runs with, filters, settings, version.
     Parcel request;
     groupedRequest(&request, 0, -1, false);
     ASSERT_EQ(0, kelvo::getXmlConfig(kelvo::CONFIG_ABNORMALITY_THRESHOLD, request, &reply));
@@ -515,25 +479,15 @@ TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
         EXPECT_EQ(static_cast<int32_t>(key), thresholds[key].id);
         EXPECT_GE(thresholds[key].values.size(), key == 0 ? 2u : 1u);
     }
-    const std::pair<int32_t, int32_t> simples[] = {
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_DISPLAY},
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_GPU},
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_AUDIO},
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_MODEM},
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_DPM},
-            {kelvo::CONFIG_COMPONENT_POLICY, kelvo::POLICY_CAMERA},
-            {kelvo::CONFIG_FILTER, 0},
-            {kelvo::CONFIG_FILTER, 1},
-            {kelvo::CONFIG_SETTINGS, 0}};
-    for (const auto& [element, component] : simples) {
-        Parcel simpleReq;
-        simpleRequest(&simpleReq, component);
-        ASSERT_EQ(0, kelvo::getXmlConfig(element, simpleReq, &reply)) << element << component;
-        EXPECT_EQ(4u, reply.dataSize()) << element << " " << component;
-        if (element == kelvo::CONFIG_COMPONENT_POLICY) {
-            // Every handler of the simulated phone runs.
-            int32_t policy = reply.readInt32();
-            EXPECT_TRUE(policy == 1 || policy == 2) << component;
+    for (int32_t element : {2, 3, 4}) {
+        for (int32_t component = 0; component < (element == 2 ? 6 : element == 3 ? 2 : 1);
+             ++component) {
+            Parcel simpleReq;
+            simpleRequest(&simpleReq, component);
+            ASSERT_EQ(0, kelvo::getXmlConfig(element, simpleReq, &reply)) << element;
+            EXPECT_EQ(4u, reply.dataSize()) << element << " " << component;
+            int32_t value = reply.readInt32();
+            EXPECT_TRUE(element != 2 || value == 1 || value == 2) << component;
         }
     }
     Parcel version;

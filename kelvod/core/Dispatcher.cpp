@@ -1,0 +1,190 @@
+#include "core/Dispatcher.h"
+
+#include <errno.h>
+#include <sys/socket.h>
+#include <sys/stat.h>
+#include <unistd.h>
+
+#include <cstring>
+#include <string_view>
+
+#include <binder/Parcel.h>
+
+#include "KelvoLog.h"
+#include "core/DispatcherThread.h"
+#include "core/KelvoOperator.h"
+#include "core/LoggerRecord.h"
+#include "kelvo/LogDevice.h"
+#include "kelvo/RootPath.h"
+
+namespace kelvo {
+
+namespace {
+
+constexpr int32_t kThreadPriority = 11;
+
+std::mutex gInstanceLock;
+// Never destroyed: the dispatcher lives as long as the process.
+android::sp<Dispatcher>* gInstance = new android::sp<Dispatcher>();
+
+} // namespace
+
+android::sp<Dispatcher> Dispatcher::getInstance() {
+    std::lock_guard<std::mutex> guard(gInstanceLock);
+    if (*gInstance == nullptr) {
+        *gInstance = new Dispatcher();
+    }
+    return *gInstance;
+}
+
+void Dispatcher::resetForTest() {
+    android::sp<Dispatcher> old;
+    {
+        std::lock_guard<std::mutex> guard(gInstanceLock);
+        old = *gInstance;
+        gInstance->clear();
+    }
+    if (old != nullptr) {
+        old->stop();
+    }
+}
+
+Dispatcher::Dispatcher() : mFd(-1), mDatagram(false), mStopping(false), mLogCount(0) {
+    memset(mBuffer, 0, sizeof(mBuffer));
+    std::string path = RootPath::resolve(KELVO_LOG_DEVICE);
+    mFd = LogDevice::openForReading(path.c_str());
+    if (mFd < 0) {
+        int err = errno;
+        KLOGE("Failed to open %s: %s", path.c_str(), strerror(err));
+        return;
+    }
+    struct stat st;
+    mDatagram = fstat(mFd, &st) == 0 && S_ISSOCK(st.st_mode);
+    mThread = new DispatcherThread(this);
+}
+
+Dispatcher::~Dispatcher() {
+    if (mFd >= 0) {
+        close(mFd);
+    }
+}
+
+void Dispatcher::stop() {
+    android::sp<DispatcherThread> thread;
+    std::map<std::string, tag_handler, std::less<>> tags;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        thread = mThread;
+        mThread.clear();
+        tags.swap(mTags);
+    }
+    mStopping.store(true);
+    if (thread != nullptr) {
+        thread->requestExit();
+        // Wakes a blocked read at once; a character device is left to its
+        // next record.
+        if (mDatagram) {
+            shutdown(mFd, SHUT_RDWR);
+        }
+        thread->join();
+    }
+    if (mFd >= 0) {
+        close(mFd);
+        mFd = -1;
+    }
+}
+
+int32_t Dispatcher::registerTag(const dispatcher_tag& tag,
+                                const android::sp<KelvoOperator>& target) {
+    if (target == nullptr || tag.name == nullptr || tag.name[0] == '\0') {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    bool added;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        added = mTags.emplace(tag.name, tag_handler{tag.id, target}).second;
+    }
+    if (!added) {
+        KLOGI("Event(%s) has been registered", tag.name);
+    }
+    return 0;
+}
+
+int32_t Dispatcher::startDispatchMessage() {
+    std::lock_guard<std::mutex> guard(mLock);
+    if (mThread == nullptr) {
+        return -2;
+    }
+    if (!mThread->isRunning() && mThread->run("Dispatcher", kThreadPriority) != android::OK) {
+        return mThread->isRunning() ? 0 : -1;
+    }
+    return 0;
+}
+
+uint32_t Dispatcher::getLogCount() {
+    return mLogCount.exchange(0);
+}
+
+int32_t Dispatcher::readLoggerMessage() {
+    ssize_t n;
+    do {
+        n = read(mFd, mBuffer, kMaxRecordSize);
+    } while (n < 0 && errno == EINTR);
+    if (mStopping.load()) {
+        return 1;
+    }
+    if (n < 0 || (n == 0 && !mDatagram)) {
+        int err = n < 0 ? errno : ENODATA;
+        KLOGE("Failed to read log device: %s", strerror(err));
+        return -14;
+    }
+
+    // One bad record costs only itself: log it and read on.
+    LoggerRecord entry;
+    if (entry.decode(mBuffer, static_cast<size_t>(n)) < 0) {
+        unsigned payload = n >= 2 ? static_cast<unsigned>(mBuffer[0] | (mBuffer[1] << 8)) : 0;
+        KLOGE("Dropped malformed logger record: %zd bytes, payload length %u", n, payload);
+        return 0;
+    }
+    int32_t ret = dispatchMessage(&entry);
+    if (ret < 0) {
+        KLOGE("Dropped logger record without tag or text: %zd bytes", n);
+    }
+    return 0;
+}
+
+int32_t Dispatcher::dispatchMessage(const LoggerRecord* entry) {
+    if (entry == nullptr || entry->getTag() == nullptr || entry->getText() == nullptr) {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    if (entry->getTextLength() >= kMaxTextLength) {
+        KLOGI("Ignored long message");
+        return 0;
+    }
+    tag_handler handler;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        auto it = mTags.find(std::string_view(entry->getTag(), entry->getTagLength()));
+        if (it == mTags.end()) {
+            return 0;
+        }
+        handler = it->second;
+    }
+
+    int64_t time = entry->getTime();
+    KLOGM(LOG_MODULE_DISPATCHER, "[%s] timestamp: %lld, message: %s", entry->getTag(),
+          static_cast<long long>(time), entry->getText());
+    android::Parcel data;
+    // Sized once: the time and the text with its terminator, padded.
+    data.setDataCapacity(sizeof(int64_t) + ((entry->getTextLength() + 1 + 3) & ~size_t(3)));
+    data.writeInt64(time);
+    data.writeCString(entry->getText());
+    if (handler.target->sendLoggerMessage(handler.id, data) >= 0) {
+        mLogCount.fetch_add(1);
+    }
+    return 0;
+}
+
+} // namespace kelvo

@@ -1,0 +1,416 @@
+#include <gtest/gtest.h>
+
+#include <errno.h>
+#include <sys/stat.h>
+#include <sys/sysmacros.h>
+#include <unistd.h>
+
+#include <atomic>
+#include <cstring>
+#include <memory>
+#include <mutex>
+#include <string>
+#include <thread>
+#include <utility>
+#include <vector>
+
+#include "KelvoLog.h"
+#include "common/TestEnv.h"
+#include "core/Dispatcher.h"
+#include "core/KelvoAgent.h"
+#include "core/KelvoOperator.h"
+#include "kelvo/LogDevice.h"
+#include "kelvo/LogWriter.h"
+#include "kelvo/RootPath.h"
+
+using android::sp;
+using kelvo::Dispatcher;
+using kelvo::dispatcher_tag;
+using kelvo::KelvoOperator;
+using kelvo::LogDevice;
+using kelvo::LogWriter;
+using kelvo::test::LogCapture;
+using kelvo::test::waitFor;
+
+namespace {
+
+constexpr std::chrono::milliseconds kLongWait(20000);
+
+struct Logged {
+    int64_t time;
+    int32_t tag;
+    std::string text;
+};
+
+// Registers its tags during initialization, as every handler does, and
+// keeps what its handleLogger receives.
+class RecordingOperator : public KelvoOperator {
+public:
+    RecordingOperator(const char* name, std::vector<std::pair<std::string, int32_t>> tags)
+        : KelvoOperator(name, -1, 0), mTags(std::move(tags)) {}
+
+    void registerDispatcherTag() override {
+        for (const auto& tag : mTags) {
+            mResults.push_back(
+                    Dispatcher::getInstance()->registerTag({tag.first.c_str(), tag.second}, this));
+        }
+    }
+
+    int32_t handleLogger(int64_t time, int32_t tag, const char* text) override {
+        std::lock_guard<std::mutex> guard(mLock);
+        mLogged.push_back({time, tag, text});
+        return 0;
+    }
+
+    std::vector<Logged> logged() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mLogged;
+    }
+    size_t count() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mLogged.size();
+    }
+    const std::vector<int32_t>& results() const { return mResults; }
+
+private:
+    std::vector<std::pair<std::string, int32_t>> mTags;
+    std::vector<int32_t> mResults;
+    std::mutex mLock;
+    std::vector<Logged> mLogged;
+};
+
+void put16(std::string* s, size_t at, uint32_t v) {
+    (*s)[at] = static_cast<char>(v & 0xff);
+    (*s)[at + 1] = static_cast<char>((v >> 8) & 0xff);
+}
+
+void put32(std::string* s, size_t at, uint32_t v) {
+    for (int i = 0; i < 4; ++i) {
+        (*s)[at + i] = static_cast<char>((v >> (8 * i)) & 0xff);
+    }
+}
+
+// A record with the given payload; its header declares `declared` bytes of
+// payload (the true size when negative).
+std::string rawRecord(const std::string& payload, long declared = -1, uint32_t seconds = 1,
+                      uint32_t nanoseconds = 0) {
+    std::string record(LogDevice::kHeaderSize, '\0');
+    put16(&record, 0, static_cast<uint32_t>(declared < 0 ? payload.size() : declared));
+    put32(&record, 12, seconds);
+    put32(&record, 16, nanoseconds);
+    return record + payload;
+}
+
+std::string payload(const std::string& tag, const std::string& text) {
+    return std::string("\x04", 1) + tag + std::string(1, '\0') + text + std::string(1, '\0');
+}
+
+class DispatcherTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mRoot.reset(new kelvo::test::TempRoot());
+        Dispatcher::resetForTest();
+        mSavedInfo = kelvo::gLogInfoEnable.load();
+        mSavedMask = kelvo::gLogModuleMask.load();
+        kelvo::gLogInfoEnable.store(1);
+        kelvo::gLogModuleMask.store(0);
+        mWriter.reset(new LogWriter(kelvo::RootPath::resolve(KELVO_LOG_DEVICE)));
+    }
+    void TearDown() override {
+        Dispatcher::resetForTest();
+        for (const sp<RecordingOperator>& op : mOperators) {
+            op->requestThreadExit();
+            op->join();
+        }
+        mOperators.clear();
+        kelvo::gLogInfoEnable.store(mSavedInfo);
+        kelvo::gLogModuleMask.store(mSavedMask);
+        mWriter.reset();
+        mRoot.reset();
+    }
+
+    sp<RecordingOperator> makeOperator(const char* name,
+                                       std::vector<std::pair<std::string, int32_t>> tags) {
+        sp<RecordingOperator> op = new RecordingOperator(name, std::move(tags));
+        EXPECT_EQ(0, op->initialize());
+        mOperators.push_back(op);
+        return op;
+    }
+
+    void write(const char* tag, const std::string& text, int64_t timeMs = 1000) {
+        ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, tag, text.c_str(), timeMs));
+    }
+    void writeRaw(const std::string& bytes) {
+        ASSERT_EQ(0, mWriter->writeRaw(bytes.data(), bytes.size()));
+    }
+
+    std::unique_ptr<kelvo::test::TempRoot> mRoot;
+    std::unique_ptr<LogWriter> mWriter;
+    std::vector<sp<RecordingOperator>> mOperators;
+    int32_t mSavedInfo = 1;
+    uint32_t mSavedMask = 0;
+};
+
+} // namespace
+
+TEST_F(DispatcherTest, RecordsReachTheOperatorThatRegisteredTheirTag) {
+    sp<RecordingOperator> display =
+            makeOperator("DisplayOp", {{"KELVO_TAG_FOREGROUND_CHANGED", 0},
+                                       {"KELVO_TAG_BRIGHTNESS", 1}});
+    sp<RecordingOperator> gnss =
+            makeOperator("GnssOp", {{"KELVO_TAG_GNSS_START", 0}, {"KELVO_TAG_GNSS_STOP", 1}});
+    EXPECT_EQ((std::vector<int32_t>{0, 0}), display->results());
+    LogCapture log;
+    sp<Dispatcher> dispatcher = Dispatcher::getInstance();
+    ASSERT_EQ(0, dispatcher->startDispatchMessage());
+    // Starting twice changes nothing.
+    EXPECT_EQ(0, dispatcher->startDispatchMessage());
+
+    write("KELVO_TAG_BRIGHTNESS", "brightness=120", 1700000000123LL);
+    write("KELVO_TAG_GNSS_START", "name=com.example.maps", 1700000000200LL);
+    write("KELVO_TAG_NOBODY_LISTENS", "a=1", 1700000000300LL);
+    write("KELVO_TAG_FOREGROUND_CHANGED", "name=com.example.app with spaces", 1700000000400LL);
+    // A tag that says everything by itself.
+    write("KELVO_TAG_GNSS_STOP", "", 1700000000500LL);
+
+    ASSERT_TRUE(waitFor([&] { return display->count() == 2 && gnss->count() == 2; }, kLongWait));
+    std::vector<Logged> shown = display->logged();
+    EXPECT_EQ(1700000000123LL, shown[0].time);
+    EXPECT_EQ(1, shown[0].tag);
+    EXPECT_EQ("brightness=120", shown[0].text);
+    EXPECT_EQ(1700000000400LL, shown[1].time);
+    EXPECT_EQ(0, shown[1].tag);
+    EXPECT_EQ("name=com.example.app with spaces", shown[1].text);
+    std::vector<Logged> located = gnss->logged();
+    EXPECT_EQ(0, located[0].tag);
+    EXPECT_EQ("name=com.example.maps", located[0].text);
+    EXPECT_EQ(1700000000500LL, located[1].time);
+    EXPECT_EQ(1, located[1].tag);
+    EXPECT_EQ("", located[1].text);
+
+    // Four forwarded; the unknown tag was dropped without a word.
+    EXPECT_EQ(4u, dispatcher->getLogCount());
+    EXPECT_EQ(0u, dispatcher->getLogCount());
+    EXPECT_EQ(0u, log.count("KELVO_TAG_NOBODY_LISTENS"));
+    EXPECT_EQ(0u, log.count("", ANDROID_LOG_ERROR));
+}
+
+TEST_F(DispatcherTest, TimesComeFromUnsignedSecondsInSixtyFourBits) {
+    sp<RecordingOperator> op = makeOperator("TimeOp", {{"KELVO_TAG_TIME_CHANGED", 0}});
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+    // Past 2038 (seconds above INT32_MAX), the very last stamp, and zero.
+    const int64_t times[] = {3000000000LL * 1000 + 7, 4294967295LL * 1000 + 999, 0};
+    for (int64_t time : times) {
+        write("KELVO_TAG_TIME_CHANGED", "delta=1", time);
+    }
+    ASSERT_TRUE(waitFor([&] { return op->count() == 3; }, kLongWait));
+    std::vector<Logged> logged = op->logged();
+    for (size_t i = 0; i < 3; ++i) {
+        EXPECT_EQ(times[i], logged[i].time) << i;
+    }
+}
+
+TEST_F(DispatcherTest, TextsOf4096CharactersOrMoreAreDropped) {
+    sp<RecordingOperator> op = makeOperator("LongOp", {{"KELVO_TAG_CLOUD_UPDATE", 3}});
+    LogCapture log;
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+    std::string longest = "module=" + std::string(4095 - 7, 'm');
+    std::string tooLong = longest + "n";
+    write("KELVO_TAG_CLOUD_UPDATE", longest);
+    write("KELVO_TAG_CLOUD_UPDATE", tooLong);
+    write("KELVO_TAG_CLOUD_UPDATE", "module=after");
+
+    ASSERT_TRUE(waitFor([&] { return op->count() == 2; }, kLongWait));
+    std::vector<Logged> logged = op->logged();
+    EXPECT_EQ(4095u, logged[0].text.size());
+    EXPECT_EQ(longest, logged[0].text);
+    EXPECT_EQ("module=after", logged[1].text);
+    EXPECT_EQ(1u, log.count("Dispatcher.cpp] dispatchMessage# Ignored long message",
+                            ANDROID_LOG_INFO));
+    EXPECT_EQ(2u, Dispatcher::getInstance()->getLogCount());
+}
+
+TEST_F(DispatcherTest, MalformedRecordsAreLoggedAndCostNothingElse) {
+    sp<RecordingOperator> op = makeOperator("WakeOp", {{"KELVO_TAG_APP_WAKEUP", 0}});
+    LogCapture log;
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+
+    const std::string good = payload("KELVO_TAG_APP_WAKEUP", "procname=a");
+    const std::vector<std::string> bad = {
+            // Headers that do not fit what was read.
+            rawRecord(good, static_cast<long>(good.size()) + 1),
+            rawRecord(good, static_cast<long>(good.size()) - 1),
+            rawRecord(good).substr(0, 10),
+            std::string(),
+            rawRecord(good, -1, 5, 1000000000u),
+            // Longer than one read takes.
+            rawRecord(std::string(6000, 'x'), 6000),
+            // Payloads without a tag or without a text.
+            rawRecord(""),
+            rawRecord(std::string("\x04", 1)),
+            rawRecord(std::string("\x04\0procname=b\0", 13)),
+            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP", 21)),
+            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0", 22)),
+            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0procname=c", 32)),
+    };
+    int sent = 0;
+    for (const std::string& record : bad) {
+        write("KELVO_TAG_APP_WAKEUP", "seq=" + std::to_string(sent++));
+        writeRaw(record);
+    }
+    write("KELVO_TAG_APP_WAKEUP", "seq=" + std::to_string(sent++));
+
+    ASSERT_TRUE(waitFor([&] { return op->count() == static_cast<size_t>(sent); }, kLongWait));
+    std::vector<Logged> logged = op->logged();
+    for (int i = 0; i < sent; ++i) {
+        EXPECT_EQ("seq=" + std::to_string(i), logged[i].text);
+    }
+    // One line for each bad record, and the thread reads on.
+    EXPECT_EQ(6u, log.count("Dropped malformed logger record", ANDROID_LOG_ERROR));
+    EXPECT_EQ(6u, log.count("Dropped logger record without tag or text", ANDROID_LOG_ERROR));
+    EXPECT_EQ(1u, log.count("Dropped malformed logger record: 6000 bytes", ANDROID_LOG_ERROR) +
+                          log.count("Dropped malformed logger record: 5120 bytes",
+                                    ANDROID_LOG_ERROR));
+    EXPECT_EQ(0u, log.count("Failed to read"));
+    write("KELVO_TAG_APP_WAKEUP", "still=reading");
+    ASSERT_TRUE(waitFor([&] { return op->count() == static_cast<size_t>(sent) + 1; }, kLongWait));
+}
+
+TEST_F(DispatcherTest, RegistrationKeepsTheFirstOperatorAndRefusesBadTags) {
+    sp<RecordingOperator> first = makeOperator("FirstOp", {{"KELVO_TAG_WIFI_ON", 0}});
+    LogCapture log;
+    sp<RecordingOperator> second =
+            makeOperator("SecondOp", {{"KELVO_TAG_WIFI_ON", 5}, {"KELVO_TAG_WIFI_OFF", 6}});
+    EXPECT_EQ((std::vector<int32_t>{0, 0}), second->results());
+    EXPECT_EQ(1u, log.count("Dispatcher.cpp] registerTag# Event(KELVO_TAG_WIFI_ON) has been "
+                            "registered",
+                            ANDROID_LOG_INFO));
+
+    sp<Dispatcher> dispatcher = Dispatcher::getInstance();
+    log.clear();
+    EXPECT_EQ(-5, dispatcher->registerTag({"KELVO_TAG_X", 0}, nullptr));
+    EXPECT_EQ(-5, dispatcher->registerTag({"", 0}, first));
+    EXPECT_EQ(-5, dispatcher->registerTag({nullptr, 0}, first));
+    EXPECT_EQ(3u, log.count("registerTag# Invalid parameter", ANDROID_LOG_ERROR));
+    // Without a record there is nothing to forward.
+    EXPECT_EQ(-5, dispatcher->dispatchMessage(nullptr));
+
+    ASSERT_EQ(0, dispatcher->startDispatchMessage());
+    write("KELVO_TAG_WIFI_ON", "");
+    write("KELVO_TAG_WIFI_OFF", "");
+    ASSERT_TRUE(waitFor([&] { return first->count() == 1 && second->count() == 1; }, kLongWait));
+    EXPECT_EQ(0, first->logged()[0].tag);
+    EXPECT_EQ(6, second->logged()[0].tag);
+}
+
+TEST_F(DispatcherTest, ManyWritersAtOnceReachTheOperatorsInTheirOrder) {
+    constexpr int kWriters = 4;
+    constexpr int kRecords = 2500;
+    std::vector<sp<RecordingOperator>> ops;
+    for (int w = 0; w < kWriters; ++w) {
+        ops.push_back(makeOperator(("Op" + std::to_string(w)).c_str(),
+                                   {{"KELVO_TAG_W" + std::to_string(w), w}}));
+    }
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+    std::atomic<int> failures{0};
+    std::vector<std::thread> threads;
+    for (int w = 0; w < kWriters; ++w) {
+        threads.emplace_back([w, &failures] {
+            LogWriter writer(kelvo::RootPath::resolve(KELVO_LOG_DEVICE));
+            std::string tag = "KELVO_TAG_W" + std::to_string(w);
+            for (int i = 0; i < kRecords; ++i) {
+                std::string text = "seq=" + std::to_string(i);
+                if (writer.write(LogWriter::PRIORITY_INFO, tag.c_str(), text.c_str(), i) != 0) {
+                    failures++;
+                }
+            }
+        });
+    }
+    for (std::thread& t : threads) {
+        t.join();
+    }
+    EXPECT_EQ(0, failures.load());
+    ASSERT_TRUE(waitFor(
+            [&] {
+                for (const sp<RecordingOperator>& op : ops) {
+                    if (op->count() != static_cast<size_t>(kRecords)) return false;
+                }
+                return true;
+            },
+            std::chrono::milliseconds(60000)));
+    for (int w = 0; w < kWriters; ++w) {
+        std::vector<Logged> logged = ops[w]->logged();
+        int misplaced = 0;
+        for (int i = 0; i < kRecords; ++i) {
+            misplaced += logged[i].text != "seq=" + std::to_string(i) || logged[i].time != i ||
+                         logged[i].tag != w;
+        }
+        EXPECT_EQ(0, misplaced) << "writer " << w;
+    }
+    EXPECT_EQ(static_cast<uint32_t>(kWriters * kRecords),
+              Dispatcher::getInstance()->getLogCount());
+}
+
+TEST_F(DispatcherTest, ModuleDebugLineShowsEachForwardedRecord) {
+    sp<RecordingOperator> op = makeOperator("DebugOp", {{"KELVO_TAG_WIFI_BAND", 5}});
+    LogCapture log;
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+    write("KELVO_TAG_WIFI_BAND", "band=1", 1500);
+    ASSERT_TRUE(waitFor([&] { return op->count() == 1; }, kLongWait));
+    EXPECT_EQ(0u, log.count("timestamp:"));
+
+    kelvo::setLogModuleEnable(kelvo::LOG_MODULE_DISPATCHER, true);
+    write("KELVO_TAG_WIFI_BAND", "band=2", 2500);
+    ASSERT_TRUE(waitFor([&] { return op->count() == 2; }, kLongWait));
+    EXPECT_EQ(1u, log.count("dispatchMessage# [KELVO_TAG_WIFI_BAND] timestamp: 2500, "
+                            "message: band=2",
+                            ANDROID_LOG_DEBUG));
+}
+
+TEST_F(DispatcherTest, WithoutADeviceTheDaemonRunsWithoutItsEvents) {
+    // Something that is not a device sits at the device's path.
+    mRoot->writeFile(KELVO_LOG_DEVICE, "plain file");
+    LogCapture log;
+    sp<RecordingOperator> op = makeOperator("NoDeviceOp", {{"KELVO_TAG_GNSS_START", 0}});
+    EXPECT_EQ((std::vector<int32_t>{0}), op->results());
+    EXPECT_EQ(1u, log.count("Dispatcher.cpp] Dispatcher# Failed to open " +
+                                    kelvo::RootPath::resolve(KELVO_LOG_DEVICE),
+                            ANDROID_LOG_ERROR));
+    EXPECT_EQ(-2, Dispatcher::getInstance()->startDispatchMessage());
+    EXPECT_EQ("plain file", mRoot->readFile(KELVO_LOG_DEVICE));
+}
+
+TEST_F(DispatcherTest, TheEndOfACharacterDeviceEndsTheThread) {
+    // A device that is always at its end (the null device's numbers).
+    std::string path = kelvo::RootPath::resolve(KELVO_LOG_DEVICE);
+    kelvo::test::makeHostDirs(mRoot->path() + "/dev");
+    if (mknod(path.c_str(), S_IFCHR | 0600, makedev(1, 3)) != 0) {
+        GTEST_SKIP() << "cannot make a character device here: " << strerror(errno);
+    }
+    LogCapture log;
+    sp<RecordingOperator> op = makeOperator("EndOp", {{"KELVO_TAG_GNSS_START", 0}});
+    ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+    EXPECT_TRUE(waitFor([&] { return log.contains("Failed to read logger message: -14"); },
+                        kLongWait));
+    EXPECT_EQ(1u, log.count("readLoggerMessage# Failed to read log device: ", ANDROID_LOG_ERROR));
+}
+
+TEST_F(DispatcherTest, TheAgentStartsTheDispatcherAfterTheOperatorsRegistered) {
+    static sp<RecordingOperator> sDisplay;
+    kelvo::KelvoAgent::setHandlerFactory(kelvo::HANDLER_DISPLAY, [] {
+        sDisplay = new RecordingOperator("AgentDisplayOp", {{"KELVO_TAG_BRIGHTNESS", 1}});
+        return sp<KelvoOperator>(sDisplay);
+    });
+    sp<kelvo::KelvoAgent> agent = new kelvo::KelvoAgent();
+    EXPECT_EQ(0, agent->initiate());
+    kelvo::KelvoAgent::setHandlerFactory(kelvo::HANDLER_DISPLAY, nullptr);
+    ASSERT_NE(nullptr, sDisplay.get());
+    mOperators.push_back(sDisplay);
+
+    write("KELVO_TAG_BRIGHTNESS", "brightness=0", 42);
+    EXPECT_TRUE(waitFor([&] { return sDisplay->count() == 1; }, kLongWait));
+    EXPECT_EQ(1, sDisplay->logged()[0].tag);
+    sDisplay.clear();
+    agent->getStorage()->closeConnection();
+    agent->getStorage()->requestThreadExit();
+}

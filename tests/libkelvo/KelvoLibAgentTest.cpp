@@ -1,0 +1,134 @@
+// The accounter table behind the entry functions: lookup, lazy creation,
+// listeners and the routing of action parcels.
+
+#include <gtest/gtest.h>
+
+#include <stdint.h>
+
+#include <atomic>
+#include <string>
+
+#include <binder/Parcel.h>
+
+#include "common/TestEnv.h"
+#include "libkelvo/LibraryTestUtil.h"
+
+using android::Parcel;
+using android::sp;
+using namespace kelvo;
+using namespace kelvo::test;
+
+namespace {
+
+class KelvoLibAgentTest : public ::testing::Test {
+protected:
+    LibraryFixture mLibrary;
+    LogCapture mLog;
+};
+
+int32_t activate(int32_t type, int64_t time, const char* name) {
+    return Action(type, ACTION_ACTIVATE).i32(0).i64(time).str(name).send();
+}
+
+int32_t deactivate(int32_t type, int64_t time, const char* name) {
+    return Action(type, ACTION_DEACTIVATE).i32(0).i64(time).str(name).send();
+}
+
+TEST_F(KelvoLibAgentTest, TypesWithoutAccounterAreRefused) {
+    for (int32_t type : {12, -1}) {
+        mLog.clear();
+        EXPECT_EQ(-1, Action(type, ACTION_FOREGROUND).i64(0).str("a").send());
+        const std::string number = std::to_string(type);
+        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] findAccounter# Invalid accounter type: " +
+                                         number,
+                                 ANDROID_LOG_ERROR));
+        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] setDataAccounter# Failed to find accounter "
+                                 "by type: " + number,
+                                 ANDROID_LOG_ERROR));
+        EXPECT_EQ(-1, registerLibraryListener(type, new RecordingListener()));
+        EXPECT_EQ(-1, unregisterLibraryListener(type));
+    }
+    // In range, but no accounter of that type exists.
+    mLog.clear();
+    EXPECT_EQ(-1, Action(ACCOUNTER_CAMERA, ACTION_FOREGROUND).i64(0).str("a").send());
+    EXPECT_TRUE(mLog.contains("Unknown accounter type: 4", ANDROID_LOG_ERROR));
+    EXPECT_TRUE(mLog.contains("Failed to find accounter by type: 4", ANDROID_LOG_ERROR));
+    // Null listener; empty action parcel.
+    EXPECT_EQ(-1, registerLibraryListener(kSole, nullptr));
+    EXPECT_TRUE(mLog.contains("[KelvoLibAgent.cpp] registerListener# Invalid parameter"));
+    Parcel empty;
+    EXPECT_EQ(-1, setDataAccounter(empty));
+}
+
+TEST_F(KelvoLibAgentTest, AccountersAreCreatedOnceOnFirstUse) {
+    std::atomic<int> created{0};
+    KelvoLibAgent::getInstance()->setAccounterFactoryForTest(ACCOUNTER_GPU, [&created] {
+        created++;
+        return std::make_unique<SoleTestAccounter>();
+    });
+    EXPECT_EQ(0, created.load());
+    // Registering a listener creates the accounter.
+    auto listener = listenTo(ACCOUNTER_GPU);
+    EXPECT_EQ(1, created.load());
+    ASSERT_EQ(0, Action(ACCOUNTER_GPU, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(ACCOUNTER_GPU, 0, "a"));
+    ASSERT_EQ(0, unregisterLibraryListener(ACCOUNTER_GPU));
+    ASSERT_EQ(0, registerLibraryListener(ACCOUNTER_GPU, listener));
+    EXPECT_EQ(1, created.load());
+    // The same accounter kept its element.
+    ASSERT_EQ(0, deactivate(ACCOUNTER_GPU, 5, "a"));
+    ASSERT_EQ(1u, listener->mReplies.size());
+    EXPECT_EQ(elementReply(0, 0, 5, "a", screenOnBackground(5, 5)), listener->mReplies[0].bytes);
+}
+
+TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
+    sp<RecordingListener> first = listenTo(kSole);
+    sp<RecordingListener> second = listenTo(kSole);
+    sp<RecordingListener> other = listenTo(kShared);
+    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kSole, 0, "a"));
+    // The parcel is read from its start whatever its position.
+    Action removal(kSole, ACTION_DEACTIVATE);
+    removal.i32(0).i64(10).str("a");
+    removal.parcel().setDataPosition(removal.parcel().dataSize());
+    ASSERT_EQ(0, removal.send());
+    EXPECT_TRUE(first->mReplies.empty());
+    EXPECT_TRUE(other->mReplies.empty());
+    ASSERT_EQ(1u, second->mReplies.size());
+    EXPECT_EQ(0u, second->mPosition[0]);
+
+    // Unregistered: the records are dropped and the library lets go of it.
+    ASSERT_EQ(0, unregisterLibraryListener(kSole));
+    EXPECT_EQ(1, second->getStrongCount());
+    ASSERT_EQ(0, activate(kSole, 10, "a"));
+    EXPECT_EQ(-1, deactivate(kSole, 20, "a"));
+    EXPECT_TRUE(mLog.contains("Invalid listener", ANDROID_LOG_ERROR));
+    EXPECT_EQ(1u, second->mReplies.size());
+}
+
+// Hands a new action to the accounter that is calling it.
+class ReenteringListener : public LibraryListener {
+public:
+    int32_t handleLibraryEvent(int32_t event, const Parcel& reply) override {
+        mNestedResult = activate(kSole, 100, "b");
+        mReplies++;
+        return 0;
+    }
+    int32_t mNestedResult = 0;
+    int mReplies = 0;
+};
+
+TEST_F(KelvoLibAgentTest, AListenerCannotActOnItsOwnAccounter) {
+    sp<ReenteringListener> listener = new ReenteringListener();
+    ASSERT_EQ(0, registerLibraryListener(kSole, listener));
+    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kSole, 0, "a"));
+    EXPECT_EQ(0, deactivate(kSole, 10, "a"));
+    EXPECT_EQ(1, listener->mReplies);
+    EXPECT_EQ(-1, listener->mNestedResult);
+    EXPECT_TRUE(mLog.contains("Nested action refused: 4", ANDROID_LOG_ERROR));
+    // The accounter still serves its own caller afterwards.
+    EXPECT_EQ(0, activate(kSole, 20, "c"));
+}
+
+} // namespace

@@ -1,0 +1,169 @@
+// The actions of the accounter base, through setDataAccounter: how each is
+// decoded, how it drives the allocators and how failures stay local.
+
+#include <gtest/gtest.h>
+
+#include <stdint.h>
+
+#include "common/TestEnv.h"
+#include "libkelvo/LibraryTestUtil.h"
+
+using namespace kelvo;
+using namespace kelvo::test;
+
+namespace {
+
+class DataAccounterTest : public ::testing::Test {
+protected:
+    LibraryFixture mLibrary;
+    LogCapture mLog;
+};
+
+int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
+    return Action(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
+}
+
+TEST_F(DataAccounterTest, ActionCodesOutsideTheTableAreRefused) {
+    auto listener = listenTo(kSole);
+    EXPECT_EQ(-1, Action(kSole, 8).i64(0).send());
+    EXPECT_TRUE(mLog.contains("[DataAccounter.cpp] dispatchAction# Unknown action: 8",
+                              ANDROID_LOG_ERROR));
+    EXPECT_EQ(-1, Action(kSole, -1).send());
+    EXPECT_TRUE(mLog.contains("Unknown action: -1", ANDROID_LOG_ERROR));
+    // A parcel that ends before the action code or before an action's fields.
+    android::Parcel typeOnly;
+    typeOnly.writeInt32(kSole);
+    EXPECT_EQ(-1, setDataAccounter(typeOnly));
+    EXPECT_EQ(-1, Action(kSole, ACTION_FOREGROUND).i64(10).send());
+    EXPECT_EQ(-1, Action(kSole, ACTION_SCREEN_STATE).send());
+    EXPECT_EQ(-1, Action(kSole, ACTION_ACTIVATE).i32(0).i64(10).send());
+    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE_ALL).send());
+    EXPECT_TRUE(listener->mReplies.empty());
+}
+
+TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
+    auto listener = listenTo(kSole);
+    // No allocator yet: the foreground and the screen state are only stored.
+    EXPECT_EQ(0, Action(kSole, ACTION_FOREGROUND).i64(0).str("com.game").send());
+    EXPECT_EQ(0, Action(kSole, ACTION_SCREEN_STATE).i64(0).flag(false).send());
+    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kSole, 0, 0, "com.game"));
+    ASSERT_EQ(0, Action(kSole, ACTION_DEACTIVATE).i32(0).i64(40).str("com.game").send());
+    ASSERT_EQ(1u, listener->mReplies.size());
+    EXPECT_EQ(elementReply(0, 0, 40, "com.game",
+                           Buckets().set(BUCKET_FOREGROUND, 40, 40).set(BUCKET_SCREEN_OFF, 40, 40)),
+              listener->mReplies[0].bytes);
+}
+
+TEST_F(DataAccounterTest, BalanceReasons) {
+    auto listener = listenTo(kSole);
+    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
+    EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(2).i64(100).send());
+    EXPECT_TRUE(mLog.contains("Unknown balance reason: 2", ANDROID_LOG_ERROR));
+    EXPECT_TRUE(listener->mReplies.empty());
+
+    // Reason 0: one time ends the records and starts them again.
+    EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(100).send());
+    // Reason 1: an end and a later new start.
+    EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(300).i64(1000).send());
+    EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1100).send());
+    ASSERT_EQ(2u, listener->mReplies.size());
+    EXPECT_EQ(elementReply(0, 0, 100, "a", screenOnBackground(100, 100)),
+              listener->mReplies[0].bytes);
+    EXPECT_EQ(elementReply(0, 100, 300, "a", screenOnBackground(200, 200)),
+              listener->mReplies[1].bytes);
+}
+
+TEST_F(DataAccounterTest, DeactivateNeedsAKnownAllocator) {
+    auto listener = listenTo(kSole);
+    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE).i32(5).i64(10).str("a").send());
+    EXPECT_TRUE(mLog.contains("Failed to find allocator: 5", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-1, activate(kSole, -3, 10, "a"));
+    EXPECT_TRUE(mLog.contains("Invalid allocator key: -3", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(-3).i64(10).i32(1).send());
+    // A SetValue whose value fields are missing changes nothing.
+    ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
+    EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(0).i64(20).send());
+    EXPECT_TRUE(mLog.contains("Failed to get power value", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE).i32(0).i64(30).str("b").send());
+    EXPECT_TRUE(mLog.contains("Failed to remove element", ANDROID_LOG_ERROR));
+    EXPECT_TRUE(listener->mReplies.empty());
+}
+
+TEST_F(DataAccounterTest, DeactivateAllContinuesPastAFailure) {
+    auto listener = listenTo(kSole);
+    // Key 0 exists but is idle (its removal fails); keys 1 and 2 are active.
+    for (int32_t key = 0; key < 3; ++key) {
+        ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(key).i64(0).i32(1000).send());
+    }
+    ASSERT_EQ(0, activate(kSole, 1, 0, "one"));
+    ASSERT_EQ(0, activate(kSole, 2, 0, "two"));
+    EXPECT_EQ(0, Action(kSole, ACTION_DEACTIVATE_ALL).i64(50).send());
+    EXPECT_EQ(1u, mLog.count("Failed to remove all elements", ANDROID_LOG_ERROR));
+    ASSERT_EQ(2u, listener->mReplies.size());
+    // The Sole reply opens with the accounter's prefix: the last key it read.
+    EXPECT_EQ(elementReply(2, 0, 50, "one", screenOnBackground(50, 50)),
+              listener->mReplies[0].bytes);
+    EXPECT_EQ(elementReply(2, 0, 50, "two", screenOnBackground(50, 50)),
+              listener->mReplies[1].bytes);
+}
+
+TEST_F(DataAccounterTest, AKeyWithoutAllocatorStandsInNobodysWay) {
+    auto listener = listenTo(kSole);
+    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(1).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kSole, 1, 0, "a"));
+    EXPECT_EQ(-1, activate(kSole, kKeyWithoutAllocator, 0, "b"));
+    EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(kKeyWithoutAllocator).i64(0).i32(5).send());
+    EXPECT_EQ(2u, mLog.count("Invalid allocator", ANDROID_LOG_ERROR));
+    // Not stored: the key is unknown afterwards.
+    EXPECT_EQ(-1,
+              Action(kSole, ACTION_DEACTIVATE).i32(kKeyWithoutAllocator).i64(0).str("b").send());
+    EXPECT_TRUE(mLog.contains("Failed to find allocator: 99", ANDROID_LOG_ERROR));
+
+    // State changes and balances go on for the others.
+    EXPECT_EQ(0, Action(kSole, ACTION_SCREEN_STATE).i64(60).flag(false).send());
+    EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(100).send());
+    ASSERT_EQ(1u, listener->mReplies.size());
+    EXPECT_EQ(elementReply(1, 0, 100, "a",
+                           Buckets()
+                                   .set(BUCKET_BACKGROUND, 100, 100)
+                                   .set(BUCKET_SCREEN_ON, 60, 60)
+                                   .set(BUCKET_SCREEN_OFF, 40, 40)),
+              listener->mReplies[0].bytes);
+}
+
+TEST_F(DataAccounterTest, ARefusedRecordDoesNotStopTheBalance) {
+    auto listener = listenTo(kSole);
+    for (int32_t key = 1; key <= 3; ++key) {
+        ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(key).i64(0).i32(1000).send());
+        ASSERT_EQ(0, activate(kSole, key, 0, "app"));
+    }
+    listener->refuse(2);
+    EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(70).send());
+    EXPECT_EQ(1u, mLog.count("Failed to balance accounting data", ANDROID_LOG_ERROR));
+    ASSERT_EQ(3u, listener->mReplies.size());
+    for (int32_t key = 1; key <= 3; ++key) {
+        EXPECT_EQ(elementReply(key, 0, 70, "app", screenOnBackground(70, 70)),
+                  listener->mReplies[key - 1].bytes);
+    }
+    // Every allocator was cut at 70, the refused one too.
+    EXPECT_EQ(0, Action(kSole, ACTION_DEACTIVATE).i32(3).i64(100).str("app").send());
+    EXPECT_EQ(elementReply(3, 70, 100, "app", screenOnBackground(30, 30)),
+              listener->mReplies[3].bytes);
+}
+
+TEST_F(DataAccounterTest, RecordsWithoutListenerAreDropped) {
+    ASSERT_EQ(0, Action(kShared, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, activate(kShared, 0, 0, "a"));
+    EXPECT_EQ(-1, Action(kShared, ACTION_BALANCE).i32(BALANCE_AT).i64(10).send());
+    EXPECT_EQ(-1, Action(kShared, ACTION_DEACTIVATE).i32(0).i64(20).str("a").send());
+    // The element and component record of the balance, then of the removal.
+    EXPECT_EQ(4u, mLog.count("Invalid listener", ANDROID_LOG_ERROR));
+    // The element is gone all the same.
+    auto listener = listenTo(kShared);
+    EXPECT_EQ(0, Action(kShared, ACTION_BALANCE).i32(BALANCE_AT).i64(30).send());
+    EXPECT_TRUE(listener->mReplies.empty());
+}
+
+} // namespace
