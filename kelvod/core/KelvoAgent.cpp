@@ -6,6 +6,7 @@
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "core/Dispatcher.h"
+#include "core/AppsAccounting.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -177,6 +178,7 @@ void KelvoAgent::startStorage() {
             routine->addSchemaTable();
         }
     }
+    AppsAccounting::getInstance()->addSchemaTable();
     DataUploader::getInstance()->addSchemaTable();
     if (mStorage->startConnection() < 0) {
         KLOGE("Failed to start storage");
@@ -297,6 +299,7 @@ void KelvoAgent::cleanTables(int64_t time) {
             routine->cleanTables(time);
         }
     }
+    AppsAccounting::getInstance()->cleanTables(time);
     DataUploader::getInstance()->cleanTables(time);
 }
 

@@ -84,8 +84,7 @@ DataAccounter* KelvoLibAgent::findAccounter(int32_t type) {
     return mAccounters[type].get();
 }
 
-int32_t KelvoLibAgent::registerListener(int32_t type,
-                                        const android::sp<LibraryListener>& listener) {
+int32_t KelvoLibAgent::registerListener(int32_t type, const android::sp<LibraryListener>& listener) {
     if (listener == nullptr) {
         LLOGE("Invalid parameter");
         return -1;

@@ -26,25 +26,15 @@ protected:
     LogCapture mLog;
 };
 
-int32_t activate(int32_t type, int64_t time, const char* name) {
-    return Action(type, ACTION_ACTIVATE).i32(0).i64(time).str(name).send();
-}
-
-int32_t deactivate(int32_t type, int64_t time, const char* name) {
-    return Action(type, ACTION_DEACTIVATE).i32(0).i64(time).str(name).send();
-}
-
 TEST_F(KelvoLibAgentTest, TypesWithoutAccounterAreRefused) {
     for (int32_t type : {12, -1}) {
         mLog.clear();
         EXPECT_EQ(-1, Action(type, ACTION_FOREGROUND).i64(0).str("a").send());
         const std::string number = std::to_string(type);
-        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] findAccounter# Invalid accounter type: " +
-                                         number,
-                                 ANDROID_LOG_ERROR));
-        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] setDataAccounter# Failed to find accounter "
-                                 "by type: " + number,
-                                 ANDROID_LOG_ERROR));
+        const std::string invalid = "findAccounter# Invalid accounter type: " + number;
+        const std::string notFound = "setDataAccounter# Failed to find accounter by type: " + number;
+        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] " + invalid, ANDROID_LOG_ERROR));
+        EXPECT_EQ(1u, mLog.count("[KelvoLibAgent.cpp] " + notFound, ANDROID_LOG_ERROR));
         EXPECT_EQ(-1, registerLibraryListener(type, new RecordingListener()));
         EXPECT_EQ(-1, unregisterLibraryListener(type));
     }
@@ -70,13 +60,13 @@ TEST_F(KelvoLibAgentTest, AccountersAreCreatedOnceOnFirstUse) {
     // Registering a listener creates the accounter.
     auto listener = listenTo(ACCOUNTER_GPU);
     EXPECT_EQ(1, created.load());
-    ASSERT_EQ(0, Action(ACCOUNTER_GPU, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
-    ASSERT_EQ(0, activate(ACCOUNTER_GPU, 0, "a"));
+    ASSERT_EQ(0, setPower(ACCOUNTER_GPU, 0, 0, 1000));
+    ASSERT_EQ(0, activate(ACCOUNTER_GPU, 0, 0, "a"));
     ASSERT_EQ(0, unregisterLibraryListener(ACCOUNTER_GPU));
     ASSERT_EQ(0, registerLibraryListener(ACCOUNTER_GPU, listener));
     EXPECT_EQ(1, created.load());
     // The same accounter kept its element.
-    ASSERT_EQ(0, deactivate(ACCOUNTER_GPU, 5, "a"));
+    ASSERT_EQ(0, deactivate(ACCOUNTER_GPU, 0, 5, "a"));
     ASSERT_EQ(1u, listener->mReplies.size());
     EXPECT_EQ(elementReply(0, 0, 5, "a", screenOnBackground(5, 5)), listener->mReplies[0].bytes);
 }
@@ -85,8 +75,8 @@ TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
     sp<RecordingListener> first = listenTo(kSole);
     sp<RecordingListener> second = listenTo(kSole);
     sp<RecordingListener> other = listenTo(kShared);
-    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
-    ASSERT_EQ(0, activate(kSole, 0, "a"));
+    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
+    ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
     // The parcel is read from its start whatever its position.
     Action removal(kSole, ACTION_DEACTIVATE);
     removal.i32(0).i64(10).str("a");
@@ -100,8 +90,8 @@ TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
     // Unregistered: the records are dropped and the library lets go of it.
     ASSERT_EQ(0, unregisterLibraryListener(kSole));
     EXPECT_EQ(1, second->getStrongCount());
-    ASSERT_EQ(0, activate(kSole, 10, "a"));
-    EXPECT_EQ(-1, deactivate(kSole, 20, "a"));
+    ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
+    EXPECT_EQ(-1, deactivate(kSole, 0, 20, "a"));
     EXPECT_TRUE(mLog.contains("Invalid listener", ANDROID_LOG_ERROR));
     EXPECT_EQ(1u, second->mReplies.size());
 }
@@ -110,7 +100,7 @@ TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
 class ReenteringListener : public LibraryListener {
 public:
     int32_t handleLibraryEvent(int32_t event, const Parcel& reply) override {
-        mNestedResult = activate(kSole, 100, "b");
+        mNestedResult = activate(kSole, 0, 100, "b");
         mReplies++;
         return 0;
     }
@@ -121,14 +111,14 @@ public:
 TEST_F(KelvoLibAgentTest, AListenerCannotActOnItsOwnAccounter) {
     sp<ReenteringListener> listener = new ReenteringListener();
     ASSERT_EQ(0, registerLibraryListener(kSole, listener));
-    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
-    ASSERT_EQ(0, activate(kSole, 0, "a"));
-    EXPECT_EQ(0, deactivate(kSole, 10, "a"));
+    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
+    ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
+    EXPECT_EQ(0, deactivate(kSole, 0, 10, "a"));
     EXPECT_EQ(1, listener->mReplies);
     EXPECT_EQ(-1, listener->mNestedResult);
     EXPECT_TRUE(mLog.contains("Nested action refused: 4", ANDROID_LOG_ERROR));
     // The accounter still serves its own caller afterwards.
-    EXPECT_EQ(0, activate(kSole, 20, "c"));
+    EXPECT_EQ(0, activate(kSole, 0, 20, "c"));
 }
 
 } // namespace

@@ -35,9 +35,9 @@ TEST(KelvoLibEntryTest, UnknownActionsAndMissingParcelsAreRefused) {
                             ANDROID_LOG_ERROR));
     EXPECT_TRUE(log.contains("Unknown action: -1", ANDROID_LOG_ERROR));
 
-    for (int32_t action : {kelvo::SQL_OPEN_CONNECTION, kelvo::SQL_CREATE_TABLE,
-                           kelvo::SQL_INSERT_ENTRIES, kelvo::SQL_EXECUTE_ENTRY,
-                           kelvo::SQL_SIMPLE_QUERY, kelvo::SQL_BACKUP_COPY}) {
+    for (int32_t action :
+         {kelvo::SQL_OPEN_CONNECTION, kelvo::SQL_CREATE_TABLE, kelvo::SQL_INSERT_ENTRIES,
+          kelvo::SQL_EXECUTE_ENTRY, kelvo::SQL_SIMPLE_QUERY, kelvo::SQL_BACKUP_COPY}) {
         EXPECT_EQ(-1, kelvo::doSqliteOperation(action, nullptr, nullptr)) << action;
     }
     android::Parcel query;
@@ -59,8 +59,7 @@ TEST(KelvoLibEntryTest, SwitchesFollowTheirProperties) {
     EXPECT_EQ(0, kelvo::gLibLogDebugEnable.load());
     LogCapture log;
     kelvo::startLibrary(1234);
-    EXPECT_EQ(1u, log.count("[KelvoLibAgent.cpp] start# KELVO library starting",
-                            ANDROID_LOG_INFO));
+    EXPECT_EQ(1u, log.count("[KelvoLibAgent.cpp] start# KELVO library starting", ANDROID_LOG_INFO));
 
     HostProperties::setForTest("persist.libkelvo.log.debug", "1");
     HostProperties::setForTest("persist.libkelvo.log.info", "2");

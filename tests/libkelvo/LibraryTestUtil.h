@@ -145,7 +145,8 @@ public:
     LibraryFixture() {
         KelvoLibAgent* agent = KelvoLibAgent::getInstance();
         agent->resetAccountersForTest();
-        agent->setAccounterFactoryForTest(kSole, [] { return std::make_unique<SoleTestAccounter>(); });
+        agent->setAccounterFactoryForTest(kSole,
+                                          [] { return std::make_unique<SoleTestAccounter>(); });
         agent->setAccounterFactoryForTest(kShared,
                                           [] { return std::make_unique<SharedTestAccounter>(); });
         agent->setAccounterFactoryForTest(kSensor,
@@ -216,6 +217,20 @@ public:
 private:
     std::unique_ptr<android::Parcel> mParcel; // parcels do not copy; actions move
 };
+
+// The actions of the keyed test accounters.
+inline int32_t setPower(int32_t type, int32_t key, int64_t time, int32_t power) {
+    return Action(type, ACTION_SET_VALUE).i32(key).i64(time).i32(power).send();
+}
+inline int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
+    return Action(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
+}
+inline int32_t deactivate(int32_t type, int32_t key, int64_t time, const char* name) {
+    return Action(type, ACTION_DEACTIVATE).i32(key).i64(time).str(name).send();
+}
+inline int32_t balanceAt(int32_t type, int64_t time) {
+    return Action(type, ACTION_BALANCE).i32(BALANCE_AT).i64(time).send();
+}
 
 // The six buckets of an expected record; usage in the unit of the record.
 struct Buckets {

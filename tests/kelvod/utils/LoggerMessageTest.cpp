@@ -1,5 +1,6 @@
 #include <gtest/gtest.h>
 
+#include <cctype>
 #include <cstring>
 #include <memory>
 #include <string>
@@ -159,10 +160,11 @@ TEST_P(LoggerMessageTest, ParsesOrRefusesWithItsErrorLine) {
                     ASSERT_EQ(kFill, out[i]) << i;
                 }
             } else {
-                // The value, then zeros to the end of the output.
+                // The value and its terminator; "%s" zeros the whole rest.
                 size_t n = strlen(c.value);
                 EXPECT_EQ(std::string(c.value), std::string(reinterpret_cast<char*>(out.get()), n));
-                for (size_t i = n; i < c.outSize; ++i) {
+                size_t zeroTo = strcmp(c.format, "%s") == 0 ? c.outSize : n + 1;
+                for (size_t i = n; i < zeroTo; ++i) {
                     ASSERT_EQ(0, out[i]) << i;
                 }
             }
@@ -179,7 +181,7 @@ INSTANTIATE_TEST_SUITE_P(Cases, LoggerMessageTest, ::testing::ValuesIn(kCases),
                              return name;
                          });
 
-TEST(LoggerMessageNullTest, RefusesMissingTextFormatOrOutput) {
+TEST(LoggerMessageLimitsTest, RefusesMissingTextFormatOrOutput) {
     LogCapture log;
     int32_t out = 7;
     EXPECT_EQ(-5, parseMessage(nullptr, "uid=", nullptr, "%d", &out, sizeof(out)));
@@ -189,17 +191,17 @@ TEST(LoggerMessageNullTest, RefusesMissingTextFormatOrOutput) {
     EXPECT_EQ(3u, log.count("parseMessage# Invalid parameter", ANDROID_LOG_ERROR));
 }
 
-TEST(LoggerMessageNullTest, LongValuesAreTakenUpTo4095Characters) {
+TEST(LoggerMessageLimitsTest, LongValuesAreTakenUpTo4095Characters) {
     // A value running past the second key's search: 5000 characters, read
     // into the largest output.
     std::string text = "name=" + std::string(5000, 'n') + " type=1";
     std::unique_ptr<char[]> out(new char[4096]);
     ASSERT_EQ(0, parseMessage(text.c_str(), "name=", "type=", "%s", out.get(), 4096));
     EXPECT_EQ(4095u, strnlen(out.get(), 4096));
-    std::string bounded = "count=" + std::string(5000, '9');
     int32_t type = 0;
     ASSERT_EQ(0, parseMessage(text.c_str(), "type=", nullptr, "%d", &type, sizeof(type)));
     EXPECT_EQ(1, type);
+    std::string bounded = "count=" + std::string(5000, '9');
     char digits[8];
     ASSERT_EQ(0, parseMessage(bounded.c_str(), "count=", nullptr, "%7s", digits, sizeof(digits)));
     EXPECT_STREQ("9999999", digits);

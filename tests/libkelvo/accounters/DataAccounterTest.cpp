@@ -19,10 +19,6 @@ protected:
     LogCapture mLog;
 };
 
-int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
-    return Action(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
-}
-
 TEST_F(DataAccounterTest, ActionCodesOutsideTheTableAreRefused) {
     auto listener = listenTo(kSole);
     EXPECT_EQ(-1, Action(kSole, 8).i64(0).send());
@@ -46,7 +42,7 @@ TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
     // No allocator yet: the foreground and the screen state are only stored.
     EXPECT_EQ(0, Action(kSole, ACTION_FOREGROUND).i64(0).str("com.game").send());
     EXPECT_EQ(0, Action(kSole, ACTION_SCREEN_STATE).i64(0).flag(false).send());
-    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 0, 0, "com.game"));
     ASSERT_EQ(0, Action(kSole, ACTION_DEACTIVATE).i32(0).i64(40).str("com.game").send());
     ASSERT_EQ(1u, listener->mReplies.size());
@@ -57,14 +53,14 @@ TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
 
 TEST_F(DataAccounterTest, BalanceReasons) {
     auto listener = listenTo(kSole);
-    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
     EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(2).i64(100).send());
     EXPECT_TRUE(mLog.contains("Unknown balance reason: 2", ANDROID_LOG_ERROR));
     EXPECT_TRUE(listener->mReplies.empty());
 
     // Reason 0: one time ends the records and starts them again.
-    EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(100).send());
+    EXPECT_EQ(0, balanceAt(kSole, 100));
     // Reason 1: an end and a later new start.
     EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(300).i64(1000).send());
     EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1100).send());
@@ -77,7 +73,7 @@ TEST_F(DataAccounterTest, BalanceReasons) {
 
 TEST_F(DataAccounterTest, DeactivateNeedsAKnownAllocator) {
     auto listener = listenTo(kSole);
-    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE).i32(5).i64(10).str("a").send());
+    EXPECT_EQ(-1, deactivate(kSole, 5, 10, "a"));
     EXPECT_TRUE(mLog.contains("Failed to find allocator: 5", ANDROID_LOG_ERROR));
     EXPECT_EQ(-1, activate(kSole, -3, 10, "a"));
     EXPECT_TRUE(mLog.contains("Invalid allocator key: -3", ANDROID_LOG_ERROR));
@@ -86,7 +82,7 @@ TEST_F(DataAccounterTest, DeactivateNeedsAKnownAllocator) {
     ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
     EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(0).i64(20).send());
     EXPECT_TRUE(mLog.contains("Failed to get power value", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE).i32(0).i64(30).str("b").send());
+    EXPECT_EQ(-1, deactivate(kSole, 0, 30, "b"));
     EXPECT_TRUE(mLog.contains("Failed to remove element", ANDROID_LOG_ERROR));
     EXPECT_TRUE(listener->mReplies.empty());
 }
@@ -95,7 +91,7 @@ TEST_F(DataAccounterTest, DeactivateAllContinuesPastAFailure) {
     auto listener = listenTo(kSole);
     // Key 0 exists but is idle (its removal fails); keys 1 and 2 are active.
     for (int32_t key = 0; key < 3; ++key) {
-        ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(key).i64(0).i32(1000).send());
+        ASSERT_EQ(0, setPower(kSole, key, 0, 1000));
     }
     ASSERT_EQ(0, activate(kSole, 1, 0, "one"));
     ASSERT_EQ(0, activate(kSole, 2, 0, "two"));
@@ -111,19 +107,18 @@ TEST_F(DataAccounterTest, DeactivateAllContinuesPastAFailure) {
 
 TEST_F(DataAccounterTest, AKeyWithoutAllocatorStandsInNobodysWay) {
     auto listener = listenTo(kSole);
-    ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(1).i64(0).i32(1000).send());
+    ASSERT_EQ(0, setPower(kSole, 1, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 1, 0, "a"));
     EXPECT_EQ(-1, activate(kSole, kKeyWithoutAllocator, 0, "b"));
     EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(kKeyWithoutAllocator).i64(0).i32(5).send());
     EXPECT_EQ(2u, mLog.count("Invalid allocator", ANDROID_LOG_ERROR));
     // Not stored: the key is unknown afterwards.
-    EXPECT_EQ(-1,
-              Action(kSole, ACTION_DEACTIVATE).i32(kKeyWithoutAllocator).i64(0).str("b").send());
+    EXPECT_EQ(-1, deactivate(kSole, kKeyWithoutAllocator, 0, "b"));
     EXPECT_TRUE(mLog.contains("Failed to find allocator: 99", ANDROID_LOG_ERROR));
 
     // State changes and balances go on for the others.
     EXPECT_EQ(0, Action(kSole, ACTION_SCREEN_STATE).i64(60).flag(false).send());
-    EXPECT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(100).send());
+    EXPECT_EQ(0, balanceAt(kSole, 100));
     ASSERT_EQ(1u, listener->mReplies.size());
     EXPECT_EQ(elementReply(1, 0, 100, "a",
                            Buckets()
@@ -136,11 +131,11 @@ TEST_F(DataAccounterTest, AKeyWithoutAllocatorStandsInNobodysWay) {
 TEST_F(DataAccounterTest, ARefusedRecordDoesNotStopTheBalance) {
     auto listener = listenTo(kSole);
     for (int32_t key = 1; key <= 3; ++key) {
-        ASSERT_EQ(0, Action(kSole, ACTION_SET_VALUE).i32(key).i64(0).i32(1000).send());
+        ASSERT_EQ(0, setPower(kSole, key, 0, 1000));
         ASSERT_EQ(0, activate(kSole, key, 0, "app"));
     }
     listener->refuse(2);
-    EXPECT_EQ(-1, Action(kSole, ACTION_BALANCE).i32(BALANCE_AT).i64(70).send());
+    EXPECT_EQ(-1, balanceAt(kSole, 70));
     EXPECT_EQ(1u, mLog.count("Failed to balance accounting data", ANDROID_LOG_ERROR));
     ASSERT_EQ(3u, listener->mReplies.size());
     for (int32_t key = 1; key <= 3; ++key) {
@@ -148,21 +143,21 @@ TEST_F(DataAccounterTest, ARefusedRecordDoesNotStopTheBalance) {
                   listener->mReplies[key - 1].bytes);
     }
     // Every allocator was cut at 70, the refused one too.
-    EXPECT_EQ(0, Action(kSole, ACTION_DEACTIVATE).i32(3).i64(100).str("app").send());
+    EXPECT_EQ(0, deactivate(kSole, 3, 100, "app"));
     EXPECT_EQ(elementReply(3, 70, 100, "app", screenOnBackground(30, 30)),
               listener->mReplies[3].bytes);
 }
 
 TEST_F(DataAccounterTest, RecordsWithoutListenerAreDropped) {
-    ASSERT_EQ(0, Action(kShared, ACTION_SET_VALUE).i32(0).i64(0).i32(1000).send());
+    ASSERT_EQ(0, setPower(kShared, 0, 0, 1000));
     ASSERT_EQ(0, activate(kShared, 0, 0, "a"));
-    EXPECT_EQ(-1, Action(kShared, ACTION_BALANCE).i32(BALANCE_AT).i64(10).send());
-    EXPECT_EQ(-1, Action(kShared, ACTION_DEACTIVATE).i32(0).i64(20).str("a").send());
+    EXPECT_EQ(-1, balanceAt(kShared, 10));
+    EXPECT_EQ(-1, deactivate(kShared, 0, 20, "a"));
     // The element and component record of the balance, then of the removal.
     EXPECT_EQ(4u, mLog.count("Invalid listener", ANDROID_LOG_ERROR));
     // The element is gone all the same.
     auto listener = listenTo(kShared);
-    EXPECT_EQ(0, Action(kShared, ACTION_BALANCE).i32(BALANCE_AT).i64(30).send());
+    EXPECT_EQ(0, balanceAt(kShared, 30));
     EXPECT_TRUE(listener->mReplies.empty());
 }
 

@@ -24,22 +24,6 @@ protected:
     LibraryFixture mLibrary;
 };
 
-int32_t setPower(int32_t type, int32_t key, int64_t time, int32_t power) {
-    return Action(type, ACTION_SET_VALUE).i32(key).i64(time).i32(power).send();
-}
-
-int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
-    return Action(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
-}
-
-int32_t deactivate(int32_t type, int32_t key, int64_t time, const char* name) {
-    return Action(type, ACTION_DEACTIVATE).i32(key).i64(time).str(name).send();
-}
-
-int32_t balanceAt(int32_t type, int64_t time) {
-    return Action(type, ACTION_BALANCE).i32(BALANCE_AT).i64(time).send();
-}
-
 TEST_F(AllocatorTest, SoleChargesTheWholeIntervalIn64Bits) {
     auto listener = listenTo(kSole);
     ASSERT_EQ(0, setPower(kSole, 0, 0, 600));
@@ -57,9 +41,9 @@ TEST_F(AllocatorTest, SoleChargesTheWholeIntervalIn64Bits) {
     ASSERT_EQ(0, setPower(kSole, 1, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 1, 0, "com.nav"));
     ASSERT_EQ(0, deactivate(kSole, 1, 3000000000LL, "com.nav"));
-    EXPECT_EQ(elementReply(1, 0, 3000000000LL, "com.nav",
-                           screenOnBackground(2147483647, 2147483647)),
-              listener->mReplies[1].bytes);
+    EXPECT_EQ(
+            elementReply(1, 0, 3000000000LL, "com.nav", screenOnBackground(2147483647, 2147483647)),
+            listener->mReplies[1].bytes);
 
     // A time before the last accounted one adds nothing.
     ASSERT_EQ(0, activate(kSole, 1, 5000, "com.nav"));
@@ -161,10 +145,8 @@ TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
     ASSERT_EQ(0, Action(kShared, ACTION_DEACTIVATE_ALL).i64(20).send());
     ASSERT_EQ(8u, listener->mReplies.size());
     EXPECT_EQ(elementReply(3, 10, 16, "b", screenOnBackground(6, 2)), listener->mReplies[4].bytes);
-    EXPECT_EQ(elementReply(3, 10, 20, "a", screenOnBackground(10, 4)),
-              listener->mReplies[5].bytes);
-    EXPECT_EQ(elementReply(3, 10, 20, "c", screenOnBackground(10, 4)),
-              listener->mReplies[6].bytes);
+    EXPECT_EQ(elementReply(3, 10, 20, "a", screenOnBackground(10, 4)), listener->mReplies[5].bytes);
+    EXPECT_EQ(elementReply(3, 10, 20, "c", screenOnBackground(10, 4)), listener->mReplies[6].bytes);
     EXPECT_EQ(componentReply(3, 10, 20, screenOnBackground(10, 10)), listener->mReplies[7].bytes);
 
     // No element: a balance reports nothing, not even the component.
@@ -200,8 +182,7 @@ TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
     ASSERT_EQ(0, Action(kShared, ACTION_CHARGER_ONLINE).i64(101).flag(true).send());
     ASSERT_EQ(0, balanceAt(kShared, 202));
     ASSERT_EQ(10u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 101, 202, "com.fg",
-                           Buckets().set(BUCKET_CHARGE_FOREGROUND, 101, 25)),
+    EXPECT_EQ(elementReply(0, 101, 202, "com.fg", Buckets().set(BUCKET_CHARGE_FOREGROUND, 101, 25)),
               listener->mReplies[5].bytes);
     EXPECT_EQ(elementReply(0, 101, 202, "com.y", Buckets().set(BUCKET_CHARGE_BACKGROUND, 101, 25)),
               listener->mReplies[8].bytes);
@@ -249,8 +230,7 @@ TEST_F(AllocatorTest, EnergiesKeepTheirSignAndSensorsTheirScale) {
     }
     ASSERT_EQ(0, balanceAt(kShared, 10));
     ASSERT_EQ(4u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 10, "a", screenOnBackground(10, -3)),
-              listener->mReplies[0].bytes);
+    EXPECT_EQ(elementReply(0, 0, 10, "a", screenOnBackground(10, -3)), listener->mReplies[0].bytes);
     EXPECT_EQ(componentReply(0, 0, 10, screenOnBackground(10, -10)), listener->mReplies[3].bytes);
 
     // A sensor at power 50 for an hour: 3600000 * 50 / 10000 = 18000.
@@ -267,8 +247,7 @@ TEST_F(AllocatorTest, EnergiesKeepTheirSignAndSensorsTheirScale) {
 }
 
 // A traffic record in a balance reply: int64 bytes per bucket.
-void writeTrafficRecord(Parcel& p, int64_t start, int64_t end, const char* name,
-                        const Buckets& b) {
+void writeTrafficRecord(Parcel& p, int64_t start, int64_t end, const char* name, const Buckets& b) {
     p.writeInt64(start);
     p.writeInt64(end);
     p.writeString8(String8(name));
@@ -296,8 +275,8 @@ Action trafficBatch(int32_t count, std::initializer_list<TrafficEntry> entries) 
 TEST_F(AllocatorTest, TrafficBatchesAreBoundedByCountAndData) {
     auto listener = listenTo(kTraffic);
     // Power 500: energy = bytes / 2.
-    ASSERT_EQ(0, trafficBatch(3, {{"com.a", 1, 2000}, {"com.b", 0, 4000}, {"com.a", 0, 1000}})
-                         .send());
+    ASSERT_EQ(0,
+              trafficBatch(3, {{"com.a", 1, 2000}, {"com.b", 0, 4000}, {"com.a", 0, 1000}}).send());
     LogCapture log;
     EXPECT_EQ(-1, trafficBatch(5001, {{"com.a", 1, 2000}}).send());
     EXPECT_TRUE(log.contains("Invalid traffic data count(5001)", ANDROID_LOG_ERROR));
