@@ -44,8 +44,13 @@ int32_t DataAccounter::sendReply(int32_t event, const Parcel& reply) {
 }
 
 void DataAccounter::registerListener(const android::sp<LibraryListener>& listener) {
-    std::lock_guard<std::mutex> guard(mListenerLock);
-    mListener = listener;
+    android::sp<LibraryListener> old;
+    {
+        std::lock_guard<std::mutex> guard(mListenerLock);
+        old = mListener;
+        mListener = listener;
+    }
+    // The replaced listener is released here, outside the lock.
 }
 
 void DataAccounter::unregisterListener() {
@@ -55,13 +60,17 @@ void DataAccounter::unregisterListener() {
         old = mListener;
         mListener.clear();
     }
-    // The last reference, if it is ours, goes here, outside the lock.
+    // The listener is released here, outside the lock.
 }
 
 int32_t DataAccounter::handleAction(const Parcel& action) {
     int32_t code = 0;
     if (action.readInt32(&code) != NO_ERROR) {
         LLOGE("Missing action");
+        return -1;
+    }
+    if (code < ACTION_FOREGROUND || code > ACTION_SET_VALUE) {
+        LLOGE("Unknown action: %d", code);
         return -1;
     }
     // An action from inside a listener would change the records an allocator
@@ -94,7 +103,6 @@ int32_t DataAccounter::dispatchAction(int32_t code, const Parcel& action) {
         case ACTION_SET_VALUE:
             return onActionSetValue(action);
         default:
-            LLOGE("Unknown action: %d", code);
             return -1;
     }
 }

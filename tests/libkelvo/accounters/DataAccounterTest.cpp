@@ -22,7 +22,7 @@ protected:
 TEST_F(DataAccounterTest, ActionCodesOutsideTheTableAreRefused) {
     auto listener = listenTo(kSole);
     EXPECT_EQ(-1, Action(kSole, 8).i64(0).send());
-    EXPECT_TRUE(mLog.contains("[DataAccounter.cpp] dispatchAction# Unknown action: 8",
+    EXPECT_TRUE(mLog.contains("[DataAccounter.cpp] handleAction# Unknown action: 8",
                               ANDROID_LOG_ERROR));
     EXPECT_EQ(-1, Action(kSole, -1).send());
     EXPECT_TRUE(mLog.contains("Unknown action: -1", ANDROID_LOG_ERROR));
