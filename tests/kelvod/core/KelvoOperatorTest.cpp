@@ -251,6 +251,7 @@ TEST_F(KelvoOperatorTest, StateChangesFeedTheOperatorsAccounter) {
     none->initialize();
     none->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 0, fg));
     EXPECT_EQ(8u, calls().size());
+    none->release();
     none->requestThreadExit();
 }
 
