@@ -3,7 +3,6 @@
 // handleLogger takes two values out of each text with parseMessage.
 
 #include <benchmark/benchmark.h>
-
 #include <stdlib.h>
 #include <unistd.h>
 
@@ -95,6 +94,7 @@ void BM_IngestRecords(benchmark::State& state) {
             Clock::time_point start = Clock::now();
             std::thread writer([&] {
                 kelvo::LogWriter log(path);
+                log.setTimeout(20000);
                 for (uint64_t i = 0; i < kRecords; ++i) {
                     if (log.write(kelvo::LogWriter::PRIORITY_INFO, kTag,
                                   texts[i % texts.size()].c_str(), 1700000000000LL) != 0) {

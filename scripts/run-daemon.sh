@@ -12,6 +12,9 @@ if [ -z "$ROOT" ]; then
 fi
 mkdir -p "$ROOT/system" "$ROOT/vendor" "$ROOT/data/log/kelvo" "$ROOT/data/property" "$ROOT/dev"
 [ -f "$ROOT/system/build.prop" ] || cp config/build.prop "$ROOT/system/build.prop"
+mkdir -p "$ROOT/vendor/etc/xml"
+[ -f "$ROOT/vendor/etc/xml/tv_kelvo_config.xml" ] ||
+    cp config/tv_kelvo_config.xml "$ROOT/vendor/etc/xml/tv_kelvo_config.xml"
 
 echo "kelvod: root $ROOT (Ctrl-C stops it)"
 export KELVO_ROOT=$ROOT

@@ -1,5 +1,6 @@
 #include "core/Dispatcher.h"
 
+#include <binder/Parcel.h>
 #include <errno.h>
 #include <sys/socket.h>
 #include <sys/stat.h>
@@ -7,8 +8,6 @@
 
 #include <cstring>
 #include <string_view>
-
-#include <binder/Parcel.h>
 
 #include "KelvoLog.h"
 #include "core/DispatcherThread.h"
@@ -69,6 +68,14 @@ Dispatcher::~Dispatcher() {
     }
 }
 
+void Dispatcher::closeDevice() {
+    std::lock_guard<std::mutex> guard(mLock);
+    if (mFd >= 0) {
+        close(mFd);
+        mFd = -1;
+    }
+}
+
 void Dispatcher::stop() {
     android::sp<DispatcherThread> thread;
     std::map<std::string, tag_handler, std::less<>> tags;
@@ -77,21 +84,20 @@ void Dispatcher::stop() {
         thread = mThread;
         mThread.clear();
         tags.swap(mTags);
-    }
-    mStopping.store(true);
-    if (thread != nullptr) {
-        thread->requestExit();
-        // Wakes a blocked read at once; a character device is left to its
-        // next record.
-        if (mDatagram) {
-            shutdown(mFd, SHUT_RDWR);
+        mStopping.store(true);
+        if (thread != nullptr) {
+            thread->requestExit();
+            // Wakes a blocked read at once; a character device is left to
+            // its next record.
+            if (mDatagram && mFd >= 0) {
+                shutdown(mFd, SHUT_RDWR);
+            }
         }
+    }
+    if (thread != nullptr) {
         thread->join();
     }
-    if (mFd >= 0) {
-        close(mFd);
-        mFd = -1;
-    }
+    closeDevice();
 }
 
 int32_t Dispatcher::registerTag(const dispatcher_tag& tag,
@@ -113,7 +119,8 @@ int32_t Dispatcher::registerTag(const dispatcher_tag& tag,
 
 int32_t Dispatcher::startDispatchMessage() {
     std::lock_guard<std::mutex> guard(mLock);
-    if (mThread == nullptr) {
+    // No device, or it was closed when the thread ended for good.
+    if (mThread == nullptr || mFd < 0) {
         return -2;
     }
     if (!mThread->isRunning() && mThread->run("Dispatcher", kThreadPriority) != android::OK) {

@@ -2,15 +2,14 @@
 
 #include <stddef.h>
 #include <stdint.h>
+#include <utils/RefBase.h>
+#include <utils/StrongPointer.h>
 
 #include <atomic>
 #include <functional>
 #include <map>
 #include <mutex>
 #include <string>
-
-#include <utils/RefBase.h>
-#include <utils/StrongPointer.h>
 
 namespace kelvo {
 
@@ -51,7 +50,8 @@ public:
     int32_t registerTag(const dispatcher_tag& tag, const android::sp<KelvoOperator>& target);
 
     // Starts the thread when the device is open and it does not run yet.
-    // 0 when it runs, -2 without a device, -1 when it could not start.
+    // 0 when it runs, -2 without a device (none, or closed after the thread
+    // ended for good), -1 when it could not start.
     int32_t startDispatchMessage();
 
     // Records forwarded since the last call.
@@ -80,15 +80,20 @@ private:
     // returns a negative code, which ends the thread. 1 once the thread is
     // asked to stop.
     int32_t readLoggerMessage();
+    // Closes the device once its thread has ended for good, so writers are
+    // refused instead of waiting for a reader that will not come back.
+    void closeDevice();
     void stop();
 
+    // Written under mLock once the thread has started; read without it only
+    // by the thread itself.
     int mFd;
     // A datagram socket stands in for the device on the host: an empty read
     // is then an empty record, not the end of the device.
     bool mDatagram;
     std::atomic<bool> mStopping;
     std::atomic<uint32_t> mLogCount;
-    std::mutex mLock; // guards the tag map
+    std::mutex mLock;  // guards the tag map, the thread and closing the device
     std::map<std::string, tag_handler, std::less<>> mTags;
     android::sp<DispatcherThread> mThread;
     // Only the dispatcher thread touches the read buffer; it keeps room for

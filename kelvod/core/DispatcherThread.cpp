@@ -16,6 +16,7 @@ bool DispatcherThread::threadLoop() {
     int32_t ret = mDispatcher->readLoggerMessage();
     if (ret < 0) {
         KLOGE("Failed to read logger message: %d", ret);
+        mDispatcher->closeDevice();
         return false;
     }
     return ret == 0;

@@ -3,6 +3,7 @@
 #include <stddef.h>
 
 #include <algorithm>
+#include <cstddef>
 #include <cstdio>
 #include <cstring>
 
@@ -18,8 +19,17 @@ constexpr size_t kMaxValueLength = 4095;
 // Widths above this are refused anyway (outSize is at most 4096).
 constexpr size_t kWidthCap = 1 << 20;
 
-enum LengthModifier { LENGTH_NONE, LENGTH_HH, LENGTH_H, LENGTH_L, LENGTH_LL, LENGTH_J,
-                      LENGTH_Z, LENGTH_T, LENGTH_LD };
+enum LengthModifier {
+    LENGTH_NONE,
+    LENGTH_HH,
+    LENGTH_H,
+    LENGTH_L,
+    LENGTH_LL,
+    LENGTH_J,
+    LENGTH_Z,
+    LENGTH_T,
+    LENGTH_LD
+};
 
 size_t integerSize(LengthModifier length) {
     switch (length) {
@@ -30,7 +40,7 @@ size_t integerSize(LengthModifier length) {
         case LENGTH_L:
             return sizeof(long);
         case LENGTH_LL:
-        case LENGTH_LD: // "%Lld" is read as long long
+        case LENGTH_LD:  // "%Lld" is read as long long
             return sizeof(long long);
         case LENGTH_J:
             return sizeof(intmax_t);
@@ -111,7 +121,6 @@ bool isBoundedFormat(const char* format, size_t outSize) {
             case 'u':
             case 'x':
             case 'X':
-            case 'n':
                 needed = integerSize(length);
                 break;
             case 'a':
@@ -176,7 +185,8 @@ bool isBoundedFormat(const char* format, size_t outSize) {
                 needed = width + 1;
                 break;
             default:
-                // Unknown, wide or allocating ('m') conversions, or the end.
+                // Unknown, wide or allocating ('m') conversions, the end, and
+                // "%n", which would write out even when the conversion fails.
                 return false;
         }
         if (!assigns) {
@@ -259,10 +269,15 @@ int32_t parseMessage(const char* text, const char* firstKey, const char* secondK
         buffer[length] = '\0';
         value = buffer;
     }
-    if (sscanf(value, format, out) == EOF) {
+    // Converted into a copy of out, which takes the result only on success:
+    // a failed conversion must not leave part of its output behind.
+    alignas(std::max_align_t) unsigned char result[kMaxOutSize];
+    memcpy(result, out, outSize);
+    if (sscanf(value, format, result) == EOF) {
         KLOGE("Failed to get result");
         return -2;
     }
+    memcpy(out, result, outSize);
     return 0;
 }
 

@@ -20,8 +20,9 @@ namespace kelvo {
 // rest of out with zeros. Any other format must write at most one output
 // that fits in outSize bytes: a number no wider than outSize, "%c" with a
 // width up to outSize, and text ("%s", "%[...]") only with a width below
-// outSize; others are refused. A value that does not match the format leaves
-// out unchanged and still succeeds, so callers initialise their outputs.
+// outSize; others ("%n" too) are refused. A value that does not match the
+// format leaves out unchanged and still succeeds, so callers initialise
+// their outputs. A failure never writes to out.
 //
 // Returns 0, or (each with an error line):
 //   -5   null text, format or out, outSize 0 or above 4096, or a format

@@ -5,6 +5,7 @@
 #include <sys/socket.h>
 #include <sys/stat.h>
 #include <sys/syscall.h>
+#include <sys/time.h>
 #include <sys/uio.h>
 #include <sys/un.h>
 #include <time.h>
@@ -32,7 +33,14 @@ int64_t nowMs() {
 
 } // namespace
 
-LogWriter::LogWriter(const std::string& path) : mPath(path), mFd(-1), mSocket(false) {}
+LogWriter::LogWriter(const std::string& path)
+    : mPath(path), mFd(-1), mSocket(false), mTimeoutMs(0) {}
+
+void LogWriter::setTimeout(int64_t ms) {
+    mTimeoutMs = ms > 0 ? ms : 0;
+    // Applied when the device is opened next.
+    closeDevice();
+}
 
 LogWriter::~LogWriter() {
     closeDevice();
@@ -73,6 +81,12 @@ int LogWriter::openDevice() {
     }
     int size = kSendBufferBytes;
     setsockopt(fd, SOL_SOCKET, SO_SNDBUF, &size, sizeof(size));
+    if (mTimeoutMs > 0) {
+        struct timeval timeout;
+        timeout.tv_sec = static_cast<time_t>(mTimeoutMs / 1000);
+        timeout.tv_usec = static_cast<suseconds_t>((mTimeoutMs % 1000) * 1000);
+        setsockopt(fd, SOL_SOCKET, SO_SNDTIMEO, &timeout, sizeof(timeout));
+    }
     // Connected once, so each record costs no path lookup.
     if (connect(fd, reinterpret_cast<const struct sockaddr*>(&addr), sizeof(addr)) != 0) {
         int err = errno;
@@ -137,10 +151,10 @@ int LogWriter::write(int priority, const char* tag, const char* text, int64_t ti
     }
     uint8_t prio = static_cast<uint8_t>(priority);
     struct iovec parts[4] = {
-            {header, sizeof(header)},
-            {&prio, 1},
-            {const_cast<char*>(tag), tagSize},
-            {const_cast<char*>(text), textSize},
+        {header, sizeof(header)},
+        {&prio, 1},
+        {const_cast<char*>(tag), tagSize},
+        {const_cast<char*>(text), textSize},
     };
     return send(parts, 4, sizeof(header) + payload);
 }

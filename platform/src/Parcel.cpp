@@ -1,5 +1,10 @@
+#include <binder/IBinder.h>
 #include <binder/Parcel.h>
+#include <binder/Status.h>
+#include <fcntl.h>
+#include <unistd.h>
 
+#include <algorithm>
 #include <cstdint>
 #include <cstdlib>
 #include <cstring>
@@ -35,6 +40,7 @@ size_t Parcel::dataAvail() const {
 }
 
 void Parcel::freeData() {
+    releaseObjects();
     free(mData);
     mData = nullptr;
     mDataSize = 0;
@@ -87,6 +93,10 @@ status_t Parcel::growData(size_t len) {
 }
 
 status_t Parcel::finishWrite(size_t len) {
+    if (!mObjects.empty()) {
+        // Plain bytes written over a slot take its object away.
+        dropObjects(mDataPos, mDataPos + len);
+    }
     mDataPos += len;
     if (mDataPos > mDataSize) {
         mDataSize = mDataPos;
@@ -107,6 +117,7 @@ status_t Parcel::setDataSize(size_t size) {
         memset(mData + mDataSize, 0, size - mDataSize);
     }
     if (size < mDataSize) {
+        dropObjects(size, SIZE_MAX);
         // Bytes past the end are kept zero, so that growing the parcel again
         // or writing beyond its end never brings dropped data back.
         memset(mData + size, 0, mDataSize - size);
@@ -160,13 +171,47 @@ status_t Parcel::appendFrom(const Parcel* parcel, size_t start, size_t len) {
     if (start > parcel->mDataSize || len > parcel->mDataSize - start) {
         return BAD_VALUE;
     }
+    // Copy the objects first (the source may be this very parcel, and the
+    // copy below may write over their slots).
+    std::vector<Object> copied;
+    for (const Object& obj : parcel->mObjects) {
+        if (obj.offset < start || obj.offset - start > len ||
+            len - (obj.offset - start) < kSlotSize) {
+            continue;
+        }
+        Object copy{obj.offset - start, obj.binder, -1};
+        if (obj.fd >= 0) {
+            copy.fd = fcntl(obj.fd, F_DUPFD_CLOEXEC, 0);
+            if (copy.fd < 0) {
+                for (Object& o : copied) {
+                    if (o.fd >= 0) {
+                        close(o.fd);
+                    }
+                }
+                return FAILED_TRANSACTION;
+            }
+        }
+        copied.push_back(std::move(copy));
+    }
     status_t err = growData(len);
     if (err != NO_ERROR) {
+        for (Object& o : copied) {
+            if (o.fd >= 0) {
+                close(o.fd);
+            }
+        }
         return err;
     }
+    size_t at = mDataPos;
     // Read the source only after growing: it may be this very parcel.
     memmove(mData + mDataPos, parcel->mData + start, len);
-    return finishWrite(len);
+    finishWrite(len);
+    for (Object& o : copied) {
+        uint32_t kind = o.fd >= 0 ? kSlotFd : kSlotBinder;
+        o.offset += at;
+        insertObject(std::move(o), kind);
+    }
+    return NO_ERROR;
 }
 
 void* Parcel::writeInplace(size_t len) {
@@ -472,6 +517,237 @@ String16 Parcel::readString16() const {
     String16 out;
     readString16(&out);
     return out;
+}
+
+// ---------------------------------------------------------------------------
+// The object table.
+
+void Parcel::releaseObjects() {
+    // Move the table out first: closing may run destructors that touch
+    // other parcels, never this one.
+    std::vector<Object> objects;
+    objects.swap(mObjects);
+    for (Object& obj : objects) {
+        if (obj.fd >= 0) {
+            close(obj.fd);
+        }
+    }
+}
+
+void Parcel::dropObjects(size_t start, size_t end) {
+    auto first = std::find_if(mObjects.begin(), mObjects.end(),
+                              [start](const Object& o) { return o.offset + kSlotSize > start; });
+    auto last = first;
+    while (last != mObjects.end() && last->offset < end) {
+        if (last->fd >= 0) {
+            close(last->fd);
+            last->fd = -1;
+        }
+        ++last;
+    }
+    mObjects.erase(first, last);
+}
+
+status_t Parcel::insertObject(Object&& object, uint32_t kind) {
+    auto fail = [&object]() {
+        if (object.fd >= 0) {
+            close(object.fd);
+            object.fd = -1;
+        }
+        return BAD_VALUE;
+    };
+    if (object.offset > mDataSize || mDataSize - object.offset < kSlotSize) {
+        return fail();
+    }
+    uint32_t word = 0;
+    memcpy(&word, mData + object.offset, sizeof(word));
+    if (word != kind || (kind == kSlotFd) != (object.fd >= 0) ||
+        (kind == kSlotBinder && object.binder == nullptr)) {
+        return fail();
+    }
+    auto pos = std::lower_bound(mObjects.begin(), mObjects.end(), object.offset,
+                                [](const Object& o, size_t offset) { return o.offset < offset; });
+    if ((pos != mObjects.end() && pos->offset < object.offset + kSlotSize) ||
+        (pos != mObjects.begin() && std::prev(pos)->offset + kSlotSize > object.offset)) {
+        return fail();
+    }
+    mObjects.insert(pos, std::move(object));
+    return NO_ERROR;
+}
+
+status_t Parcel::writeSlot(uint32_t kind, Object* object) {
+    uint8_t* slot = static_cast<uint8_t*>(writeInplace(kSlotSize));
+    if (slot == nullptr) {
+        if (object != nullptr && object->fd >= 0) {
+            close(object->fd);
+        }
+        return NO_MEMORY;
+    }
+    memset(slot, 0, kSlotSize);
+    memcpy(slot, &kind, sizeof(kind));
+    if (object == nullptr) {
+        return NO_ERROR;
+    }
+    object->offset = static_cast<size_t>(slot - mData);
+    return insertObject(std::move(*object), kind);
+}
+
+const Parcel::Object* Parcel::objectAtCursor(uint32_t* kind) const {
+    *kind = 0;
+    if (mDataPos > mDataSize || mDataSize - mDataPos < kSlotSize) {
+        return nullptr;
+    }
+    memcpy(kind, mData + mDataPos, sizeof(*kind));
+    auto pos = std::lower_bound(mObjects.begin(), mObjects.end(), mDataPos,
+                                [](const Object& o, size_t offset) { return o.offset < offset; });
+    if (pos == mObjects.end() || pos->offset != mDataPos) {
+        return nullptr;
+    }
+    return &*pos;
+}
+
+status_t Parcel::writeStrongBinder(const sp<IBinder>& val) {
+    if (val == nullptr) {
+        return writeSlot(kSlotNull, nullptr);
+    }
+    Object obj{0, val, -1};
+    return writeSlot(kSlotBinder, &obj);
+}
+
+status_t Parcel::readNullableStrongBinder(sp<IBinder>* val) const {
+    uint32_t kind = 0;
+    const Object* obj = objectAtCursor(&kind);
+    if (kind == kSlotNull && obj == nullptr) {
+        mDataPos += kSlotSize;
+        if (val != nullptr) {
+            val->clear();
+        }
+        return NO_ERROR;
+    }
+    if (obj == nullptr || kind != kSlotBinder || obj->binder == nullptr) {
+        return mDataPos <= mDataSize && mDataSize - mDataPos >= kSlotSize ? BAD_TYPE
+                                                                          : NOT_ENOUGH_DATA;
+    }
+    mDataPos += kSlotSize;
+    if (val != nullptr) {
+        *val = obj->binder;
+    }
+    return NO_ERROR;
+}
+
+status_t Parcel::readStrongBinder(sp<IBinder>* val) const {
+    status_t err = readNullableStrongBinder(val);
+    if (err == NO_ERROR && val != nullptr && *val == nullptr) {
+        return UNEXPECTED_NULL;
+    }
+    return err;
+}
+
+sp<IBinder> Parcel::readStrongBinder() const {
+    sp<IBinder> val;
+    readNullableStrongBinder(&val);
+    return val;
+}
+
+status_t Parcel::writeFileDescriptor(int fd, bool takeOwnership) {
+    if (fd < 0) {
+        return BAD_VALUE;
+    }
+    Object obj{0, nullptr, fd};
+    if (!takeOwnership) {
+        obj.fd = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+        if (obj.fd < 0) {
+            return BAD_VALUE;
+        }
+    }
+    return writeSlot(kSlotFd, &obj);
+}
+
+status_t Parcel::writeDupFileDescriptor(int fd) {
+    return writeFileDescriptor(fd, false);
+}
+
+status_t Parcel::writeUniqueFileDescriptor(const base::unique_fd& fd) {
+    return writeFileDescriptor(fd.get(), false);
+}
+
+int Parcel::readFileDescriptor() const {
+    uint32_t kind = 0;
+    const Object* obj = objectAtCursor(&kind);
+    if (obj == nullptr || kind != kSlotFd || obj->fd < 0) {
+        return BAD_TYPE;
+    }
+    mDataPos += kSlotSize;
+    return obj->fd;
+}
+
+status_t Parcel::readUniqueFileDescriptor(base::unique_fd* val) const {
+    int fd = readFileDescriptor();
+    if (fd < 0) {
+        return BAD_TYPE;
+    }
+    int copy = fcntl(fd, F_DUPFD_CLOEXEC, 0);
+    if (copy < 0) {
+        return BAD_VALUE;
+    }
+    if (val != nullptr) {
+        val->reset(copy);
+    } else {
+        close(copy);
+    }
+    return NO_ERROR;
+}
+
+bool Parcel::hasFileDescriptors() const {
+    return std::any_of(mObjects.begin(), mObjects.end(), [](const Object& o) { return o.fd >= 0; });
+}
+
+status_t Parcel::writeInterfaceToken(const String16& interface) {
+    return writeInterfaceToken(interface.string(), interface.size());
+}
+
+status_t Parcel::writeInterfaceToken(const char16_t* str, size_t len) {
+    size_t start = mDataPos;
+    status_t err = writeInt32(kInterfaceTokenHeader);
+    if (err == NO_ERROR) {
+        err = writeString16(str, len);
+    }
+    if (err != NO_ERROR) {
+        mDataPos = start;
+    }
+    return err;
+}
+
+bool Parcel::enforceInterface(const String16& interface, IPCThreadState* threadState) const {
+    return enforceInterface(interface.string(), interface.size(), threadState);
+}
+
+bool Parcel::enforceInterface(const char16_t* interface, size_t len,
+                              IPCThreadState* threadState) const {
+    int32_t header = 0;
+    if (readInt32(&header) != NO_ERROR || header != kInterfaceTokenHeader) {
+        return false;
+    }
+    size_t got = 0;
+    const char16_t* str = readString16Inplace(&got);
+    if (str == nullptr || got != len) {
+        return false;
+    }
+    return len == 0 || memcmp(str, interface, len * sizeof(char16_t)) == 0;
+}
+
+bool Parcel::checkInterface(IBinder* binder) const {
+    return binder != nullptr && enforceInterface(binder->getInterfaceDescriptor());
+}
+
+status_t Parcel::writeNoException() {
+    return binder::Status::ok().writeToParcel(this);
+}
+
+int32_t Parcel::readExceptionCode() const {
+    binder::Status status;
+    status.readFromParcel(*this);
+    return status.exceptionCode();
 }
 
 } // namespace android

@@ -2,6 +2,7 @@
 
 #include <mutex>
 
+#include "BinderHost.h"
 #include "kelvo/StopSignal.h"
 
 namespace android {
@@ -26,10 +27,15 @@ sp<ProcessState> ProcessState::self() {
     return *instance;
 }
 
-ProcessState::ProcessState() : mThreadPoolStarted(false) {}
+ProcessState::ProcessState() {}
 
 void ProcessState::startThreadPool() {
-    mThreadPoolStarted = true;
+    kelvo::BinderHost::self().startPool();
+}
+
+status_t ProcessState::setThreadPoolMaxThreadCount(size_t maxThreads) {
+    kelvo::BinderHost::self().setMaxThreads(maxThreads);
+    return NO_ERROR;
 }
 
 } // namespace android

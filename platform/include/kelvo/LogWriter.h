@@ -43,6 +43,11 @@ public:
     // tests). Returns 0 or a negative errno value.
     int writeRaw(const void* data, size_t size);
 
+    // Bounds how long a write waits for room in the reader's queue (0, the
+    // default: for ever). A write that runs out of time fails with -EAGAIN
+    // and leaves nothing behind.
+    void setTimeout(int64_t ms);
+
     const std::string& getPath() const { return mPath; }
 
 private:
@@ -53,6 +58,7 @@ private:
     std::string mPath;
     int mFd;
     bool mSocket;
+    int64_t mTimeoutMs;
 };
 
 } // namespace kelvo

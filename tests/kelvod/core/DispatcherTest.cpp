@@ -1,6 +1,5 @@
-#include <gtest/gtest.h>
-
 #include <errno.h>
+#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/sysmacros.h>
 #include <unistd.h>
@@ -9,6 +8,7 @@
 #include <cstring>
 #include <memory>
 #include <mutex>
+#include <sstream>
 #include <string>
 #include <thread>
 #include <utility>
@@ -25,7 +25,6 @@
 
 using android::sp;
 using kelvo::Dispatcher;
-using kelvo::dispatcher_tag;
 using kelvo::KelvoOperator;
 using kelvo::LogDevice;
 using kelvo::LogWriter;
@@ -52,7 +51,7 @@ public:
     void registerDispatcherTag() override {
         for (const auto& tag : mTags) {
             mResults.push_back(
-                    Dispatcher::getInstance()->registerTag({tag.first.c_str(), tag.second}, this));
+                Dispatcher::getInstance()->registerTag({tag.first.c_str(), tag.second}, this));
         }
     }
 
@@ -105,6 +104,25 @@ std::string payload(const std::string& tag, const std::string& text) {
     return std::string("\x04", 1) + tag + std::string(1, '\0') + text + std::string(1, '\0');
 }
 
+// The nice values of this process's threads with the given name.
+std::vector<int> threadNiceValues(const std::string& name) {
+    std::vector<int> nices;
+    for (const std::string& tid : kelvo::test::listDir("/proc/self/task", "[0-9]+")) {
+        std::string dir = "/proc/self/task/" + tid;
+        if (kelvo::test::readHostFile(dir + "/comm") != name + "\n") {
+            continue;
+        }
+        // Field 19 of stat; the fields after the name's ')' start at 3.
+        std::string stat = kelvo::test::readHostFile(dir + "/stat");
+        std::istringstream fields(stat.substr(stat.rfind(')') + 2));
+        std::string field;
+        for (int i = 3; i <= 19 && fields >> field; ++i) {
+        }
+        nices.push_back(atoi(field.c_str()));
+    }
+    return nices;
+}
+
 class DispatcherTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -115,6 +133,8 @@ protected:
         kelvo::gLogInfoEnable.store(1);
         kelvo::gLogModuleMask.store(0);
         mWriter.reset(new LogWriter(kelvo::RootPath::resolve(KELVO_LOG_DEVICE)));
+        // A reader that stopped reading fails the test instead of hanging it.
+        mWriter->setTimeout(kLongWait.count());
     }
     void TearDown() override {
         Dispatcher::resetForTest();
@@ -154,17 +174,18 @@ protected:
 } // namespace
 
 TEST_F(DispatcherTest, RecordsReachTheOperatorThatRegisteredTheirTag) {
-    sp<RecordingOperator> display =
-            makeOperator("DisplayOp", {{"KELVO_TAG_FOREGROUND_CHANGED", 0},
-                                       {"KELVO_TAG_BRIGHTNESS", 1}});
+    sp<RecordingOperator> display = makeOperator(
+        "DisplayOp", {{"KELVO_TAG_FOREGROUND_CHANGED", 0}, {"KELVO_TAG_BRIGHTNESS", 1}});
     sp<RecordingOperator> gnss =
-            makeOperator("GnssOp", {{"KELVO_TAG_GNSS_START", 0}, {"KELVO_TAG_GNSS_STOP", 1}});
+        makeOperator("GnssOp", {{"KELVO_TAG_GNSS_START", 0}, {"KELVO_TAG_GNSS_STOP", 1}});
     EXPECT_EQ((std::vector<int32_t>{0, 0}), display->results());
     LogCapture log;
     sp<Dispatcher> dispatcher = Dispatcher::getInstance();
     ASSERT_EQ(0, dispatcher->startDispatchMessage());
-    // Starting twice changes nothing.
+    // Starting twice changes nothing: one thread, named and niced.
     EXPECT_EQ(0, dispatcher->startDispatchMessage());
+    EXPECT_TRUE(waitFor([] { return threadNiceValues("Dispatcher") == std::vector<int>{11}; },
+                        kLongWait));
 
     write("KELVO_TAG_BRIGHTNESS", "brightness=120", 1700000000123LL);
     write("KELVO_TAG_GNSS_START", "name=com.example.maps", 1700000000200LL);
@@ -225,8 +246,8 @@ TEST_F(DispatcherTest, TextsOf4096CharactersOrMoreAreDropped) {
     EXPECT_EQ(4095u, logged[0].text.size());
     EXPECT_EQ(longest, logged[0].text);
     EXPECT_EQ("module=after", logged[1].text);
-    EXPECT_EQ(1u, log.count("Dispatcher.cpp] dispatchMessage# Ignored long message",
-                            ANDROID_LOG_INFO));
+    EXPECT_EQ(1u,
+              log.count("Dispatcher.cpp] dispatchMessage# Ignored long message", ANDROID_LOG_INFO));
     EXPECT_EQ(2u, Dispatcher::getInstance()->getLogCount());
 }
 
@@ -237,21 +258,21 @@ TEST_F(DispatcherTest, MalformedRecordsAreLoggedAndCostNothingElse) {
 
     const std::string good = payload("KELVO_TAG_APP_WAKEUP", "procname=a");
     const std::vector<std::string> bad = {
-            // Headers that do not fit what was read.
-            rawRecord(good, static_cast<long>(good.size()) + 1),
-            rawRecord(good, static_cast<long>(good.size()) - 1),
-            rawRecord(good).substr(0, 10),
-            std::string(),
-            rawRecord(good, -1, 5, 1000000000u),
-            // Longer than one read takes.
-            rawRecord(std::string(6000, 'x'), 6000),
-            // Payloads without a tag or without a text.
-            rawRecord(""),
-            rawRecord(std::string("\x04", 1)),
-            rawRecord(std::string("\x04\0procname=b\0", 13)),
-            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP", 21)),
-            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0", 22)),
-            rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0procname=c", 32)),
+        // Headers that do not fit what was read.
+        rawRecord(good, static_cast<long>(good.size()) + 1),
+        rawRecord(good, static_cast<long>(good.size()) - 1),
+        rawRecord(good).substr(0, 10),
+        std::string(),
+        rawRecord(good, -1, 5, 1000000000u),
+        // Longer than one read takes.
+        rawRecord(std::string(6000, 'x'), 6000),
+        // Payloads without a tag or without a text.
+        rawRecord(""),
+        rawRecord(std::string("\x04", 1)),
+        rawRecord(std::string("\x04\0procname=b\0", 13)),
+        rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP", 21)),
+        rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0", 22)),
+        rawRecord(std::string("\x04KELVO_TAG_APP_WAKEUP\0procname=c", 32)),
     };
     int sent = 0;
     for (const std::string& record : bad) {
@@ -269,8 +290,7 @@ TEST_F(DispatcherTest, MalformedRecordsAreLoggedAndCostNothingElse) {
     EXPECT_EQ(6u, log.count("Dropped malformed logger record", ANDROID_LOG_ERROR));
     EXPECT_EQ(6u, log.count("Dropped logger record without tag or text", ANDROID_LOG_ERROR));
     EXPECT_EQ(1u, log.count("Dropped malformed logger record: 6000 bytes", ANDROID_LOG_ERROR) +
-                          log.count("Dropped malformed logger record: 5120 bytes",
-                                    ANDROID_LOG_ERROR));
+                      log.count("Dropped malformed logger record: 5120 bytes", ANDROID_LOG_ERROR));
     EXPECT_EQ(0u, log.count("Failed to read"));
     write("KELVO_TAG_APP_WAKEUP", "still=reading");
     ASSERT_TRUE(waitFor([&] { return op->count() == static_cast<size_t>(sent) + 1; }, kLongWait));
@@ -280,7 +300,7 @@ TEST_F(DispatcherTest, RegistrationKeepsTheFirstOperatorAndRefusesBadTags) {
     sp<RecordingOperator> first = makeOperator("FirstOp", {{"KELVO_TAG_WIFI_ON", 0}});
     LogCapture log;
     sp<RecordingOperator> second =
-            makeOperator("SecondOp", {{"KELVO_TAG_WIFI_ON", 5}, {"KELVO_TAG_WIFI_OFF", 6}});
+        makeOperator("SecondOp", {{"KELVO_TAG_WIFI_ON", 5}, {"KELVO_TAG_WIFI_OFF", 6}});
     EXPECT_EQ((std::vector<int32_t>{0, 0}), second->results());
     EXPECT_EQ(1u, log.count("Dispatcher.cpp] registerTag# Event(KELVO_TAG_WIFI_ON) has been "
                             "registered",
@@ -317,6 +337,7 @@ TEST_F(DispatcherTest, ManyWritersAtOnceReachTheOperatorsInTheirOrder) {
     for (int w = 0; w < kWriters; ++w) {
         threads.emplace_back([w, &failures] {
             LogWriter writer(kelvo::RootPath::resolve(KELVO_LOG_DEVICE));
+            writer.setTimeout(kLongWait.count());
             std::string tag = "KELVO_TAG_W" + std::to_string(w);
             for (int i = 0; i < kRecords; ++i) {
                 std::string text = "seq=" + std::to_string(i);
@@ -331,13 +352,13 @@ TEST_F(DispatcherTest, ManyWritersAtOnceReachTheOperatorsInTheirOrder) {
     }
     EXPECT_EQ(0, failures.load());
     ASSERT_TRUE(waitFor(
-            [&] {
-                for (const sp<RecordingOperator>& op : ops) {
-                    if (op->count() != static_cast<size_t>(kRecords)) return false;
-                }
-                return true;
-            },
-            std::chrono::milliseconds(60000)));
+        [&] {
+            for (const sp<RecordingOperator>& op : ops) {
+                if (op->count() != static_cast<size_t>(kRecords)) return false;
+            }
+            return true;
+        },
+        std::chrono::milliseconds(60000)));
     for (int w = 0; w < kWriters; ++w) {
         std::vector<Logged> logged = ops[w]->logged();
         int misplaced = 0;
@@ -347,8 +368,7 @@ TEST_F(DispatcherTest, ManyWritersAtOnceReachTheOperatorsInTheirOrder) {
         }
         EXPECT_EQ(0, misplaced) << "writer " << w;
     }
-    EXPECT_EQ(static_cast<uint32_t>(kWriters * kRecords),
-              Dispatcher::getInstance()->getLogCount());
+    EXPECT_EQ(static_cast<uint32_t>(kWriters * kRecords), Dispatcher::getInstance()->getLogCount());
 }
 
 TEST_F(DispatcherTest, ModuleDebugLineShowsEachForwardedRecord) {
@@ -374,7 +394,7 @@ TEST_F(DispatcherTest, WithoutADeviceTheDaemonRunsWithoutItsEvents) {
     sp<RecordingOperator> op = makeOperator("NoDeviceOp", {{"KELVO_TAG_GNSS_START", 0}});
     EXPECT_EQ((std::vector<int32_t>{0}), op->results());
     EXPECT_EQ(1u, log.count("Dispatcher.cpp] Dispatcher# Failed to open " +
-                                    kelvo::RootPath::resolve(KELVO_LOG_DEVICE),
+                                kelvo::RootPath::resolve(KELVO_LOG_DEVICE),
                             ANDROID_LOG_ERROR));
     EXPECT_EQ(-2, Dispatcher::getInstance()->startDispatchMessage());
     EXPECT_EQ("plain file", mRoot->readFile(KELVO_LOG_DEVICE));
@@ -390,8 +410,8 @@ TEST_F(DispatcherTest, TheEndOfACharacterDeviceEndsTheThread) {
     LogCapture log;
     sp<RecordingOperator> op = makeOperator("EndOp", {{"KELVO_TAG_GNSS_START", 0}});
     ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
-    EXPECT_TRUE(waitFor([&] { return log.contains("Failed to read logger message: -14"); },
-                        kLongWait));
+    EXPECT_TRUE(
+        waitFor([&] { return log.contains("Failed to read logger message: -14"); }, kLongWait));
     EXPECT_EQ(1u, log.count("readLoggerMessage# Failed to read log device: ", ANDROID_LOG_ERROR));
 }
 

@@ -30,85 +30,83 @@ struct Case {
     // The error line's message, after "parseMessage# "; null: no error line.
     const char* error;
     Output output;
-    int64_t number;   // INT32 and INT64 outputs
-    const char* value; // TEXT outputs
+    int64_t number;     // INT32 and INT64 outputs
+    const char* value;  // TEXT outputs
 };
 
 const Case kCases[] = {
-        // Reading items of a text.
-        {"number between two keys", "uid=1000 name=com.example.app", "uid=", "name=", "%d", 4, 0,
-         nullptr, INT32, 1000, nullptr},
-        {"last text item", "uid=1000 name=com.example.app", "name=", nullptr, "%s", 64, 0, nullptr,
-         TEXT, 0, "com.example.app"},
-        {"text value holding spaces", "uid=1 name=My Music App type=3", "name=", "type=", "%s", 32,
-         0, nullptr, TEXT, 0, "My Music App"},
-        {"whole text without keys", "42", nullptr, nullptr, "%d", 4, 0, nullptr, INT32, 42,
-         nullptr},
-        {"64-bit value", "delta=-5000000000", "delta=", nullptr, "%lld", 8, 0, nullptr, INT64,
-         -5000000000LL, nullptr},
-        {"unsigned value", "stream=3 device=4294967295", "device=", nullptr, "%u", 4, 0, nullptr,
-         INT32, -1, nullptr},
-        {"first occurrence wins, inside a longer key too", "xuid=5 uid=7", "uid=", nullptr, "%d", 4,
-         0, nullptr, INT32, 5, nullptr},
-        {"text cut to the output", "name=abcdefgh", "name=", nullptr, "%s", 4, 0, nullptr, TEXT, 0,
-         "abc"},
-        {"alarm name keeps 63 bytes",
-         "uid=1 name=0123456789012345678901234567890123456789012345678901234567890123456789 type=0",
-         "name=", "type=", "%s", 64, 0, nullptr, TEXT, 0,
-         "012345678901234567890123456789012345678901234567890123456789012"},
-        {"letters for a number leave the output as it was", "level=abc", "level=", nullptr, "%d",
-         4, 0, nullptr, INT32, kUntouched32, nullptr},
-        {"bounded text conversion", "irq=gpio_keys gpio=3", "irq=", "gpio=", "%15s", 16, 0, nullptr,
-         TEXT, 0, "gpio_keys"},
-        {"skipped conversion then one output", "size=12 34", "size=", nullptr, "%*d %d", 4, 0,
-         nullptr, INT32, 34, nullptr},
+    // Reading items of a text.
+    {"number between two keys", "uid=1000 name=com.example.app", "uid=", "name=", "%d", 4, 0,
+     nullptr, INT32, 1000, nullptr},
+    {"last text item", "uid=1000 name=com.example.app", "name=", nullptr, "%s", 64, 0, nullptr,
+     TEXT, 0, "com.example.app"},
+    {"text value holding spaces", "uid=1 name=My Music App type=3", "name=", "type=", "%s", 32, 0,
+     nullptr, TEXT, 0, "My Music App"},
+    {"whole text without keys", "42", nullptr, nullptr, "%d", 4, 0, nullptr, INT32, 42, nullptr},
+    {"64-bit value", "delta=-5000000000", "delta=", nullptr, "%lld", 8, 0, nullptr, INT64,
+     -5000000000LL, nullptr},
+    {"unsigned value", "stream=3 device=4294967295", "device=", nullptr, "%u", 4, 0, nullptr, INT32,
+     -1, nullptr},
+    {"first occurrence wins, inside a longer key too", "xuid=5 uid=7", "uid=", nullptr, "%d", 4, 0,
+     nullptr, INT32, 5, nullptr},
+    {"text cut to the output", "name=abcdefgh", "name=", nullptr, "%s", 4, 0, nullptr, TEXT, 0,
+     "abc"},
+    {"alarm name keeps 63 bytes",
+     "uid=1 name=0123456789012345678901234567890123456789012345678901234567890123456789 type=0",
+     "name=", "type=", "%s", 64, 0, nullptr, TEXT, 0,
+     "012345678901234567890123456789012345678901234567890123456789012"},
+    {"letters for a number leave the output as it was", "level=abc", "level=", nullptr, "%d", 4, 0,
+     nullptr, INT32, kUntouched32, nullptr},
+    {"bounded text conversion", "irq=gpio_keys gpio=3", "irq=", "gpio=", "%15s", 16, 0, nullptr,
+     TEXT, 0, "gpio_keys"},
+    {"skipped conversion then one output", "size=12 34", "size=", nullptr, "%*d %d", 4, 0, nullptr,
+     INT32, 34, nullptr},
 
-        // Failures of the text.
-        {"no space between items", "uid=1000name=x", "uid=", "name=", "%d", 4, -2,
-         "Invalid logger message format. It must have a space between two items", INT32,
-         kUntouched32, nullptr},
-        {"blank value", "uid=", "uid=", nullptr, "%d", 4, -2, "Value of this tag(uid=) is blank",
-         INT32, kUntouched32, nullptr},
-        {"first key missing", "uid=1000", "pid=", nullptr, "%d", 4, -11,
-         "Failed to find first tag: pid=", INT32, kUntouched32, nullptr},
-        {"second key missing", "uid=1000 name=x", "uid=", "type=", "%d", 4, -4,
-         "Failed to find second tag: type=", INT32, kUntouched32, nullptr},
-        {"second key opens the text", "name=x uid=1", nullptr, "name=", "%s", 8, -2,
-         "Invalid logger message format. It must have a space between two items", TEXT, 0,
-         nullptr},
-        {"empty value between keys", "a= b=1", "a=", "b=", "%s", 8, -2,
-         "Position of second symbol is less than or equal to first one", TEXT, 0, nullptr},
-        {"empty text", "", nullptr, nullptr, "%d", 4, -2,
-         "Position of second symbol is less than or equal to first one", INT32, kUntouched32,
-         nullptr},
-        {"only spaces for a number", "level=   ", "level=", nullptr, "%d", 4, -2,
-         "Failed to get result", INT32, kUntouched32, nullptr},
+    // Failures of the text.
+    {"no space between items", "uid=1000name=x", "uid=", "name=", "%d", 4, -2,
+     "Invalid logger message format. It must have a space between two items", INT32, kUntouched32,
+     nullptr},
+    {"blank value", "uid=", "uid=", nullptr, "%d", 4, -2, "Value of this tag(uid=) is blank", INT32,
+     kUntouched32, nullptr},
+    {"first key missing", "uid=1000", "pid=", nullptr, "%d", 4, -11,
+     "Failed to find first tag: pid=", INT32, kUntouched32, nullptr},
+    {"second key missing", "uid=1000 name=x", "uid=", "type=", "%d", 4, -4,
+     "Failed to find second tag: type=", INT32, kUntouched32, nullptr},
+    {"second key opens the text", "name=x uid=1", nullptr, "name=", "%s", 8, -2,
+     "Invalid logger message format. It must have a space between two items", TEXT, 0, nullptr},
+    {"empty value between keys", "a= b=1", "a=", "b=", "%s", 8, -2,
+     "Position of second symbol is less than or equal to first one", TEXT, 0, nullptr},
+    {"empty text", "", nullptr, nullptr, "%d", 4, -2,
+     "Position of second symbol is less than or equal to first one", INT32, kUntouched32, nullptr},
+    {"only spaces for a number", "level=   ", "level=", nullptr, "%d", 4, -2,
+     "Failed to get result", INT32, kUntouched32, nullptr},
 
-        // Refused arguments.
-        {"output of 0 bytes", "uid=1", "uid=", nullptr, "%s", 0, -5, "Invalid parameter", TEXT, 0,
-         nullptr},
-        {"output above 4096 bytes", "uid=1", "uid=", nullptr, "%s", 4097, -5, "Invalid parameter",
-         TEXT, 0, nullptr},
-        {"format without a conversion", "uid=1", "uid=", nullptr, "d", 4, -5, "Invalid format",
-         INT32, kUntouched32, nullptr},
-        {"text conversion without a width", "name=abc", "name=", nullptr, "%s ", 64, -5,
-         "Invalid format for an output of 64 bytes: %s ", TEXT, 0, nullptr},
-        {"width as large as the output", "name=abc", "name=", nullptr, "%64s", 64, -5,
-         "Invalid format", TEXT, 0, nullptr},
-        {"width 0 is no width", "name=abc", "name=", nullptr, "%0s", 64, -5, "Invalid format", TEXT,
-         0, nullptr},
-        {"scan set without a width", "name=abc", "name=", nullptr, "%[a-z]", 64, -5,
-         "Invalid format", TEXT, 0, nullptr},
-        {"characters beyond the output", "name=abcdef", "name=", nullptr, "%5c", 4, -5,
-         "Invalid format", TEXT, 0, nullptr},
-        {"allocating conversion", "name=abc", "name=", nullptr, "%ms", 64, -5, "Invalid format",
-         TEXT, 0, nullptr},
-        {"wide text", "name=abc", "name=", nullptr, "%5ls", 64, -5, "Invalid format", TEXT, 0,
-         nullptr},
-        {"two outputs", "a=1,2", "a=", nullptr, "%d,%d", 8, -5, "Invalid format", INT32,
-         kUntouched32, nullptr},
-        {"number wider than the output", "delta=5", "delta=", nullptr, "%lld", 4, -5,
-         "Invalid format", INT32, kUntouched32, nullptr},
+    // Refused arguments.
+    {"output of 0 bytes", "uid=1", "uid=", nullptr, "%s", 0, -5, "Invalid parameter", TEXT, 0,
+     nullptr},
+    {"output above 4096 bytes", "uid=1", "uid=", nullptr, "%s", 4097, -5, "Invalid parameter", TEXT,
+     0, nullptr},
+    {"format without a conversion", "uid=1", "uid=", nullptr, "d", 4, -5, "Invalid format", INT32,
+     kUntouched32, nullptr},
+    {"text conversion without a width", "name=abc", "name=", nullptr, "%s ", 64, -5,
+     "Invalid format for an output of 64 bytes: %s ", TEXT, 0, nullptr},
+    {"width as large as the output", "name=abc", "name=", nullptr, "%64s", 64, -5, "Invalid format",
+     TEXT, 0, nullptr},
+    {"width 0 is no width", "name=abc", "name=", nullptr, "%0s", 64, -5, "Invalid format", TEXT, 0,
+     nullptr},
+    {"scan set without a width", "name=abc", "name=", nullptr, "%[a-z]", 64, -5, "Invalid format",
+     TEXT, 0, nullptr},
+    {"characters beyond the output", "name=abcdef", "name=", nullptr, "%5c", 4, -5,
+     "Invalid format", TEXT, 0, nullptr},
+    {"allocating conversion", "name=abc", "name=", nullptr, "%ms", 64, -5, "Invalid format", TEXT,
+     0, nullptr},
+    {"wide text", "name=abc", "name=", nullptr, "%5ls", 64, -5, "Invalid format", TEXT, 0, nullptr},
+    {"two outputs", "a=1,2", "a=", nullptr, "%d,%d", 8, -5, "Invalid format", INT32, kUntouched32,
+     nullptr},
+    {"count of characters read", "name=ab", "name=", nullptr, "%n", 4, -5, "Invalid format", INT32,
+     kUntouched32, nullptr},
+    {"number wider than the output", "delta=5", "delta=", nullptr, "%lld", 4, -5, "Invalid format",
+     INT32, kUntouched32, nullptr},
 };
 
 class LoggerMessageTest : public ::testing::TestWithParam<Case> {};
@@ -127,8 +125,8 @@ TEST_P(LoggerMessageTest, ParsesOrRefusesWithItsErrorLine) {
     memset(out.get(), kFill, room);
 
     LogCapture log;
-    EXPECT_EQ(c.result, parseMessage(text.get(), c.firstKey, c.secondKey, c.format, out.get(),
-                                     c.outSize));
+    EXPECT_EQ(c.result,
+              parseMessage(text.get(), c.firstKey, c.secondKey, c.format, out.get(), c.outSize));
     std::vector<kelvo::test::LogLine> errors = log.linesWith("parseMessage# ");
     if (c.error == nullptr) {
         EXPECT_TRUE(errors.empty()) << errors[0].text;
@@ -137,7 +135,7 @@ TEST_P(LoggerMessageTest, ParsesOrRefusesWithItsErrorLine) {
         EXPECT_EQ(ANDROID_LOG_ERROR, errors[0].priority);
         EXPECT_NE(std::string::npos,
                   errors[0].text.find(std::string("[LoggerMessage.cpp] parseMessage# ") + c.error))
-                << errors[0].text;
+            << errors[0].text;
     }
 
     switch (c.output) {

@@ -1,0 +1,196 @@
+#include <gtest/gtest.h>
+
+#include <chrono>
+#include <future>
+#include <thread>
+
+#include "common/TestEnv.h"
+#include "platform/binder/BinderTestUtil.h"
+
+using android::IBinder;
+using android::Parcel;
+using android::sp;
+using android::String16;
+using kelvo::test::DeathCounter;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+class BinderDeathTest : public ::testing::Test {
+protected:
+    void TearDown() override {
+        for (pid_t pid : mChildren) {
+            kelvo::test::killChild(pid);
+        }
+    }
+
+    // Serves "test.remote" from a child process and returns a proxy to it.
+    sp<IBinder> startRemote() {
+        sp<IBinder> proxy;
+        pid_t pid = kelvo::test::startRemoteService("test.remote", &proxy);
+        mChildren.push_back(pid);
+        EXPECT_NE(nullptr, proxy);
+        return proxy;
+    }
+
+    void killRemote() {
+        ASSERT_FALSE(mChildren.empty());
+        kelvo::test::killChild(mChildren.back());
+        mChildren.pop_back();
+    }
+
+    kelvo::test::TempRoot mRoot;
+    kelvo::test::ServiceWait mWait{10000};
+    std::vector<pid_t> mChildren;
+};
+
+TEST_F(BinderDeathTest, DeathIsToldOnceOnTheDeathThread) {
+    sp<IBinder> proxy = startRemote();
+    ASSERT_NE(nullptr, proxy);
+    ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 1));
+    sp<DeathCounter> first = new DeathCounter();
+    sp<DeathCounter> second = new DeathCounter();
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(first));
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(second, reinterpret_cast<void*>(2)));
+
+    killRemote();
+    ASSERT_TRUE(kelvo::test::waitFor([&] { return first->count() > 0 && second->count() > 0; },
+                                     std::chrono::seconds(10)));
+    EXPECT_NE(std::this_thread::get_id(), first->thread());
+    EXPECT_EQ(proxy.get(), first->who().promote().get());
+    EXPECT_FALSE(proxy->isBinderAlive());
+
+    // Calls now fail at once, whatever they are; links are refused.
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 2));
+    EXPECT_EQ(android::DEAD_OBJECT, proxy->pingBinder());
+    Parcel data;
+    EXPECT_EQ(android::DEAD_OBJECT,
+              proxy->transact(kelvo::test::kRecord, data, nullptr, IBinder::FLAG_ONEWAY));
+    sp<DeathCounter> late = new DeathCounter();
+    EXPECT_EQ(android::DEAD_OBJECT, proxy->linkToDeath(late));
+    EXPECT_EQ(android::DEAD_OBJECT, proxy->unlinkToDeath(first));
+
+    // However often the death shows, each link is told once.
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 3));
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    EXPECT_EQ(1, first->count());
+    EXPECT_EQ(1, second->count());
+    EXPECT_EQ(0, late->count());
+}
+
+TEST_F(BinderDeathTest, DeathDuringACallFailsTheCall) {
+    sp<IBinder> proxy = startRemote();
+    ASSERT_NE(nullptr, proxy);
+    sp<DeathCounter> counter = new DeathCounter();
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(counter));
+
+    // The call waits inside the service (up to 10 s) until the child dies.
+    auto call = std::async(std::launch::async, [proxy] {
+        Parcel data;
+        Parcel reply;
+        data.writeInt32(2);
+        return proxy->transact(kelvo::test::kBlock, data, &reply);
+    });
+    // Let it get there before the kill.
+    std::this_thread::sleep_for(std::chrono::milliseconds(200));
+    Clock::time_point killed = Clock::now();
+    killRemote();
+    ASSERT_EQ(std::future_status::ready, call.wait_for(std::chrono::seconds(8)));
+    EXPECT_EQ(android::DEAD_OBJECT, call.get());
+    EXPECT_LT(Clock::now() - killed, std::chrono::seconds(8));
+    EXPECT_TRUE(
+        kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
+}
+
+TEST_F(BinderDeathTest, UnlinkedRecipientIsNotTold) {
+    sp<IBinder> proxy = startRemote();
+    ASSERT_NE(nullptr, proxy);
+    sp<DeathCounter> kept = new DeathCounter();
+    sp<DeathCounter> dropped = new DeathCounter();
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(kept));
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(dropped, reinterpret_cast<void*>(7)));
+    // The cookie is part of the link.
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped));
+    android::wp<IBinder::DeathRecipient> out;
+    EXPECT_EQ(android::NO_ERROR, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7), 0, &out));
+    EXPECT_EQ(dropped.get(), out.promote().get());
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7)));
+
+    killRemote();
+    // The kept link shows when the death has been told.
+    ASSERT_TRUE(kelvo::test::waitFor([&] { return kept->count() == 1; }, std::chrono::seconds(10)));
+    EXPECT_EQ(0, dropped->count());
+}
+
+TEST_F(BinderDeathTest, RestartedServiceIsAnotherObject) {
+    sp<IBinder> before = startRemote();
+    ASSERT_NE(nullptr, before);
+    ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(before, 1));
+    killRemote();
+    // A dead server's socket is no service.
+    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.remote")));
+
+    sp<IBinder> after = startRemote();
+    ASSERT_NE(nullptr, after);
+    EXPECT_NE(before.get(), after.get());
+    int32_t answer = 0;
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(after, 4, &answer));
+    EXPECT_EQ(5, answer);
+    // The old proxy never reaches the new server.
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(before, 1));
+    EXPECT_FALSE(before->isBinderAlive());
+    EXPECT_TRUE(after->isBinderAlive());
+}
+
+TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
+    sp<IBinder> proxy = startRemote();
+    ASSERT_NE(nullptr, proxy);
+    Parcel data;
+    Parcel reply;
+    ASSERT_EQ(android::NO_ERROR, proxy->transact(kelvo::test::kNewObject, data, &reply));
+    sp<IBinder> object = reply.readStrongBinder();
+    ASSERT_NE(nullptr, object);
+    ASSERT_NE(nullptr, object->remoteBinder());
+    ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(object, 1));
+    // The same remote object read twice is the same proxy.
+    Parcel again;
+    ASSERT_EQ(android::NO_ERROR, proxy->transact(kelvo::test::kSameObject, data, &again));
+    EXPECT_EQ(proxy.get(), again.readStrongBinder().get());
+
+    sp<DeathCounter> counter = new DeathCounter();
+    ASSERT_EQ(android::NO_ERROR, object->linkToDeath(counter));
+    killRemote();
+    ASSERT_TRUE(
+        kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(object, 1));
+}
+
+TEST_F(BinderDeathTest, StoppedServiceOfThisProcessDies) {
+    sp<kelvo::test::TestService> service = new kelvo::test::TestService();
+    ASSERT_EQ(android::NO_ERROR,
+              android::defaultServiceManager()->addService(String16("test.local"), service));
+    sp<IBinder> proxy = android::defaultServiceManager()->getService(String16("test.local"));
+    ASSERT_NE(nullptr, proxy);
+    sp<DeathCounter> counter = new DeathCounter();
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(counter));
+    // Local objects never die.
+    EXPECT_EQ(android::INVALID_OPERATION, service->linkToDeath(counter));
+
+    EXPECT_EQ(android::NAME_NOT_FOUND,
+              kelvo::ServiceControl::stopService(String16("test.unknown")));
+    ASSERT_EQ(android::NO_ERROR, kelvo::ServiceControl::stopService(String16("test.local")));
+    ASSERT_TRUE(
+        kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 1));
+    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.local")));
+
+    // Registered again, it answers through a new proxy.
+    ASSERT_EQ(android::NO_ERROR,
+              android::defaultServiceManager()->addService(String16("test.local"), service));
+    sp<IBinder> again = android::defaultServiceManager()->checkService(String16("test.local"));
+    ASSERT_NE(nullptr, again);
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(again, 1));
+    kelvo::ServiceControl::stopService(String16("test.local"));
+}
+
+} // namespace

@@ -1,0 +1,225 @@
+#include <binder/BpBinder.h>
+#include <fcntl.h>
+#include <gtest/gtest.h>
+#include <unistd.h>
+
+#include <string>
+#include <thread>
+#include <vector>
+
+#include "common/TestEnv.h"
+#include "platform/binder/BinderTestUtil.h"
+
+using android::IBinder;
+using android::Parcel;
+using android::sp;
+using android::String16;
+using android::String8;
+using kelvo::test::TestService;
+
+namespace {
+
+// A service of this process, reached through its socket like any other.
+class BinderTransactionTest : public ::testing::Test {
+protected:
+    void SetUp() override {
+        mService = new TestService();
+        ASSERT_EQ(android::NO_ERROR,
+                  android::defaultServiceManager()->addService(String16("test.echo"), mService));
+        mProxy = android::defaultServiceManager()->getService(String16("test.echo"));
+        ASSERT_NE(nullptr, mProxy);
+    }
+    void TearDown() override { kelvo::ServiceControl::stopService(String16("test.echo")); }
+
+    std::string readAll(int fd) {
+        std::string out;
+        char buf[256];
+        ssize_t n;
+        while ((n = read(fd, buf, sizeof(buf))) > 0) {
+            out.append(buf, static_cast<size_t>(n));
+        }
+        return out;
+    }
+
+    kelvo::test::TempRoot mRoot;
+    sp<TestService> mService;
+    sp<IBinder> mProxy;
+};
+
+TEST_F(BinderTransactionTest, TwoWayCallsAnswerWithTheRemoteStatusAndReply) {
+    // A proxy, even to a service of this very process.
+    ASSERT_NE(nullptr, mProxy->remoteBinder());
+    EXPECT_EQ(nullptr, mProxy->localBinder());
+    EXPECT_TRUE(mProxy->isBinderAlive());
+
+    for (int32_t n : {0, 41, -7}) {
+        Parcel data;
+        Parcel reply;
+        data.writeInt32(n);
+        data.writeString16(String16(u"h\u00e9llo"));
+        ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kEcho, data, &reply));
+        EXPECT_EQ(n + 1, reply.readInt32());
+        EXPECT_EQ(String16(u"h\u00e9llo"), reply.readString16());
+    }
+
+    // The remote onTransact's status comes back as is.
+    Parcel data;
+    Parcel reply;
+    EXPECT_EQ(android::UNKNOWN_TRANSACTION, mProxy->transact(0x00777777, data, &reply));
+    EXPECT_EQ(android::BAD_TYPE, mProxy->transact(kelvo::test::kWriteFd, data, &reply));
+
+    // A large parcel crosses whole; one beyond the frame bound is refused
+    // before it is sent, and the service goes on.
+    std::vector<uint8_t> big(512 * 1024, 0x5a);
+    Parcel large;
+    large.writeInt32(1);
+    large.writeString16(String16(std::string(1000, 'x').c_str()));
+    large.write(big.data(), big.size());
+    Parcel largeReply;
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kEcho, large, &largeReply));
+    EXPECT_EQ(2, largeReply.readInt32());
+    EXPECT_EQ(1000u, largeReply.readString16().size());
+    Parcel tooLarge;
+    std::vector<uint8_t> huge(2 * 1024 * 1024, 1);
+    tooLarge.write(huge.data(), huge.size());
+    EXPECT_EQ(android::FAILED_TRANSACTION, mProxy->transact(kelvo::test::kEcho, tooLarge, &reply));
+    int32_t answer = 0;
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(mProxy, 9, &answer));
+    EXPECT_EQ(10, answer);
+}
+
+TEST_F(BinderTransactionTest, BuiltInPingDescriptorAndDump) {
+    EXPECT_EQ(android::NO_ERROR, mProxy->pingBinder());
+    EXPECT_EQ(String16(kelvo::test::kTestDescriptor), mProxy->getInterfaceDescriptor());
+    // The descriptor names the interface of the token a client writes.
+    Parcel token;
+    token.writeInterfaceToken(mProxy->getInterfaceDescriptor());
+    token.setDataPosition(0);
+    EXPECT_TRUE(token.checkInterface(mService.get()));
+
+    int pipeFds[2];
+    ASSERT_EQ(0, pipe2(pipeFds, O_CLOEXEC));
+    android::Vector<String16> args;
+    args.add(String16("--help"));
+    args.add(String16("x y"));
+    EXPECT_EQ(android::NO_ERROR, mProxy->dump(pipeFds[1], args));
+    close(pipeFds[1]);
+    EXPECT_EQ("dump of test service: --help x y\n", readAll(pipeFds[0]));
+    close(pipeFds[0]);
+
+    // A dump request whose argument count outruns its data is refused.
+    Parcel bad;
+    Parcel reply;
+    bad.writeFileDescriptor(STDERR_FILENO);
+    bad.writeInt32(1000);
+    bad.writeString16(String16("one"));
+    EXPECT_EQ(android::BAD_VALUE, mProxy->transact(IBinder::DUMP_TRANSACTION, bad, &reply));
+}
+
+TEST_F(BinderTransactionTest, DescriptorsTravelAsDuplicates) {
+    int pipeFds[2];
+    ASSERT_EQ(0, pipe2(pipeFds, O_CLOEXEC));
+    Parcel data;
+    Parcel reply;
+    ASSERT_EQ(android::NO_ERROR, data.writeFileDescriptor(pipeFds[1]));
+    data.writeString8(String8("through the socket"));
+    // The parcel holds its own copy: the caller's may close before the call.
+    close(pipeFds[1]);
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kWriteFd, data, &reply));
+    data.freeData();
+    EXPECT_EQ("through the socket", readAll(pipeFds[0]));
+    close(pipeFds[0]);
+}
+
+TEST_F(BinderTransactionTest, ObjectsInParcelsKeepTheirIdentity) {
+    // Our own objects come back as themselves.
+    Parcel data;
+    Parcel reply;
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kSameObject, data, &reply));
+    sp<IBinder> same = reply.readStrongBinder();
+    EXPECT_EQ(mService.get(), same.get());
+
+    Parcel newReply;
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kNewObject, data, &newReply));
+    sp<IBinder> fresh = newReply.readStrongBinder();
+    ASSERT_NE(nullptr, fresh);
+    ASSERT_NE(nullptr, fresh->localBinder());
+    int32_t answer = 0;
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(fresh, 1, &answer));
+    EXPECT_EQ(2, answer);
+
+    // A callback object handed to the service is called back during the call.
+    sp<TestService> listener = new TestService();
+    Parcel call;
+    Parcel callReply;
+    call.writeStrongBinder(listener);
+    call.writeInt32(100);
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kCallBack, call, &callReply));
+    EXPECT_EQ(101, callReply.readInt32());
+
+    // Handing a proxy on gives the receiver the same object.
+    Parcel viaProxy;
+    Parcel viaReply;
+    viaProxy.writeStrongBinder(mProxy);
+    viaProxy.writeInt32(5);
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kCallBack, viaProxy, &viaReply));
+    EXPECT_EQ(6, viaReply.readInt32());
+
+    // A null binder is refused by a service that needs one.
+    Parcel nullCall;
+    nullCall.writeStrongBinder(nullptr);
+    EXPECT_EQ(android::UNEXPECTED_NULL, mProxy->transact(kelvo::test::kCallBack, nullCall, &reply));
+}
+
+TEST_F(BinderTransactionTest, PoolThreadsServeCallsConcurrently) {
+    // Each call waits inside until three are inside: a pool that served one
+    // at a time would never get there.
+    constexpr int kCalls = 3;
+    std::vector<std::thread> callers;
+    std::atomic<int> reached{0};
+    for (int i = 0; i < kCalls; ++i) {
+        callers.emplace_back([this, &reached] {
+            Parcel data;
+            Parcel reply;
+            data.writeInt32(kCalls);
+            if (mProxy->transact(kelvo::test::kBlock, data, &reply) == android::NO_ERROR &&
+                reply.readBool()) {
+                reached++;
+            }
+        });
+    }
+    for (std::thread& t : callers) {
+        t.join();
+    }
+    EXPECT_EQ(kCalls, reached.load());
+}
+
+TEST_F(BinderTransactionTest, OnewayCallsArriveInOrderOneAtATime) {
+    constexpr int kCount = 200;
+    for (int i = 0; i < kCount; ++i) {
+        Parcel data;
+        data.writeInt32(i);
+        ASSERT_EQ(android::NO_ERROR,
+                  mProxy->transact(kelvo::test::kRecord, data, nullptr, IBinder::FLAG_ONEWAY));
+    }
+    ASSERT_TRUE(kelvo::test::waitFor([&] { return mService->records().size() >= kCount; },
+                                     std::chrono::seconds(30)));
+    std::vector<int32_t> records = mService->records();
+    ASSERT_EQ(static_cast<size_t>(kCount), records.size());
+    for (int i = 0; i < kCount; ++i) {
+        ASSERT_EQ(i, records[i]);
+    }
+    EXPECT_EQ(1, mService->maxInside());
+}
+
+TEST_F(BinderTransactionTest, CallerOfAnInProcessCallIsThisProcess) {
+    Parcel data;
+    Parcel reply;
+    ASSERT_EQ(android::NO_ERROR, mProxy->transact(kelvo::test::kWhoCalls, data, &reply));
+    EXPECT_EQ(getpid(), reply.readInt32());
+    EXPECT_EQ(static_cast<int32_t>(getuid()), reply.readInt32());
+    // Outside a transaction the caller is this process too.
+    EXPECT_EQ(getpid(), android::IPCThreadState::self()->getCallingPid());
+}
+
+} // namespace

@@ -1,0 +1,101 @@
+#include <gtest/gtest.h>
+#include <sys/socket.h>
+#include <sys/un.h>
+
+#include <chrono>
+#include <string>
+#include <thread>
+
+#include "common/TestEnv.h"
+#include "platform/binder/BinderTestUtil.h"
+
+using android::sp;
+using android::String16;
+using Clock = std::chrono::steady_clock;
+
+namespace {
+
+class ServiceManagerTest : public ::testing::Test {
+protected:
+    void TearDown() override {
+        for (const char* name : {"test.late", "test.a", "test.b", "test.stale"}) {
+            kelvo::ServiceControl::stopService(String16(name));
+        }
+    }
+    kelvo::test::TempRoot mRoot;
+    sp<android::IServiceManager> mManager = android::defaultServiceManager();
+};
+
+TEST_F(ServiceManagerTest, GetServiceWaitsForTheNameToAppear) {
+    kelvo::test::ServiceWait wait(10000);
+    std::thread late([this] {
+        std::this_thread::sleep_for(std::chrono::milliseconds(300));
+        mManager->addService(String16("test.late"), new kelvo::test::TestService());
+    });
+    sp<android::IBinder> service = mManager->getService(String16("test.late"));
+    late.join();
+    ASSERT_NE(nullptr, service);
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(service, 1));
+}
+
+TEST_F(ServiceManagerTest, GetServiceGivesUpAfterItsWaitAndCheckServiceDoesNotWait) {
+    kelvo::test::ServiceWait wait(300);
+    Clock::time_point start = Clock::now();
+    EXPECT_EQ(nullptr, mManager->getService(String16("test.missing")));
+    Clock::duration waited = Clock::now() - start;
+    EXPECT_GE(waited, std::chrono::milliseconds(300));
+    EXPECT_LT(waited, std::chrono::seconds(5));
+
+    kelvo::test::ServiceWait longWait(60000);
+    start = Clock::now();
+    EXPECT_EQ(nullptr, mManager->checkService(String16("test.missing")));
+    EXPECT_LT(Clock::now() - start, std::chrono::seconds(5));
+}
+
+TEST_F(ServiceManagerTest, NamesThatCannotBeSocketsAreRefused) {
+    sp<android::IBinder> service = new kelvo::test::TestService();
+    for (const char* bad : {"", "a/b", "../up", ".hidden", "..", "sp ace", "new\nline"}) {
+        SCOPED_TRACE(bad);
+        EXPECT_EQ(android::BAD_VALUE, mManager->addService(String16(bad), service));
+        EXPECT_EQ(nullptr, mManager->checkService(String16(bad)));
+    }
+    EXPECT_EQ(android::BAD_VALUE,
+              mManager->addService(String16(std::string(200, 'n').c_str()), service));
+    EXPECT_EQ(android::BAD_VALUE, mManager->addService(String16("test.null"), nullptr));
+    // Nothing was created outside the socket folder.
+    EXPECT_FALSE(kelvo::test::hostPathExists(mRoot.path() + "/dev/up"));
+}
+
+TEST_F(ServiceManagerTest, StaleSocketIsNoServiceAndIsReplaced) {
+    // What a killed server leaves behind: a socket file nobody listens on.
+    std::string dir = kelvo::ServiceControl::socketDir();
+    kelvo::test::makeHostDirs(dir);
+    std::string path = dir + "/test.stale";
+    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
+    struct sockaddr_un addr = {};
+    addr.sun_family = AF_UNIX;
+    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
+    ASSERT_EQ(0, bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)));
+    close(fd);
+    ASSERT_TRUE(kelvo::test::hostPathExists(path));
+
+    EXPECT_EQ(nullptr, mManager->checkService(String16("test.stale")));
+    ASSERT_EQ(android::NO_ERROR,
+              mManager->addService(String16("test.stale"), new kelvo::test::TestService()));
+    sp<android::IBinder> service = mManager->checkService(String16("test.stale"));
+    ASSERT_NE(nullptr, service);
+    EXPECT_EQ(android::NO_ERROR, service->pingBinder());
+}
+
+TEST_F(ServiceManagerTest, ListServicesNamesTheLiveOnes) {
+    mManager->addService(String16("test.b"), new kelvo::test::TestService());
+    mManager->addService(String16("test.a"), new kelvo::test::TestService());
+    mManager->addService(String16("test.late"), new kelvo::test::TestService());
+    kelvo::ServiceControl::stopService(String16("test.late"));
+    android::Vector<String16> names = mManager->listServices();
+    ASSERT_EQ(2u, names.size());
+    EXPECT_EQ(String16("test.a"), names[0]);
+    EXPECT_EQ(String16("test.b"), names[1]);
+}
+
+} // namespace
