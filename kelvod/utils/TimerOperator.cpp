@@ -45,15 +45,15 @@ int32_t TimerOperator::schedule() {
         KLOGE("Failed to get clock time: %s", strerror(errno));
         return -2;
     }
-    struct itimerspec spec = {};
-    spec.it_interval = mInterval;
-    spec.it_value.tv_sec = now.tv_sec + mFirst.tv_sec;
-    spec.it_value.tv_nsec = now.tv_nsec + mFirst.tv_nsec;
-    if (spec.it_value.tv_nsec >= kNsPerSecond) {
-        spec.it_value.tv_sec += 1;
-        spec.it_value.tv_nsec -= kNsPerSecond;
+    struct itimerspec timerValue = {};
+    timerValue.it_interval = mInterval;
+    timerValue.it_value.tv_sec = now.tv_sec + mFirst.tv_sec;
+    timerValue.it_value.tv_nsec = now.tv_nsec + mFirst.tv_nsec;
+    if (timerValue.it_value.tv_nsec >= kNsPerSecond) {
+        timerValue.it_value.tv_sec += 1;
+        timerValue.it_value.tv_nsec -= kNsPerSecond;
     }
-    if (timerfd_settime(mFd, TFD_TIMER_ABSTIME, &spec, nullptr) != 0) {
+    if (timerfd_settime(mFd, TFD_TIMER_ABSTIME, &timerValue, nullptr) != 0) {
         KLOGE("Failed to set timer: %s", strerror(errno));
         return -2;
     }
@@ -67,8 +67,8 @@ int32_t TimerOperator::reschedule(int64_t firstMs, int64_t intervalMs) {
 }
 
 int32_t TimerOperator::cancel() {
-    struct itimerspec spec = {};
-    if (timerfd_settime(mFd, 0, &spec, nullptr) != 0) {
+    struct itimerspec timerValue = {};
+    if (timerfd_settime(mFd, 0, &timerValue, nullptr) != 0) {
         KLOGE("Failed to set timer: %s", strerror(errno));
         return -2;
     }
@@ -76,12 +76,12 @@ int32_t TimerOperator::cancel() {
 }
 
 int64_t TimerOperator::getExpire() const {
-    struct itimerspec spec = {};
-    if (timerfd_gettime(mFd, &spec) != 0) {
+    struct itimerspec timerValue = {};
+    if (timerfd_gettime(mFd, &timerValue) != 0) {
         KLOGE("Failed to get timer: %s", strerror(errno));
         return -2;
     }
-    return static_cast<int64_t>(spec.it_value.tv_sec) * 1000 + spec.it_value.tv_nsec / 1000000;
+    return static_cast<int64_t>(timerValue.it_value.tv_sec) * 1000 + timerValue.it_value.tv_nsec / 1000000;
 }
 
 } // namespace kelvo
