@@ -329,49 +329,36 @@ int32_t KelvoOperator::handleNotification(int32_t type, const android::Parcel& d
     return (this->*kOperations[type])(data);
 }
 
-int32_t KelvoOperator::onForegroundChanged(const android::Parcel& data) {
+int32_t KelvoOperator::feedStateChange(int32_t actionCode, const android::Parcel& data,
+                                       bool named) {
     if (mAccounterType == -1) {
         return 0;
     }
+    // Every state notification starts with its time, then the new state: a
+    // package name for the foreground, a flag for screen and charger.
     data.setDataPosition(0);
-    int64_t time = data.readInt64();
-    android::String8 name = data.readString8();
     android::Parcel action;
     action.writeInt32(mAccounterType);
-    action.writeInt32(ACTION_FOREGROUND);
-    action.writeInt64(time);
-    action.writeString8(name);
+    action.writeInt32(actionCode);
+    action.writeInt64(data.readInt64());
+    if (named) {
+        action.writeString8(data.readString8());
+    } else {
+        action.writeBool(data.readBool());
+    }
     return feedAccounter(action);
+}
+
+int32_t KelvoOperator::onForegroundChanged(const android::Parcel& data) {
+    return feedStateChange(ACTION_FOREGROUND, data, true);
 }
 
 int32_t KelvoOperator::onScreenStateChanged(const android::Parcel& data) {
-    if (mAccounterType == -1) {
-        return 0;
-    }
-    data.setDataPosition(0);
-    int64_t time = data.readInt64();
-    bool on = data.readBool();
-    android::Parcel action;
-    action.writeInt32(mAccounterType);
-    action.writeInt32(ACTION_SCREEN_STATE);
-    action.writeInt64(time);
-    action.writeBool(on);
-    return feedAccounter(action);
+    return feedStateChange(ACTION_SCREEN_STATE, data, false);
 }
 
 int32_t KelvoOperator::onChargerOnlineChanged(const android::Parcel& data) {
-    if (mAccounterType == -1) {
-        return 0;
-    }
-    data.setDataPosition(0);
-    int64_t time = data.readInt64();
-    bool online = data.readBool();
-    android::Parcel action;
-    action.writeInt32(mAccounterType);
-    action.writeInt32(ACTION_CHARGER_ONLINE);
-    action.writeInt64(time);
-    action.writeBool(online);
-    return feedAccounter(action);
+    return feedStateChange(ACTION_CHARGER_ONLINE, data, false);
 }
 
 int32_t KelvoOperator::onVmDied(const android::Parcel& data) {

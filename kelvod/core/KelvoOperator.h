@@ -126,6 +126,7 @@ protected:
     int32_t handleNotification(int32_t type, const android::Parcel& data);
     // Builds an action for this operator's accounter and hands it over.
     int32_t feedAccounter(const android::Parcel& action);
+    int32_t feedStateChange(int32_t actionCode, const android::Parcel& data, bool named);
 
     int32_t mAccounterType;
     uint32_t mElector;
