@@ -5,6 +5,7 @@
 
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
+#include "binder/managers/BatteryManager.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "storage/DataUploader.h"
@@ -197,7 +198,11 @@ void KelvoAgent::startLibrary() {
 
 void KelvoAgent::publishService() {}
 
-void KelvoAgent::startBatteryListener() {}
+void KelvoAgent::startBatteryListener() {
+    // The registrar may come up after the daemon: registration goes on in
+    // the background until it succeeds, and start-up does not wait for it.
+    BatteryManager::getInstance()->registerInBackground();
+}
 
 void KelvoAgent::initRoutines() {
     for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
