@@ -1,5 +1,7 @@
 #include "core/KelvoOperator.h"
 
+#include <functional>
+
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "core/BufferedLogServer.h"
@@ -75,19 +77,36 @@ void KelvoOperator::addBufferedLogReceiver(const char* name, int32_t type, andro
     out.writeInt32(type);
 }
 
-void KelvoOperator::registerListeners() {
+void KelvoOperator::forEachListenerRecord(
+        const std::function<void(int32_t kind, const android::String8& name, int32_t type)>& visit) {
     android::Parcel records;
     setupListeners(records);
     records.writeInt32(LISTENER_END);
     records.setDataPosition(0);
     for (;;) {
         int32_t kind = records.readInt32();
-        if (kind == LISTENER_END) {
-            return;
-        }
+        android::String8 name;
         switch (kind) {
-            case LISTENER_NOTIFIER: {
-                int32_t type = records.readInt32();
+            case LISTENER_END:
+                return;
+            case LISTENER_BUFFERED_LOG:
+                name = records.readString8();
+                [[fallthrough]];
+            case LISTENER_NOTIFIER:
+            case LISTENER_LIBRARY:
+                visit(kind, name, records.readInt32());
+                break;
+            default:
+                KLOGE("Unknown listener type: %d", kind);
+                return;
+        }
+    }
+}
+
+void KelvoOperator::registerListeners() {
+    forEachListenerRecord([this](int32_t kind, const android::String8& name, int32_t type) {
+        switch (kind) {
+            case LISTENER_NOTIFIER:
                 if (mNotifierListener == nullptr) {
                     mNotifierListener.reset(new NotifierListener(this));
                 }
@@ -95,9 +114,7 @@ void KelvoOperator::registerListeners() {
                     KLOGE("Failed to register notification listener: %d", type);
                 }
                 break;
-            }
-            case LISTENER_LIBRARY: {
-                int32_t type = records.readInt32();
+            case LISTENER_LIBRARY:
                 if (mLibraryListener == nullptr) {
                     mLibraryListener = new MyLibraryListener(this);
                 }
@@ -105,10 +122,7 @@ void KelvoOperator::registerListeners() {
                     KLOGE("Failed to register library listener");
                 }
                 break;
-            }
-            case LISTENER_BUFFERED_LOG: {
-                android::String8 name = records.readString8();
-                int32_t type = records.readInt32();
+            case LISTENER_BUFFERED_LOG:
                 if (mLogReceiver == nullptr) {
                     mLogReceiver = new LogReceiver(this);
                 }
@@ -117,56 +131,30 @@ void KelvoOperator::registerListeners() {
                     KLOGE("Failed to register buffered log listener");
                 }
                 break;
-            }
-            default:
-                KLOGE("Unknown listener type: %d", kind);
-                return;
         }
-    }
+    });
 }
 
 void KelvoOperator::unregisterListeners() {
-    android::Parcel records;
-    setupListeners(records);
-    records.writeInt32(LISTENER_END);
-    records.setDataPosition(0);
-    for (;;) {
-        int32_t kind = records.readInt32();
-        if (kind == LISTENER_END) {
-            break;
-        }
+    forEachListenerRecord([this](int32_t kind, const android::String8& name, int32_t type) {
         switch (kind) {
-            case LISTENER_NOTIFIER: {
-                int32_t type = records.readInt32();
+            case LISTENER_NOTIFIER:
                 if (mNotifierListener != nullptr) {
                     Notifier::getInstance()->unregisterListener(type, mNotifierListener.get());
                 }
                 break;
-            }
-            case LISTENER_LIBRARY: {
-                int32_t type = records.readInt32();
+            case LISTENER_LIBRARY:
                 if (mLibraryListener != nullptr) {
                     unregisterLibraryListener(type);
                 }
                 break;
-            }
-            case LISTENER_BUFFERED_LOG: {
-                android::String8 name = records.readString8();
-                int32_t type = records.readInt32();
+            case LISTENER_BUFFERED_LOG:
                 if (mLogReceiver != nullptr) {
                     BufferedLogServer::getInstance()->unregisterLogReceiver(name, type);
                 }
                 break;
-            }
-            default:
-                KLOGE("Unknown listener type: %d", kind);
-                kind = LISTENER_END;
-                break;
         }
-        if (kind == LISTENER_END) {
-            break;
-        }
-    }
+    });
     mNotifierListener.reset();
     mLibraryListener.clear();
     mLogReceiver.clear();

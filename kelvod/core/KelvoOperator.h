@@ -2,6 +2,7 @@
 
 #include <stdint.h>
 
+#include <functional>
 #include <memory>
 
 #include <binder/Parcel.h>
@@ -134,6 +135,10 @@ protected:
 private:
     void registerListeners();
     void unregisterListeners();
+    // Walks the records of setupListeners until the end or an unknown one.
+    void forEachListenerRecord(
+            const std::function<void(int32_t kind, const android::String8& name, int32_t type)>&
+                    visit);
 
     std::unique_ptr<NotifierListener> mNotifierListener;
     android::sp<MyLibraryListener> mLibraryListener;

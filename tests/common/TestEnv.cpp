@@ -12,6 +12,8 @@
 #include <sstream>
 #include <thread>
 
+#include <ziparchive/zip_archive.h>
+
 #include "kelvo/HostProperties.h"
 #include "kelvo/RootPath.h"
 
@@ -167,6 +169,30 @@ void LogCapture::clear() {
     CaptureState& s = capture();
     std::lock_guard<std::mutex> guard(s.lock);
     s.lines.clear();
+}
+
+std::map<std::string, std::string> readZip(const std::string& path) {
+    std::map<std::string, std::string> entries;
+    ZipArchiveHandle handle = nullptr;
+    if (OpenArchive(path.c_str(), &handle) == 0) {
+        void* cookie = nullptr;
+        if (StartIteration(handle, &cookie) == 0) {
+            ZipEntry entry = {};
+            std::string name;
+            while (Next(cookie, &entry, &name) == 0) {
+                std::string data(entry.uncompressed_length, '\0');
+                if (ExtractToMemory(handle, &entry, reinterpret_cast<uint8_t*>(&data[0]),
+                                    entry.uncompressed_length) == 0) {
+                    entries[name] = data;
+                }
+            }
+            EndIteration(cookie);
+        }
+    }
+    if (handle != nullptr) {
+        CloseArchive(handle);
+    }
+    return entries;
 }
 
 bool waitFor(const std::function<bool()>& condition, std::chrono::milliseconds timeout) {

@@ -4,6 +4,7 @@
 
 #include <chrono>
 #include <functional>
+#include <map>
 #include <mutex>
 #include <string>
 #include <vector>
@@ -61,6 +62,10 @@ std::string readHostFile(const std::string& path);
 bool hostPathExists(const std::string& path);
 // The sorted names in dir (without "." and "..") that match the pattern.
 std::vector<std::string> listDir(const std::string& dir, const std::string& pattern = ".*");
+
+// Entry name -> content of a zip, read with the platform's zip reader;
+// empty when it cannot be opened.
+std::map<std::string, std::string> readZip(const std::string& path);
 
 // Polls the condition until it holds or the time-out passes.
 bool waitFor(const std::function<bool()>& condition,

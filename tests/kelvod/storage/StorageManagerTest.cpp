@@ -35,6 +35,7 @@ using kelvo::test::hostPathExists;
 using kelvo::test::listDir;
 using kelvo::test::makeHostDirs;
 using kelvo::test::readHostFile;
+using kelvo::test::readZip;
 using kelvo::test::writeHostFile;
 
 namespace {
@@ -52,28 +53,6 @@ std::vector<std::string> copiesIn(const std::string& dir) {
     return contents;
 }
 
-std::map<std::string, std::string> readZip(const std::string& path) {
-    std::map<std::string, std::string> entries;
-    ZipArchiveHandle handle = nullptr;
-    if (OpenArchive(path.c_str(), &handle) == 0) {
-        void* cookie = nullptr;
-        if (StartIteration(handle, &cookie) == 0) {
-            ZipEntry entry = {};
-            std::string name;
-            while (Next(cookie, &entry, &name) == 0) {
-                std::string data(entry.uncompressed_length, '\0');
-                ExtractToMemory(handle, &entry, reinterpret_cast<uint8_t*>(&data[0]),
-                                entry.uncompressed_length);
-                entries[name] = data;
-            }
-            EndIteration(cookie);
-        }
-    }
-    if (handle != nullptr) {
-        CloseArchive(handle);
-    }
-    return entries;
-}
 
 std::string copyName(int64_t time) {
     return "kelvo-" + std::to_string(time) + ".db";

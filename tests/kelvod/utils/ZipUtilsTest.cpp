@@ -21,37 +21,13 @@ using kelvo::test::hostPathExists;
 using kelvo::test::listDir;
 using kelvo::test::makeHostDirs;
 using kelvo::test::readHostFile;
+using kelvo::test::readZip;
 using kelvo::test::writeHostFile;
 
 namespace {
 
 constexpr int64_t kNoLimit = 1 << 30;
 
-// Entry name -> content, read with the library's own reader.
-std::map<std::string, std::string> readZip(const std::string& path) {
-    std::map<std::string, std::string> entries;
-    ZipArchiveHandle handle = nullptr;
-    if (OpenArchive(path.c_str(), &handle) != 0) {
-        if (handle != nullptr) {
-            CloseArchive(handle);
-        }
-        return entries;
-    }
-    void* cookie = nullptr;
-    if (StartIteration(handle, &cookie) == 0) {
-        ZipEntry entry = {};
-        std::string name;
-        while (Next(cookie, &entry, &name) == 0) {
-            std::string data(entry.uncompressed_length, '\0');
-            ExtractToMemory(handle, &entry, reinterpret_cast<uint8_t*>(&data[0]),
-                            entry.uncompressed_length);
-            entries[name] = data;
-        }
-        EndIteration(cookie);
-    }
-    CloseArchive(handle);
-    return entries;
-}
 
 // A zip with entries named at will, as a hostile or broken one could be.
 void craftZip(const std::string& path,
