@@ -2,6 +2,7 @@
 
 #include <functional>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "core/BufferedLogServer.h"
@@ -416,7 +417,11 @@ int32_t KelvoOperator::onDiffDayReboot(const android::Parcel&) { return 0; }
 int32_t KelvoOperator::logApplicationsAccounting(int64_t) { return 0; }
 int32_t KelvoOperator::logComponentAccounting(int64_t) { return 0; }
 int32_t KelvoOperator::lateInitialize() { return 0; }
-void KelvoOperator::dump(android::String8&) {}
+void KelvoOperator::dump(android::String8& out) {
+    // What the process dropped, refused or capped, by cause.
+    out.append("Self-health counters:\n");
+    out.append(HealthCounters::format().c_str());
+}
 void KelvoOperator::setupListeners(android::Parcel&) {}
 void KelvoOperator::registerDispatcherTag() {}
 void KelvoOperator::setCandidateElector() {}

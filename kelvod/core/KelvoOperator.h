@@ -82,6 +82,8 @@ public:
     static void addBufferedLogReceiver(const char* name, int32_t type, android::Parcel& out);
 
     virtual int32_t lateInitialize();
+    // The base prints the process-wide self-health counters; an override
+    // adds its own state and calls it.
     virtual void dump(android::String8& out);
     virtual int32_t onForegroundChanged(const android::Parcel& data);
     virtual int32_t onScreenStateChanged(const android::Parcel& data);

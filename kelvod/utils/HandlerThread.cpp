@@ -8,6 +8,7 @@
 
 #include <utils/Timers.h>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 
 namespace kelvo {
@@ -25,6 +26,7 @@ HandlerThread::HandlerThread(const char* name, int32_t priority)
         return;
     }
     mName.setTo(name, strnlen(name, kMaxNameLength));
+    mQueueSlot = HealthCounters::queueSlot(mName.string());
     if (priority < -19 || priority > 19) {
         KLOGE("Invalid priority: %s", mName.string());
         return;
@@ -66,6 +68,7 @@ int32_t HandlerThread::queueMessage(const ParcelMessage& msg) {
         mLastId = id;
     } while (mPending.count(id) != 0);
     mPending.emplace(id, msg);
+    HealthCounters::noteQueueDepth(mQueueSlot, mPending.size());
     return id;
 }
 

@@ -70,6 +70,9 @@ private:
 
     typedef std::multimap<nsecs_t, int32_t> Queue;
 
+    // Slot of this thread's queue high-water mark (-1: none).
+    int mQueueSlot = -1;
+
     struct pending_message {
         explicit pending_message(const ParcelMessage& m) : msg(m) {}
         ParcelMessage msg;

@@ -1,0 +1,56 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <string>
+
+namespace kelvo {
+
+// What the daemon dropped, refused or capped. Every place that loses
+// something on purpose counts it here, so a dump says why data is missing.
+// Add a cause at the end of the list and give it a name in kHealthNames.
+enum class Health : uint32_t {
+    LogRecordMalformed,      // log-device record that failed to decode
+    LogRecordUnknownTag,     // log-device record with no receiver for its tag
+    LoggerMessageRefused,    // logger message an operator could not take
+    BufferedEntryRefused,    // buffered-log entry with a bad length or magic
+    StorageEntryRefused,     // storage entry parcel refused (short, null, bad kind)
+    LibraryParcelRefused,    // accounting-library parcel refused
+    ErrorLinesSuppressed,    // error lines over the daily cap (not stored)
+    ErrorRowsDropped,        // error lines not stored for another reason
+    FlushRowsAbandoned,      // buffered rows lost by a failed flush
+    InsertsDeferred,         // flushes put off because the tables were not ready
+    UploadFailures,          // upload events that could not be built or sent
+    UploadRecordsRefused,    // single upload records refused
+    MessagesDropped,         // queued messages dropped by a stopping thread
+    MessagesRefused,         // messages refused by a thread that was not accepting
+    FilesDeleted,            // database or backup files deleted by a clean
+    Count
+};
+
+class HealthCounters {
+public:
+    // Most named queue high-water marks kept; more names are counted in
+    // "queue_slots_full" and not tracked.
+    static constexpr int kMaxQueues = 48;
+
+    // Relaxed atomic add: cheap enough for every hot path.
+    static void add(Health which, uint64_t n = 1);
+    static uint64_t get(Health which);
+    static const char* name(Health which);
+
+    // A slot for a named queue's high-water mark; the same name gets the
+    // same slot. Returns -1 when every slot is taken.
+    static int queueSlot(const char* name);
+    // Raises the slot's mark to depth when it is higher.
+    static void noteQueueDepth(int slot, uint64_t depth);
+    static uint64_t queueHighWater(const char* name);
+
+    // "name value" lines, causes first, then "queue_high_water.<name> <n>".
+    static std::string format();
+
+    // Sets every counter and mark back to 0 (tests).
+    static void resetForTest();
+};
+
+}  // namespace kelvo
