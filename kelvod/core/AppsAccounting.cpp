@@ -267,11 +267,13 @@ int32_t AppsAccounting::uploadAppsAccounting(uint32_t event, int64_t start, int6
         names.push_back(name);
     }
     android::Parcel data;
-    std::string powerLog;
     for (size_t i = 0; i < names.size(); ++i) {
         android::Parcel object;
-        if (queryAppsComponent(start, end, names[i], object, scale) < 0 ||
-            object.dataSize() == 0) {
+        // A failed query ends the upload: a partial top list is not sent.
+        if (queryAppsComponent(start, end, names[i], object, scale) < 0) {
+            return -17;
+        }
+        if (object.dataSize() == 0) {
             continue;
         }
         android::Parcel package;
@@ -283,8 +285,14 @@ int32_t AppsAccounting::uploadAppsAccounting(uint32_t event, int64_t start, int6
         }
         DataUploader::formClassData(static_cast<uint32_t>(i + 2), kApplicationClass, object, data);
     }
-    for (const android::String8& name : names) {
-        powerLog.append(name.string()).append("#");
+    // The day's names go to the power log whether or not any of them had
+    // fields to upload.
+    if (end - start == kDayMs && !names.empty()) {
+        std::string powerLog;
+        for (const android::String8& name : names) {
+            powerLog.append(name.string()).append("#");
+        }
+        __android_logPower_print(5, 215, "", "apps", powerLog.c_str());
     }
     if (data.dataSize() == 0) {
         return 0;
@@ -292,9 +300,6 @@ int32_t AppsAccounting::uploadAppsAccounting(uint32_t event, int64_t start, int6
     if (DataUploader::getInstance()->setEventData(event, data, true) < 0) {
         KLOGE("Failed to set applications accounting upload data(%u)", event);
         return -23;
-    }
-    if (end - start == kDayMs) {
-        __android_logPower_print(5, 215, "", "apps", powerLog.c_str());
     }
     return 0;
 }

@@ -2,6 +2,7 @@
 
 #include <cstring>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 
 namespace kelvo {
@@ -26,8 +27,12 @@ int32_t BufferedLogServer::registerLogReceiver(const android::sp<LogReceiver>& r
         KLOGE("Invalid parameter");
         return -5;
     }
-    std::lock_guard<std::mutex> guard(mLock);
-    if (!mReceivers.emplace(key(name, magic), receiver).second) {
+    bool added;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        added = mReceivers.emplace(key(name, magic), receiver).second;
+    }
+    if (!added) {
         KLOGE("This type(%s) or magic(%d) has been registered", name.string(), magic);
         return -13;
     }
@@ -44,6 +49,7 @@ int32_t BufferedLogServer::sendLogMessage(const android::String8& name, const ui
                                           size_t size) {
     int32_t magic = 0;
     if (entry == nullptr || size < 8) {
+        HealthCounters::add(Health::BufferedEntryRefused);
         KLOGE("Invalid parameter");
         return -5;
     }
@@ -58,6 +64,7 @@ int32_t BufferedLogServer::sendLogMessage(const android::String8& name, const ui
         }
     }
     if (receiver == nullptr) {
+        HealthCounters::add(Health::BufferedEntryRefused);
         KLOGE("No receiver to receive message (name=%s, type=%s, magic=%d)", k.c_str(),
               name.string(), magic);
         return -4;

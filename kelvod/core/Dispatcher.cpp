@@ -9,6 +9,9 @@
 #include <cstring>
 #include <string_view>
 
+#include <utils/Timers.h>
+
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "core/DispatcherThread.h"
 #include "core/KelvoOperator.h"
@@ -21,6 +24,9 @@ namespace kelvo {
 namespace {
 
 constexpr int32_t kThreadPriority = 11;
+// Malformed records are counted one by one but summed up in the error log at
+// most this often, so a broken writer cannot spend the day's error lines.
+constexpr nsecs_t kMalformedSummaryPeriodNs = 60 * 1000000000LL;
 
 std::mutex gInstanceLock;
 // Never destroyed: the dispatcher lives as long as the process.
@@ -48,7 +54,13 @@ void Dispatcher::resetForTest() {
     }
 }
 
-Dispatcher::Dispatcher() : mFd(-1), mDatagram(false), mStopping(false), mLogCount(0) {
+Dispatcher::Dispatcher()
+    : mFd(-1),
+      mDatagram(false),
+      mStopping(false),
+      mLogCount(0),
+      mMalformedSinceSummary(0),
+      mLastMalformedSummaryNs(0) {
     memset(mBuffer, 0, sizeof(mBuffer));
     std::string path = RootPath::resolve(KELVO_LOG_DEVICE);
     mFd = LogDevice::openForReading(path.c_str());
@@ -147,18 +159,29 @@ int32_t Dispatcher::readLoggerMessage() {
         return -14;
     }
 
-    // One bad record costs only itself: log it and read on.
+    // One bad record costs only itself: count it and read on.
     LoggerRecord entry;
-    if (entry.decode(mBuffer, static_cast<size_t>(n)) < 0) {
-        unsigned payload = n >= 2 ? static_cast<unsigned>(mBuffer[0] | (mBuffer[1] << 8)) : 0;
-        KLOGE("Dropped malformed logger record: %zd bytes, payload length %u", n, payload);
+    if (entry.decode(mBuffer, static_cast<size_t>(n)) < 0 || entry.getTag() == nullptr ||
+        entry.getText() == nullptr) {
+        noteMalformedRecord(static_cast<size_t>(n));
         return 0;
     }
-    int32_t ret = dispatchMessage(&entry);
-    if (ret < 0) {
-        KLOGE("Dropped logger record without tag or text: %zd bytes", n);
-    }
+    dispatchMessage(&entry);
     return 0;
+}
+
+void Dispatcher::noteMalformedRecord(size_t size) {
+    HealthCounters::add(Health::LogRecordMalformed);
+    ++mMalformedSinceSummary;
+    nsecs_t now = systemTime(SYSTEM_TIME_MONOTONIC);
+    if (mLastMalformedSummaryNs != 0 && now - mLastMalformedSummaryNs < kMalformedSummaryPeriodNs) {
+        return;
+    }
+    unsigned payload = size >= 2 ? static_cast<unsigned>(mBuffer[0] | (mBuffer[1] << 8)) : 0;
+    KLOGE("Dropped %u malformed logger records, last: %zu bytes, payload length %u",
+          mMalformedSinceSummary, size, payload);
+    mMalformedSinceSummary = 0;
+    mLastMalformedSummaryNs = now;
 }
 
 int32_t Dispatcher::dispatchMessage(const LoggerRecord* entry) {
@@ -167,6 +190,7 @@ int32_t Dispatcher::dispatchMessage(const LoggerRecord* entry) {
         return -5;
     }
     if (entry->getTextLength() >= kMaxTextLength) {
+        HealthCounters::add(Health::LogRecordMalformed);
         KLOGI("Ignored long message");
         return 0;
     }
@@ -175,6 +199,7 @@ int32_t Dispatcher::dispatchMessage(const LoggerRecord* entry) {
         std::lock_guard<std::mutex> guard(mLock);
         auto it = mTags.find(std::string_view(entry->getTag(), entry->getTagLength()));
         if (it == mTags.end()) {
+            HealthCounters::add(Health::LogRecordUnknownTag);
             return 0;
         }
         handler = it->second;
@@ -188,8 +213,11 @@ int32_t Dispatcher::dispatchMessage(const LoggerRecord* entry) {
     data.setDataCapacity(sizeof(int64_t) + ((entry->getTextLength() + 1 + 3) & ~size_t(3)));
     data.writeInt64(time);
     data.writeCString(entry->getText());
-    if (handler.target->sendLoggerMessage(handler.id, data) >= 0) {
-        mLogCount.fetch_add(1);
+    // Every record handed over counts as forwarded; one the operator could
+    // not take is counted as refused as well.
+    mLogCount.fetch_add(1);
+    if (handler.target->sendLoggerMessage(handler.id, data) < 0) {
+        HealthCounters::add(Health::LoggerMessageRefused);
     }
     return 0;
 }

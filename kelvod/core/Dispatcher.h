@@ -54,13 +54,14 @@ public:
     // ended for good), -1 when it could not start.
     int32_t startDispatchMessage();
 
-    // Records forwarded since the last call.
+    // Records handed to an operator's sendLoggerMessage since the last call,
+    // whether or not the operator could take them.
     uint32_t getLogCount();
 
     // Forwards one decoded record. -5 without a record, tag or text (an
     // error line); 0 otherwise, also when the text is too long (dropped with
     // an information line) or no operator registered the tag (dropped
-    // silently).
+    // silently). Each drop is counted in the self-health counters.
     int32_t dispatchMessage(const LoggerRecord* entry);
 
     // Stops the thread and forgets the instance with its device and tags,
@@ -84,6 +85,9 @@ private:
     // refused instead of waiting for a reader that will not come back.
     void closeDevice();
     void stop();
+    // Counts a record that could not be decoded; the error line sums them
+    // up at most once a minute.
+    void noteMalformedRecord(size_t size);
 
     // Written under mLock once the thread has started; read without it only
     // by the thread itself.
@@ -93,6 +97,9 @@ private:
     bool mDatagram;
     std::atomic<bool> mStopping;
     std::atomic<uint32_t> mLogCount;
+    // Only the dispatcher thread touches these.
+    uint32_t mMalformedSinceSummary;
+    int64_t mLastMalformedSummaryNs;
     std::mutex mLock;  // guards the tag map, the thread and closing the device
     std::map<std::string, tag_handler, std::less<>> mTags;
     android::sp<DispatcherThread> mThread;

@@ -3,6 +3,7 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "HealthCounters.h"
 #include "utils/TimeProvider.h"
 
 namespace kelvo {
@@ -11,13 +12,27 @@ std::atomic<int32_t> ErrorLogger::sCounter{0};
 std::atomic<ErrorLogger::Sink> ErrorLogger::sSink{nullptr};
 
 namespace {
-// Set while this thread forwards an error: an error raised on the way is
-// written to the system log only, never forwarded again.
-thread_local bool tForwarding = false;
+// Set while this thread stores an error row: an error raised on the way is
+// written to the system log only, never forwarded again. Handler threads
+// carry it over to the messages they queue meanwhile, so the threads that
+// store the row on its behalf hold it too.
+thread_local bool tErrorRow = false;
 } // namespace
 
+ErrorLogger::ErrorRowScope::ErrorRowScope(bool mark) : mSaved(tErrorRow) {
+    tErrorRow = mark;
+}
+
+ErrorLogger::ErrorRowScope::~ErrorRowScope() {
+    tErrorRow = mSaved;
+}
+
+bool ErrorLogger::isStoringErrorRow() {
+    return tErrorRow;
+}
+
 void ErrorLogger::toDatabase(const char* text) {
-    if (tForwarding || text == nullptr) {
+    if (tErrorRow || text == nullptr) {
         return;
     }
     Sink sink = sSink.load(std::memory_order_acquire);
@@ -28,17 +43,17 @@ void ErrorLogger::toDatabase(const char* text) {
     int32_t n = sCounter.load(std::memory_order_relaxed);
     do {
         if (n >= kMaxErrorsPerDay) {
+            HealthCounters::add(Health::ErrorLinesSuppressed);
             return;
         }
     } while (!sCounter.compare_exchange_weak(n, n + 1, std::memory_order_relaxed));
 
-    tForwarding = true;
+    ErrorRowScope mark(true);
     android::Parcel data;
     data.writeInt64(TimeProvider::getCurrentTime(TIME_TYPE_WALL));
     data.writeString8(android::String8(text));
     data.setDataPosition(0);
     sink(data);
-    tForwarding = false;
 }
 
 void ErrorLogger::setCounter(int32_t n) {

@@ -3,6 +3,7 @@
 #include <atomic>
 #include <cstdlib>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "binder/managers/BatteryManager.h"
@@ -38,8 +39,14 @@ std::atomic<KelvoAgent::ExitHook> gExitHook{&exit};
 
 std::mutex gInstanceLock;
 android::sp<KelvoAgent>* gInstance = nullptr;
+// Set on the thread that builds the agent, which holds gInstanceLock: an
+// error raised meanwhile would ask for the agent being built.
+thread_local bool tBuildingAgent = false;
 
 void forwardError(const android::Parcel& data) {
+    if (tBuildingAgent) {
+        return;
+    }
     android::sp<KelvoAgent> agent;
     {
         std::lock_guard<std::mutex> guard(gInstanceLock);
@@ -58,8 +65,11 @@ android::sp<KelvoAgent> KelvoAgent::getInstance() {
     std::lock_guard<std::mutex> guard(gInstanceLock);
     if (gInstance == nullptr) {
         // Errors raised while the agent is built reach the system log only:
-        // the sink is installed once the agent exists.
+        // the sink is installed once the agent exists, and a sink already in
+        // place skips them.
+        tBuildingAgent = true;
         gInstance = new android::sp<KelvoAgent>(new KelvoAgent());
+        tBuildingAgent = false;
         ErrorLogger::setSink(forwardError);
     }
     return *gInstance;
@@ -271,8 +281,8 @@ void KelvoAgent::forceFlushDatabase() {
 
 void KelvoAgent::logError(const android::Parcel& data) {
     android::sp<KelvoOperator> system = getHandler(HANDLER_SYSTEM);
-    if (system != nullptr) {
-        system->sendCustomizedMessage(3, data, nullptr, false);
+    if (system == nullptr || system->sendCustomizedMessage(3, data, nullptr, false) < 0) {
+        HealthCounters::add(Health::ErrorRowsDropped);
     }
 }
 

@@ -18,11 +18,13 @@ int32_t readLogSwitch(const char* property, int32_t defaultValue) {
 std::atomic<int32_t> gLogDebugEnable{readLogSwitch("persist.kelvod.log.debug", 1)};
 std::atomic<int32_t> gLogInfoEnable{readLogSwitch("persist.kelvod.log.info", 1)};
 std::atomic<uint32_t> gLogModuleMask{0};
+std::atomic<int32_t> gLogUserType{property_get_int32("ro.logsystem.usertype", -1)};
 
 void loadLogSwitches() {
     gLogDebugEnable.store(readLogSwitch("persist.kelvod.log.debug", 1));
     gLogInfoEnable.store(readLogSwitch("persist.kelvod.log.info", 1));
     gLogModuleMask.store(0);
+    gLogUserType.store(property_get_int32("ro.logsystem.usertype", -1));
 }
 
 void logErrorLine(const char* format, ...) {

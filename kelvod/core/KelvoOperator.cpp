@@ -26,17 +26,24 @@ constexpr int32_t kHourlyElector = 4;
 } // namespace
 
 int32_t MyLibraryListener::handleLibraryEvent(int32_t event, const android::Parcel& reply) {
-    if (mOperator == nullptr) {
+    android::sp<KelvoOperator> op = mOperator.promote();
+    if (op == nullptr) {
         KLOGE("Invalid handler");
         return -6;
     }
-    return mOperator->handleLibraryEvent(event, reply);
+    return op->handleLibraryEvent(event, reply);
 }
 
 KelvoOperator::KelvoOperator(const char* name, int32_t accounterType, uint32_t elector)
     : HandlerThread(name, 11), mAccounterType(accounterType), mElector(elector) {}
 
-KelvoOperator::~KelvoOperator() {}
+KelvoOperator::~KelvoOperator() {
+    // The notifier holds the record by address: it goes from every type
+    // before the record is freed.
+    if (mNotifierListener != nullptr) {
+        Notifier::getInstance()->unregisterAll(mNotifierListener.get());
+    }
+}
 
 int32_t KelvoOperator::earlyInitialize() {
     setConfiguration();
@@ -156,6 +163,9 @@ void KelvoOperator::unregisterListeners() {
                 break;
         }
     });
+    if (mNotifierListener != nullptr) {
+        Notifier::getInstance()->unregisterAll(mNotifierListener.get());
+    }
     mNotifierListener.reset();
     mLibraryListener.clear();
     mLogReceiver.clear();
@@ -273,6 +283,7 @@ int32_t KelvoOperator::handleParcelMessage(const ParcelMessage& msg) {
             const char* text = nullptr;
             if (body.readInt64(&time) != android::NO_ERROR ||
                 (text = body.readCString()) == nullptr) {
+                HealthCounters::add(Health::LoggerMessageRefused);
                 KLOGE("Invalid logger message for tag: %d", msg.what);
                 return -5;
             }
@@ -287,6 +298,11 @@ int32_t KelvoOperator::handleParcelMessage(const ParcelMessage& msg) {
         case MESSAGE_CUSTOMIZED:
             return handleCustomized(msg.what, body, msg.getReply());
         case kLateInitializeMessage:
+            if (mLateInitialized) {
+                KLOGE("Late initialization already done: %s", getName());
+                return -13;
+            }
+            mLateInitialized = true;
             return lateInitialize();
         default:
             KLOGE("Unknown message type: %d", msg.type);

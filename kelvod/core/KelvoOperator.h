@@ -18,14 +18,16 @@ namespace kelvo {
 
 class KelvoOperator;
 
-// Hands an accounter's results back to the operator that owns its type.
+// Hands an accounter's results back to the operator that owns its type. The
+// library keeps the listener, the listener only a weak reference to the
+// operator: a registration never keeps an operator alive.
 class MyLibraryListener : public LibraryListener {
 public:
-    explicit MyLibraryListener(const android::sp<KelvoOperator>& op) : mOperator(op) {}
+    explicit MyLibraryListener(const android::wp<KelvoOperator>& op) : mOperator(op) {}
     int32_t handleLibraryEvent(int32_t event, const android::Parcel& reply) override;
 
 private:
-    android::sp<KelvoOperator> mOperator;
+    android::wp<KelvoOperator> mOperator;
 };
 
 // Base of every handler and routine: one worker thread and its own tables.
@@ -143,6 +145,8 @@ private:
                     visit);
 
     std::unique_ptr<NotifierListener> mNotifierListener;
+    // Set on the operator's thread once lateInitialize ran: it runs once.
+    bool mLateInitialized = false;
     android::sp<MyLibraryListener> mLibraryListener;
     android::sp<LogReceiver> mLogReceiver;
 };

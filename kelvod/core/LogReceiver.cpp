@@ -2,6 +2,7 @@
 
 #include <cstring>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "utils/TimeProvider.h"
 
@@ -16,7 +17,9 @@ int32_t LogReceiver::onLogReceived(const android::String8& name, const uint8_t* 
         memcpy(&magic, entry + 4, sizeof(magic));
     }
     // The data must be all there: never read past what arrived.
-    if (length < 0 || static_cast<size_t>(length) > size - 8 || mHandler == nullptr) {
+    android::sp<HandlerThread> handler = mHandler.promote();
+    if (length < 0 || static_cast<size_t>(length) > size - 8 || handler == nullptr) {
+        HealthCounters::add(Health::BufferedEntryRefused);
         KLOGE("Invalid parameter");
         return -5;
     }
@@ -26,7 +29,7 @@ int32_t LogReceiver::onLogReceived(const android::String8& name, const uint8_t* 
     body.writeInt32(magic);
     body.writeInt32(length);
     body.write(entry + 8, static_cast<size_t>(length));
-    int32_t id = mHandler->sendMessage(ParcelMessage(MESSAGE_BUFFERED_LOG, body));
+    int32_t id = handler->sendMessage(ParcelMessage(MESSAGE_BUFFERED_LOG, body));
     return id < 0 ? id : 0;
 }
 

@@ -10,10 +10,11 @@
 namespace kelvo {
 
 // One operator's registration with the buffered log server: the thread that
-// receives the entries of the senders it registered for.
+// receives the entries of the senders it registered for. It holds the thread
+// weakly, so the server's registration never keeps an operator alive.
 class LogReceiver : public virtual android::RefBase {
 public:
-    explicit LogReceiver(const android::sp<HandlerThread>& handler) : mHandler(handler) {}
+    explicit LogReceiver(const android::wp<HandlerThread>& handler) : mHandler(handler) {}
 
     // Posts one entry (int32 length, int32 magic, data) to the operator as a
     // MESSAGE_BUFFERED_LOG: int64 arrival time ms, String8 client name, int32
@@ -21,7 +22,7 @@ public:
     int32_t onLogReceived(const android::String8& name, const uint8_t* entry, size_t size);
 
 private:
-    android::sp<HandlerThread> mHandler;
+    android::wp<HandlerThread> mHandler;
 };
 
 } // namespace kelvo

@@ -49,6 +49,16 @@ void Notifier::unregisterListener(int32_t type, NotifierListener* listener) {
     }
 }
 
+void Notifier::unregisterAll(NotifierListener* listener) {
+    if (listener == nullptr) {
+        return;
+    }
+    std::lock_guard<std::mutex> guard(mLock);
+    for (std::vector<NotifierListener*>& list : mListeners) {
+        list.erase(std::remove(list.begin(), list.end(), listener), list.end());
+    }
+}
+
 int32_t Notifier::sendNotification(int32_t type, const android::Parcel& body) {
     return mHandler->sendMessage(ParcelMessage(MESSAGE_NOTIFICATION, type, body));
 }
@@ -59,11 +69,21 @@ int32_t Notifier::notifyAllListeners(int32_t type, const android::Parcel& body) 
         return -3;
     }
     ParcelMessage msg(MESSAGE_NOTIFICATION, type, body);
-    std::lock_guard<std::mutex> guard(mLock);
-    for (NotifierListener* listener : mListeners[type]) {
-        if (listener->handler != nullptr) {
-            listener->handler->sendMessage(msg);
+    std::vector<android::sp<HandlerThread>> targets;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        targets.reserve(mListeners[type].size());
+        for (NotifierListener* listener : mListeners[type]) {
+            android::sp<HandlerThread> handler = listener->handler.promote();
+            if (handler != nullptr) {
+                targets.push_back(handler);
+            }
         }
+    }
+    // Sent outside the lock: an operator whose last reference goes here is
+    // destroyed without the notifier's lock held.
+    for (const android::sp<HandlerThread>& handler : targets) {
+        handler->sendMessage(msg);
     }
     return 0;
 }

@@ -52,6 +52,8 @@ public:
     // 0, -5 for a bad type or listener, -13 when already registered.
     int32_t registerListener(int32_t type, NotifierListener* listener);
     void unregisterListener(int32_t type, NotifierListener* listener);
+    // Removes the listener from every type: called before it is freed.
+    void unregisterAll(NotifierListener* listener);
     // Returns the message id of the hand-over, or a negative code.
     int32_t sendNotification(int32_t type, const android::Parcel& body);
 

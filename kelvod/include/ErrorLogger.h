@@ -21,10 +21,30 @@ public:
     // Where stored errors go; the agent installs itself once it is built.
     typedef void (*Sink)(const android::Parcel& data);
 
+    // Hands the line to the sink unless the daily cap is reached (counted
+    // in Health::ErrorLinesSuppressed) or this thread is storing an error
+    // row: then the line reaches the system log only.
     static void toDatabase(const char* text);
     static void setCounter(int32_t n);
     static int32_t getCounter();
     static void setSink(Sink sink);
+
+    // True while this thread stores an error row: it forwards an error, or
+    // handles a message queued on the way (the mark travels with every
+    // message a thread queues while it is set).
+    static bool isStoringErrorRow();
+
+    // Sets the mark of this thread for its lifetime (restores the old one).
+    class ErrorRowScope {
+    public:
+        explicit ErrorRowScope(bool mark);
+        ~ErrorRowScope();
+        ErrorRowScope(const ErrorRowScope&) = delete;
+        ErrorRowScope& operator=(const ErrorRowScope&) = delete;
+
+    private:
+        bool mSaved;
+    };
 
 private:
     static std::atomic<int32_t> sCounter;

@@ -51,10 +51,14 @@ enum LogModule : uint32_t {
 extern std::atomic<int32_t> gLogDebugEnable;
 extern std::atomic<int32_t> gLogInfoEnable;
 extern std::atomic<uint32_t> gLogModuleMask;
+// The device's log user type ("ro.logsystem.usertype", -1 when unset), read
+// with the switches before main.
+extern std::atomic<int32_t> gLogUserType;
 
 // A switch is on only when its property holds exactly 1.
 int32_t readLogSwitch(const char* property, int32_t defaultValue);
-// Reads both switches from their properties again and clears the module mask.
+// Reads both switches and the user type from their properties again and
+// clears the module mask.
 void loadLogSwitches();
 
 // The base name of a source path: the text after its last '/'. The search is

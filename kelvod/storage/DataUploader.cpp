@@ -3,6 +3,7 @@
 #include <cstring>
 #include <string>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "storage/StorageManager.h"
 #include "utils/TimeProvider.h"
@@ -181,13 +182,15 @@ int32_t DataUploader::setEventParam(uint32_t event, zendrel_eventobj* object,
                 zendrel_eventobj* child = zendrel_create_eventobj(classId);
                 if (child == nullptr) {
                     KLOGE("Failed to create event object");
-                    result |= -20;
+                    HealthCounters::add(Health::UploadRecordsRefused);
+                    result = -20;
                     continue;
                 }
                 if (setEventParam(classId, child, nested) != 0) {
                     KLOGE("Failed to set event parameters");
+                    HealthCounters::add(Health::UploadRecordsRefused);
                     zendrel_destroy_eventobj(child);
-                    result |= -21;
+                    result = -21;
                     continue;
                 }
                 ret = kind == UPLOAD_CLASS ? zendrel_set_param(object, param, child)
@@ -202,7 +205,8 @@ int32_t DataUploader::setEventParam(uint32_t event, zendrel_eventobj* object,
         }
         if (ret != 0) {
             KLOGE("Failed to set parameter(%hu) for eventid(%u)", param, event);
-            result |= -21;
+            HealthCounters::add(Health::UploadRecordsRefused);
+            result = -21;
         }
     }
     return result;
@@ -223,14 +227,25 @@ int32_t DataUploader::setEvent(uint32_t event, const android::Parcel& data, bool
         zendrel_eventobj* object = zendrel_create_eventobj(event);
         if (object == nullptr) {
             KLOGE("Failed to create event object");
+            HealthCounters::add(Health::UploadFailures);
             return -20;
         }
         it = mEvents.emplace(event, object).first;
     }
-    if (setEventParam(event, it->second, data) < 0) {
+    int32_t ret = setEventParam(event, it->second, data);
+    if (ret == -3) {
+        // The parcel itself is broken: what it already set cannot be told
+        // from what it did not, so the event goes.
         KLOGE("Failed to set event parameters");
+        HealthCounters::add(Health::UploadFailures);
         zendrel_destroy_eventobj(it->second);
         mEvents.erase(it);
+        return -21;
+    }
+    if (ret < 0) {
+        // Single records were refused and skipped; the event keeps the
+        // rest, and what the other senders gathered in it.
+        KLOGE("Failed to set some parameters of eventid(%u)", event);
         return -21;
     }
     return 0;
@@ -252,19 +267,24 @@ int32_t DataUploader::sendEvent(uint32_t event, zendrel_eventobj* object) {
     row.writeInt32(sent ? 0 : -1);
     insertEntries(kResultTable, row, 1, false);
     zendrel_destroy_eventobj(object);
+    if (!sent) {
+        HealthCounters::add(Health::UploadFailures);
+    }
     return sent ? 0 : -22;
 }
 
 int32_t DataUploader::setAndUploadEvent(uint32_t event, const android::Parcel& data,
                                         bool create) {
-    if (setEvent(event, data, create) < 0) {
+    // Refused single records still let the rest of the event go out now;
+    // the caller hears of them all the same.
+    int32_t set = setEvent(event, data, create);
+    if (set < 0) {
         KLOGE("Failed to set event(%u) data", event);
-        return -21;
     }
     std::lock_guard<std::mutex> guard(mLock);
     auto it = mEvents.find(event);
     if (it == mEvents.end()) {
-        return 0;
+        return set < 0 ? -21 : 0;
     }
     zendrel_eventobj* object = it->second;
     mEvents.erase(it);
@@ -273,7 +293,7 @@ int32_t DataUploader::setAndUploadEvent(uint32_t event, const android::Parcel& d
         return -22;
     }
     KLOGD("Upload eventid(%u) success", event);
-    return 0;
+    return set < 0 ? -21 : 0;
 }
 
 int32_t DataUploader::uploadEvent() {

@@ -4,6 +4,8 @@
 #include <chrono>
 #include <climits>
 #include <cstring>
+#include <tuple>
+#include <utility>
 #include <vector>
 
 #include <utils/Timers.h>
@@ -67,7 +69,8 @@ int32_t HandlerThread::queueMessage(const ParcelMessage& msg) {
         id = (mLastId < 0 || mLastId == INT32_MAX) ? 0 : mLastId + 1;
         mLastId = id;
     } while (mPending.count(id) != 0);
-    mPending.emplace(id, msg);
+    mPending.emplace(std::piecewise_construct, std::forward_as_tuple(id),
+                     std::forward_as_tuple(msg, ErrorLogger::isStoringErrorRow()));
     HealthCounters::noteQueueDepth(mQueueSlot, mPending.size());
     return id;
 }
@@ -108,6 +111,7 @@ int32_t HandlerThread::sendMessageDelayed(nsecs_t delay, const ParcelMessage& ms
 
 int32_t HandlerThread::sendMessageAtTime(nsecs_t when, const ParcelMessage& msg) {
     if (!isAccepting()) {
+        HealthCounters::add(Health::MessagesRefused);
         KLOGE("%s is not running or is pending to exit", mName.string());
         return -2;
     }
@@ -118,6 +122,7 @@ int32_t HandlerThread::sendMessageAtTime(nsecs_t when, const ParcelMessage& msg)
 
 int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
     if (!isAccepting()) {
+        HealthCounters::add(Health::MessagesRefused);
         KLOGE("%s is not running or is pending to exit", mName.string());
         return -2;
     }
@@ -126,9 +131,14 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
 
     std::unique_lock<std::mutex> lock(mSyncLock);
     if (mWaiting.count(id) != 0) {
+        {
+            std::lock_guard<std::mutex> guard(mMessageLock);
+            mPending.erase(id);
+        }
+        lock.unlock();
+        // Logged with no lock held: the line may be queued on this very
+        // thread when it is the one that stores error rows.
         KLOGE("Already existed message id[%d] in %s", id, mName.string());
-        std::lock_guard<std::mutex> guard(mMessageLock);
-        mPending.erase(id);
         return -13;
     }
     sync_result waiter;
@@ -145,33 +155,44 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
     }
     // A spurious wake-up goes back to waiting until done or the deadline.
     bool done = waiter.cond.wait_until(lock, deadline, [&waiter] { return waiter.done; });
-    if (!done) {
-        KLOGE("Failed to send synchronized message to %s: %d, result: %d", mName.string(),
-              ETIMEDOUT, waiter.result);
-    }
     int32_t result = waiter.result;
     mWaiting.erase(id);
+    lock.unlock();
+    if (!done) {
+        KLOGE("Failed to send synchronized message to %s: %d, result: %d", mName.string(),
+              ETIMEDOUT, result);
+    }
     return result;
 }
 
 int32_t HandlerThread::removeMessage(int32_t id) {
+    bool found = false;
     {
         std::lock_guard<std::mutex> guard(mMessageLock);
         auto it = mPending.find(id);
-        if (it == mPending.end()) {
-            KLOGE("Invalid message id[%d] in %s", id, mName.string());
-            return -4;
+        if (it != mPending.end()) {
+            if (it->second.queued) {
+                mQueue.erase(it->second.position);
+            }
+            mPending.erase(it);
+            found = true;
         }
-        if (it->second.queued) {
-            mQueue.erase(it->second.position);
-        }
-        mPending.erase(it);
+    }
+    if (!found) {
+        // Logged after unlocking: the line goes to the system handler's
+        // queue, which may be this one.
+        KLOGE("Invalid message id[%d] in %s", id, mName.string());
+        return -4;
     }
     releaseWaiters(&id, 1);
     return 0;
 }
 
 void HandlerThread::removeAllMessages() {
+    dropAllMessages();
+}
+
+size_t HandlerThread::dropAllMessages() {
     // The looper's wake-ups hold a reference to this handler.
     if (mLooper != nullptr) {
         mLooper->removeMessages(this);
@@ -188,6 +209,7 @@ void HandlerThread::removeAllMessages() {
         mWakeAt = LLONG_MAX;
     }
     releaseWaiters(ids.data(), ids.size());
+    return ids.size();
 }
 
 void HandlerThread::releaseWaiters(const int32_t* ids, size_t count) {
@@ -255,6 +277,7 @@ void HandlerThread::handleMessage(const android::Message& message) {
 void HandlerThread::deliver(int32_t id, pending_message& entry) {
     if (exitPending()) {
         // The thread is going away: what is still queued is dropped.
+        HealthCounters::add(Health::MessagesDropped);
         releaseWaiters(&id, 1);
         return;
     }
@@ -263,7 +286,11 @@ void HandlerThread::deliver(int32_t id, pending_message& entry) {
     android::Parcel reply;
     msg.reply = &reply;
 
-    int32_t status = handleParcelMessage(msg);
+    int32_t status;
+    {
+        ErrorLogger::ErrorRowScope mark(entry.errorRow);
+        status = handleParcelMessage(msg);
+    }
 
     std::lock_guard<std::mutex> guard(mSyncLock);
     auto it = mWaiting.find(id);
@@ -286,7 +313,10 @@ bool HandlerThread::threadLoop() {
     if (exitPending()) {
         // Whatever woke the loop, an exit request drops the queue; the
         // thread then ends.
-        removeAllMessages();
+        size_t dropped = dropAllMessages();
+        if (dropped > 0) {
+            HealthCounters::add(Health::MessagesDropped, dropped);
+        }
         KLOGE("%s is pending to exit", mName.string());
         return true;
     }

@@ -34,7 +34,7 @@ public:
     ~HandlerThread() override;
 
     // Each returns the message id (0 or more) or -2 when the thread is not
-    // running or is pending to exit.
+    // running or is pending to exit (counted in Health::MessagesRefused).
     int32_t sendMessage(const ParcelMessage& msg);
     int32_t sendMessageDelayed(nsecs_t delay, const ParcelMessage& msg);
     int32_t sendMessageAtTime(nsecs_t when, const ParcelMessage& msg);
@@ -74,8 +74,10 @@ private:
     int mQueueSlot = -1;
 
     struct pending_message {
-        explicit pending_message(const ParcelMessage& m) : msg(m) {}
+        pending_message(const ParcelMessage& m, bool row) : msg(m), errorRow(row) {}
         ParcelMessage msg;
+        // Queued while the sender stored an error row: handled the same way.
+        bool errorRow;
         bool queued = false;
         Queue::iterator position;
     };
@@ -88,6 +90,9 @@ private:
     bool needWakeLocked(nsecs_t when);
     void deliver(int32_t id, pending_message& entry);
     void releaseWaiters(const int32_t* ids, size_t count);
+    // Empties the queue and releases the waiters; returns how many
+    // messages were dropped.
+    size_t dropAllMessages();
 
     android::String8 mName;
     int32_t mPriority;

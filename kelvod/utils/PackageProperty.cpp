@@ -24,28 +24,44 @@ PackageProperty* PackageProperty::getInstance() {
 int32_t PackageProperty::getPackageStrategy(const android::String8& name) {
     {
         std::lock_guard<std::mutex> guard(mLock);
-        if (!mStrategies.empty()) {
+        if (mStrategiesLoaded) {
             auto it = mStrategies.find(name.string());
             return it != mStrategies.end() ? it->second : 0;
         }
+        if (mStrategiesFailed) {
+            return -17;
+        }
     }
-    // Loaded outside the lock: the query waits for the storage thread.
+    // Loaded once, outside the lock: the query waits for the storage thread.
+    // An empty table is a loaded one; a failed load is logged once and not
+    // tried again until the strategies are cleared.
     android::Parcel reply;
     int32_t rows = 0;
     if (queryEntriesSimple(android::String8("SELECT name, type FROM raw_pelmora_strategy"), &reply,
                            2, rows) < 0) {
-        KLOGE("Failed to query package strategy");
+        bool first;
+        {
+            std::lock_guard<std::mutex> guard(mLock);
+            first = !mStrategiesFailed;
+            mStrategiesFailed = true;
+        }
+        if (first) {
+            KLOGE("Failed to query package strategy");
+        }
         return -17;
     }
     std::lock_guard<std::mutex> guard(mLock);
-    for (int32_t i = 0; i < rows; ++i) {
-        android::String8 package;
-        int64_t type = 0;
-        if (reply.readString8(&package) != android::NO_ERROR ||
-            reply.readInt64(&type) != android::NO_ERROR) {
-            break;
+    if (!mStrategiesLoaded) {
+        for (int32_t i = 0; i < rows; ++i) {
+            android::String8 package;
+            int64_t type = 0;
+            if (reply.readString8(&package) != android::NO_ERROR ||
+                reply.readInt64(&type) != android::NO_ERROR) {
+                break;
+            }
+            mStrategies.emplace(package.string(), static_cast<int32_t>(type));
         }
-        mStrategies.emplace(package.string(), static_cast<int32_t>(type));
+        mStrategiesLoaded = true;
     }
     auto it = mStrategies.find(name.string());
     return it != mStrategies.end() ? it->second : 0;
@@ -54,6 +70,8 @@ int32_t PackageProperty::getPackageStrategy(const android::String8& name) {
 void PackageProperty::clearPackageStrategy() {
     std::lock_guard<std::mutex> guard(mLock);
     mStrategies.clear();
+    mStrategiesLoaded = false;
+    mStrategiesFailed = false;
 }
 
 void PackageProperty::addPackageType(const android::Parcel& records) {

@@ -44,7 +44,7 @@ public:
     int32_t removeUid(int32_t uid);
 
     // The package's strategy type, or 0; -17 when the strategies cannot be
-    // loaded.
+    // loaded. They are loaded once (a failure logged once) until cleared.
     int32_t getPackageStrategy(const android::String8& name);
     void clearPackageStrategy();
     // Records of (int64 unused, String8 name, int64 type) until the parcel
@@ -62,6 +62,8 @@ private:
     std::map<int32_t, std::vector<android::String8>> mPackagesOfUid;
     std::map<std::string, int32_t> mUidOfPackage;
     std::map<std::string, int32_t> mStrategies;
+    bool mStrategiesLoaded = false;
+    bool mStrategiesFailed = false;
     std::map<std::string, int32_t> mTypes;
 };
 

@@ -3,6 +3,8 @@
 #include <binder/IServiceManager.h>
 #include <binder/Parcel.h>
 
+#include <pthread.h>
+
 #include <algorithm>
 #include <chrono>
 #include <thread>
@@ -88,6 +90,10 @@ void BatteryManager::registerInBackground() {
 }
 
 void BatteryManager::retryLoop() {
+    pthread_setname_np(pthread_self(), "BatteryRetry");
+    // Only the first failure of the thread is logged: a registrar that stays
+    // away does not fill the error log round after round.
+    bool quiet = false;
     for (;;) {
         {
             // A death reported while the last round ran needs a new one.
@@ -99,8 +105,6 @@ void BatteryManager::retryLoop() {
             mRetryNeeded = false;
         }
         int delayMs = kFirstRetryMs;
-        // The first failure of a round is logged, the retries are not.
-        bool quiet = false;
         while (registerListener(quiet) != 0) {
             quiet = true;
             std::this_thread::sleep_for(std::chrono::milliseconds(delayMs));

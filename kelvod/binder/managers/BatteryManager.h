@@ -14,8 +14,9 @@ public:
     // 0 once the listener is registered; -8 without the service, -12 when
     // the registrar refuses.
     int32_t initialize();
-    // Registers on a thread of its own: at once, then after 100 ms,
-    // doubling up to 5 s, until it succeeds; one such loop at a time.
+    // Registers on a thread of its own ("BatteryRetry"): at once, then after
+    // 100 ms, doubling up to 5 s, until it succeeds; one such loop at a
+    // time, which logs only its first failure.
     void registerInBackground();
     // The registrar died: registers again in the background.
     void onServiceDied() override;

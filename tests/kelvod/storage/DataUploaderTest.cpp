@@ -8,6 +8,7 @@
 #include "common/TestEnv.h"
 #include "core/KelvoAgent.h"
 #include "kelvo/HostProperties.h"
+#include "HealthCounters.h"
 #include "kelvo/ZendrelHost.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/DataUploader.h"
@@ -140,7 +141,7 @@ TEST_F(DataUploaderTest, NothingIsAddedToAnEventNobodyStarted) {
     EXPECT_TRUE(results().empty());
 }
 
-TEST_F(DataUploaderTest, BadRecordsDiscardTheEventAndNeverReadPastTheData) {
+TEST_F(DataUploaderTest, BrokenParcelsDiscardTheEventAndNeverReadPastTheData) {
     Parcel good;
     DataUploader::formIntData(0, 1, good);
     ASSERT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_COMPONENTS, good, true));
@@ -186,18 +187,32 @@ TEST_F(DataUploaderTest, LibraryFailuresAreRecordedAndNotReportedAsSuccess) {
     EXPECT_FALSE(log.contains("Upload eventid(903002050) success"));
 
     ZendrelHost::failCall(ZendrelHost::CALL_CREATE, 903009030);
+    Parcel earlier;
+    DataUploader::formIntData(0, 5, earlier);
+    ASSERT_EQ(0, mUploader->setEventData(kelvo::EVENT_HOURLY_COMPONENTS, earlier, true));
     Parcel child;
     DataUploader::formIntData(0, 9, child);
     Parcel withChild;
     DataUploader::formIntData(1, 1, withChild);
     DataUploader::formClassData(2, 903009030, child, withChild);
-    // A child that cannot be made fails the parameters: the event is dropped.
-    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, withChild, true));
+    DataUploader::formIntData(3, 3, withChild);
+    // A child that cannot be made costs only its own record: the event keeps
+    // what other senders gathered and the records after it.
+    uint64_t refused = kelvo::HealthCounters::get(kelvo::Health::UploadRecordsRefused);
+    EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_HOURLY_COMPONENTS, withChild, false));
+    EXPECT_EQ(refused + 1, kelvo::HealthCounters::get(kelvo::Health::UploadRecordsRefused));
 
     Parcel ok;
     DataUploader::formIntData(0, 2, ok);
     EXPECT_EQ(0, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_SCENE, ok, true));
-    EXPECT_EQ((std::vector<std::string>{"903002050:-1", "903001055:0"}), results());
+    EXPECT_EQ(0, mUploader->uploadEvent());
+    EXPECT_EQ((std::vector<std::string>{"903002050:-1", "903001055:0", "903001060:0"}),
+              results());
+    const Json::Value& kept = events().back()["params"];
+    EXPECT_EQ(5, kept["0"].asInt64());
+    EXPECT_EQ(1, kept["1"].asInt64());
+    EXPECT_FALSE(kept.isMember("2"));
+    EXPECT_EQ(3, kept["3"].asInt64());
 }
 
 TEST_F(DataUploaderTest, DailyDatabaseCopyIsAnnouncedWithItsDay) {
