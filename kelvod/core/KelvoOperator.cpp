@@ -38,10 +38,14 @@ KelvoOperator::KelvoOperator(const char* name, int32_t accounterType, uint32_t e
     : HandlerThread(name, 11), mAccounterType(accounterType), mElector(elector) {}
 
 KelvoOperator::~KelvoOperator() {
-    // The notifier holds the record by address: it goes from every type
-    // before the record is freed.
+    // Released without readyToDestroy: the notifier holds the record by
+    // address, so it goes from every type before the record is freed, and
+    // the buffered log server lets go of the receiver.
     if (mNotifierListener != nullptr) {
         Notifier::getInstance()->unregisterAll(mNotifierListener.get());
+    }
+    for (const auto& key : mBufferedLogKeys) {
+        BufferedLogServer::getInstance()->unregisterLogReceiver(key.first, key.second);
     }
 }
 
@@ -137,6 +141,8 @@ void KelvoOperator::registerListeners() {
                 if (BufferedLogServer::getInstance()->registerLogReceiver(mLogReceiver, name,
                                                                           type) < 0) {
                     KLOGE("Failed to register buffered log listener");
+                } else {
+                    mBufferedLogKeys.emplace_back(name, type);
                 }
                 break;
         }
@@ -167,6 +173,7 @@ void KelvoOperator::unregisterListeners() {
         Notifier::getInstance()->unregisterAll(mNotifierListener.get());
     }
     mNotifierListener.reset();
+    mBufferedLogKeys.clear();
     mLibraryListener.clear();
     mLogReceiver.clear();
 }

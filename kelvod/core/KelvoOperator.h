@@ -4,6 +4,8 @@
 
 #include <functional>
 #include <memory>
+#include <utility>
+#include <vector>
 
 #include <binder/Parcel.h>
 #include <utils/String8.h>
@@ -149,6 +151,8 @@ private:
     bool mLateInitialized = false;
     android::sp<MyLibraryListener> mLibraryListener;
     android::sp<LogReceiver> mLogReceiver;
+    // Sender names and entry types registered with the buffered log server.
+    std::vector<std::pair<android::String8, int32_t>> mBufferedLogKeys;
 };
 
 } // namespace kelvo

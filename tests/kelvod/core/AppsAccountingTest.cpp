@@ -14,6 +14,7 @@
 #include "kelvo/ZendrelHost.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/DataUploader.h"
+#include "utils/PackageProperty.h"
 
 using android::Parcel;
 using android::String8;
@@ -211,4 +212,36 @@ TEST_F(AppsAccountingTest, UploadsTheTopApplicationsInEnergyOrder) {
     EXPECT_EQ("it's.quoted", e["params"]["15"]["params"]["15"]["params"]["0"].asString());
     std::string power = mRoot->readFile(KELVO_POWER_LOG_FILE);
     EXPECT_NE(std::string::npos, power.find("\t215\t\tapps\tmodem_idle#com.app12#com.app11#"));
+}
+
+TEST_F(AppsAccountingTest, DayNamesReachThePowerLogEvenWithoutFields) {
+    // Energy but no durations: listed among the top names, no upload fields.
+    common(kTen, "com.silent", kelvo::APPS_CPU, 9, 0, 9, 0, 0, 0, 0, 0);
+    AppsAccounting::getInstance()->balanceAccount();
+    mStorage->flushAllEntries();
+    ASSERT_EQ(0, AppsAccounting::getInstance()->uploadDailyAppsAccounting(kTen + kHour, 1.0f));
+    EXPECT_NE(std::string::npos, mRoot->readFile(KELVO_POWER_LOG_FILE).find("\tapps\tcom.silent#"));
+}
+
+TEST_F(AppsAccountingTest, PackageStrategiesAreLoadedOnceAndAFailureLoggedOnce) {
+    kelvo::PackageProperty* property = kelvo::PackageProperty::getInstance();
+    property->clearPackageStrategy();
+    kelvo::test::LogCapture log;
+    // No strategy table yet: one failed load, logged once, not retried.
+    EXPECT_EQ(-17, property->getPackageStrategy(String8("com.a")));
+    EXPECT_EQ(-17, property->getPackageStrategy(String8("com.b")));
+    EXPECT_EQ(1u, log.count("Failed to query package strategy", ANDROID_LOG_ERROR));
+    EXPECT_EQ(1u, log.count("raw_pelmora_strategy", ANDROID_LOG_ERROR));
+
+    DirectDb db(mRoot->path() + KelvoStorage::kDatabasePath);
+    ASSERT_EQ(SQLITE_OK, db.exec("CREATE TABLE raw_pelmora_strategy (name TEXT, type INTEGER); "
+                                 "INSERT INTO raw_pelmora_strategy VALUES ('com.a', 3)"));
+    property->clearPackageStrategy();
+    EXPECT_EQ(3, property->getPackageStrategy(String8("com.a")));
+    // Loaded: the table is not asked again.
+    ASSERT_EQ(SQLITE_OK, db.exec("DROP TABLE raw_pelmora_strategy"));
+    EXPECT_EQ(0, property->getPackageStrategy(String8("com.b")));
+    EXPECT_EQ(3, property->getPackageStrategy(String8("com.a")));
+    EXPECT_EQ(1u, log.count("Failed to query package strategy", ANDROID_LOG_ERROR));
+    property->clearPackageStrategy();
 }

@@ -10,6 +10,7 @@
 #include <string>
 #include <vector>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "accounters/DataAccounter.h"
@@ -183,21 +184,24 @@ TEST_F(KelvoOperatorTest, MessagesReachTheirOperations) {
     // Late initialization ran on the operator's own thread.
     EXPECT_NE(0, op->mLateTid);
     EXPECT_NE(gettid(), op->mLateTid);
+    // The internal late-initialize message runs once, however often posted.
+    LogCapture log;
+    op->mLateTid = 0;
+    EXPECT_EQ(-13, op->sendMessageSync(ParcelMessage(100, 0)));
+    EXPECT_EQ(0, op->mLateTid);
+    EXPECT_TRUE(log.contains("Late initialization already done: TestOperator", ANDROID_LOG_ERROR));
 
     Parcel logger;
     logger.writeInt64(1234);
     logger.writeCString("brightness=12");
     EXPECT_EQ(1, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_LOGGER, 7, logger)));
     EXPECT_EQ("logger:1234:7:brightness=12", calls().back());
-    // A record without its text is refused.
-    LogCapture log;
+    // A record without its text is refused, and counted.
+    uint64_t refused = kelvo::HealthCounters::get(kelvo::Health::LoggerMessageRefused);
     EXPECT_EQ(-5, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_LOGGER, 7, TimeBody(1))));
     EXPECT_TRUE(log.contains("Invalid logger message", ANDROID_LOG_ERROR));
+    EXPECT_EQ(refused + 1, kelvo::HealthCounters::get(kelvo::Health::LoggerMessageRefused));
 
-    EXPECT_EQ(0, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_TIMER, 3)));
-    EXPECT_TRUE(log.contains("Receive timer expired message, please implement this function in "
-                             "subclass",
-                             ANDROID_LOG_INFO));
     EXPECT_EQ(-3, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_STORAGE_ENTRY, 0)));
     EXPECT_TRUE(log.contains("Unknown message type: 3", ANDROID_LOG_ERROR));
     EXPECT_EQ(8, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION,
@@ -206,35 +210,22 @@ TEST_F(KelvoOperatorTest, MessagesReachTheirOperations) {
     EXPECT_EQ("hourlyTick:3600000", calls().back());
     EXPECT_EQ(-1, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 23)));
     EXPECT_TRUE(log.contains("Unknown message type: 23", ANDROID_LOG_ERROR));
-    // Every notification type has an operation; the default ones answer 0.
-    for (int32_t type = 0; type < kelvo::NOTIFICATION_TYPE_COUNT; ++type) {
-        if (type == kelvo::NOTIFICATION_HOURLY_TICK) continue;
-        EXPECT_EQ(0, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, type,
-                                                       TimeBody(10))))
-                << type;
-    }
 }
 
 TEST_F(KelvoOperatorTest, StateChangesFeedTheOperatorsAccounter) {
     sp<TestOperator> op = make(kType, {2, kType});
     op->initialize();
-    Parcel fg;
-    fg.writeInt64(100);
+    TimeBody fg(100);
     fg.writeString8(String8("com.example.maps"));
     op->sendMessage(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 0, fg));
-    Parcel screen;
-    screen.writeInt64(200);
+    TimeBody screen(200);
     screen.writeBool(false);
     op->sendMessage(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 1, screen));
-    Parcel charger;
-    charger.writeInt64(300);
+    TimeBody charger(300);
     charger.writeBool(true);
     charger.writeInt32(80);
-    charger.writeInt32(4100);
-    charger.writeInt32(300);
     op->sendMessage(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 2, charger));
-    Parcel time;
-    time.writeInt64(400);
+    TimeBody time(400);
     time.writeInt64(450);
     op->sendMessage(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 16, time));
     op->sendMessage(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 18, TimeBody(500)));
@@ -246,13 +237,6 @@ TEST_F(KelvoOperatorTest, StateChangesFeedTheOperatorsAccounter) {
                                         "balance:0:600", "deactivateAll:700", "component:77"}),
               calls());
 
-    // Without an accounter type nothing is fed.
-    sp<TestOperator> none = new TestOperator(-1, {2, kType});
-    none->initialize();
-    none->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 0, fg));
-    EXPECT_EQ(8u, calls().size());
-    none->release();
-    none->requestThreadExit();
 }
 
 TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
@@ -277,10 +261,12 @@ TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
                                                                          entry, sizeof(entry)));
     EXPECT_TRUE(waitFor([] { return countCalls("buffered:kelvo_test:5:abc") == 1; }));
     // A length beyond what arrived is refused, nothing posted.
+    uint64_t refused = kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused);
     length = 64;
     memcpy(entry, &length, 4);
     kelvo::BufferedLogServer::getInstance()->sendLogMessage(String8("kelvo_test"), entry,
                                                             sizeof(entry));
+    EXPECT_EQ(refused + 1, kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused));
 
     // The library record after the unknown one was never registered.
     Parcel action;
@@ -298,9 +284,40 @@ TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
                                                      TimeBody(43));
     EXPECT_EQ(-4, kelvo::BufferedLogServer::getInstance()->sendLogMessage(
                           String8("kelvo_test"), entry, sizeof(entry)));
+    EXPECT_EQ(refused + 2, kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused));
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     settle();
     EXPECT_EQ(0u, countCalls("hourlyTick:43"));
+}
+
+TEST_F(KelvoOperatorTest, RegistrationsDoNotKeepAnOperatorAlive) {
+    android::wp<TestOperator> weak;
+    {
+        sp<TestOperator> op = new TestOperator(kType, {1, 8, 2, kType, 3, 6});
+        op->initialize();
+        weak = op;
+        op->requestThreadExit();
+        op->join();
+    }
+    // Never released: the registrations alone must not hold it.
+    EXPECT_EQ(nullptr, weak.promote());
+    // What it registered is gone or harmless.
+    kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
+                                                     TimeBody(44));
+    uint8_t entry[8] = {0, 0, 0, 0, 6, 0, 0, 0};
+    EXPECT_EQ(-4, kelvo::BufferedLogServer::getInstance()->sendLogMessage(
+                          String8("kelvo_test"), entry, sizeof(entry)));
+    Parcel action;
+    action.writeInt32(kType);
+    action.writeInt32(kelvo::ACTION_DEACTIVATE_ALL);
+    action.writeInt64(9);
+    kelvo::setDataAccounter(action);
+    sp<TestOperator> probe = make(-1, {1, 8});
+    probe->initialize();
+    kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
+                                                     TimeBody(45));
+    EXPECT_TRUE(waitFor([] { return countCalls("hourlyTick:45") == 1; }));
+    EXPECT_EQ(0u, countCalls("hourlyTick:44"));
 }
 
 TEST_F(KelvoOperatorTest, AccountingRoundsLogAndVoteOnce) {

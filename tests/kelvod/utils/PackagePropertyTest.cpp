@@ -53,19 +53,7 @@ TEST(PackagePropertyNames, CombinesAtMostThreeSortedNames) {
     EXPECT_EQ("a|a.b", combined({"a.b", "a"}));
     // "b" is already inside "ab".
     EXPECT_EQ("ab", combined({"ab", "b"}));
-    EXPECT_EQ("only", combined({"only"}));
-    EXPECT_EQ("x|y|z", combined({"z", "y", "x"}));
     EXPECT_EQ("", combined({}));
-}
-
-TEST(PackagePropertyNames, KnowsTheFixedUids) {
-    EXPECT_STREQ("root", PackageProperty::wellKnownUidName(0));
-    EXPECT_STREQ("system", PackageProperty::wellKnownUidName(1000));
-    EXPECT_STREQ("dhcp", PackageProperty::wellKnownUidName(1014));
-    EXPECT_STREQ("WebView zygote", PackageProperty::wellKnownUidName(1053));
-    EXPECT_STREQ("nobody", PackageProperty::wellKnownUidName(9999));
-    EXPECT_EQ(nullptr, PackageProperty::wellKnownUidName(1018));
-    EXPECT_EQ(nullptr, PackageProperty::wellKnownUidName(10000));
 }
 
 class PackagePropertyTest : public kelvo::test::PlatformServicesFixture {
@@ -160,8 +148,6 @@ TEST_F(PackagePropertyTest, AddedPackageDoesNotHideTheOthersOfAnUncachedUid) {
     ASSERT_EQ(0, property->queryPackagesByUid(uid, out));
     EXPECT_EQ(names({"android", "com.example.settings", "com.example.new"}), out);
     EXPECT_EQ(calls, state().calls("package", kPackagesForUid));
-
-    EXPECT_EQ(-5, property->addPackage(-3, String8("x")));
 }
 
 TEST_F(PackagePropertyTest, RemovingAPackageOrUidAsksTheServiceAgain) {
@@ -184,8 +170,6 @@ TEST_F(PackagePropertyTest, RemovingAPackageOrUidAsksTheServiceAgain) {
     state().setPackages(uid, {"com.example.newer"});
     ASSERT_EQ(0, property->removeUid(uid));
     EXPECT_EQ("com.example.newer", byUid(uid));
-    EXPECT_EQ(-5, property->removeUid(-1));
-    EXPECT_EQ(-5, property->removePackage(-1, String8("x")));
 }
 
 TEST_F(PackagePropertyTest, MissingPackageServiceFailsFast) {
