@@ -276,7 +276,7 @@ TEST_F(DispatcherTest, MalformedRecordsAreCountedAndCostNothingElse) {
     // Each bad record is counted; one summary line a minute at most, so a
     // broken writer cannot spend the day's error lines. The thread reads on.
     EXPECT_EQ(malformed + bad.size(), HealthCounters::get(Health::LogRecordMalformed));
-    EXPECT_EQ(1u, log.count("readLoggerMessage# Dropped 1 malformed logger records, last: ",
+    EXPECT_EQ(1u, log.count("noteMalformedRecord# Dropped 1 malformed logger records, last: ",
                             ANDROID_LOG_ERROR));
     EXPECT_EQ(1u, log.count("Dropped ", ANDROID_LOG_ERROR));
     EXPECT_EQ(0u, log.count("Failed to read"));

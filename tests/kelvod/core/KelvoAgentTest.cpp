@@ -259,10 +259,11 @@ TEST_F(KelvoAgentTest, ErrorLinesReachTheSystemHandlerWhileStartUpRuns) {
     EXPECT_TRUE(waitFor([] { return hasEvent("error [X.cpp] f# stored error"); }));
     agent->getHandler(0)->requestThreadExit();
     agent->getHandler(0)->join();
-    // Without a system handler the row is lost, and counted.
+    // Without a system handler the row is lost, and counted (other threads
+    // may lose theirs meanwhile).
     uint64_t dropped = kelvo::HealthCounters::get(kelvo::Health::ErrorRowsDropped);
     agent->logError(row);
-    EXPECT_EQ(dropped + 1, kelvo::HealthCounters::get(kelvo::Health::ErrorRowsDropped));
+    EXPECT_LE(dropped + 1, kelvo::HealthCounters::get(kelvo::Health::ErrorRowsDropped));
 }
 
 namespace {
@@ -272,6 +273,8 @@ namespace {
 // routine, each a FakeOperator. Exits 0 when all holds, else 1 with the
 // failures on stderr.
 void runProcessWideAgent() {
+    // A hang (a thread stuck on its own lock) ends the process with a signal.
+    alarm(60);
     kelvo::test::TempRoot root;
     KelvoAgent::setHandlerFactory(0, makeHandler<0>);
     KelvoAgent::setHandlerFactory(2, makeHandler<2>);

@@ -208,7 +208,9 @@ TEST_F(DataUploaderTest, LibraryFailuresAreRecordedAndNotReportedAsSuccess) {
     EXPECT_EQ(0, mUploader->uploadEvent());
     EXPECT_EQ((std::vector<std::string>{"903002050:-1", "903001055:0", "903001060:0"}),
               results());
-    const Json::Value& kept = events().back()["params"];
+    std::vector<Json::Value> sent = events();
+    ASSERT_FALSE(sent.empty());
+    Json::Value kept = sent.back()["params"];
     EXPECT_EQ(5, kept["0"].asInt64());
     EXPECT_EQ(1, kept["1"].asInt64());
     EXPECT_FALSE(kept.isMember("2"));
