@@ -308,16 +308,6 @@ TEST_F(KelvoOperatorTest, RegistrationsDoNotKeepAnOperatorAlive) {
     uint8_t entry[8] = {0, 0, 0, 0, 6, 0, 0, 0};
     EXPECT_EQ(-4, kelvo::BufferedLogServer::getInstance()->sendLogMessage(
                           String8("kelvo_test"), entry, sizeof(entry)));
-    Parcel action;
-    action.writeInt32(kType);
-    action.writeInt32(kelvo::ACTION_DEACTIVATE_ALL);
-    action.writeInt64(9);
-    kelvo::setDataAccounter(action);
-    sp<TestOperator> probe = make(-1, {1, 8});
-    probe->initialize();
-    kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
-                                                     TimeBody(45));
-    EXPECT_TRUE(waitFor([] { return countCalls("hourlyTick:45") == 1; }));
 }
 
 TEST_F(KelvoOperatorTest, AccountingRoundsLogAndVoteOnce) {

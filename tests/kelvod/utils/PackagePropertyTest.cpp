@@ -98,31 +98,25 @@ TEST_F(PackagePropertyTest, NamesAUidFromThePackageServiceAndCachesIt) {
     EXPECT_EQ(-5, PackageProperty::getInstance()->queryPackagesByUid(-1, out));
 }
 
-TEST_F(PackagePropertyTest, SharedSystemUidIsNamedSystem) {
-    int32_t uid = use(1000);
-    state().setPackages(uid, {"android", "com.example.settings", "com.example.keychain"});
-    // No CPU handler and no running process: the fixed name wins.
-    EXPECT_EQ("system", byUidAndPid(uid, 1234));
-    EXPECT_EQ("system", byUid(uid));
-    // One package of a fixed uid is named by the package.
+TEST_F(PackagePropertyTest, ProcessesAndFixedUidsNameSharedUids) {
+    int32_t system = use(1000);
+    state().setPackages(system, {"android", "com.example.settings", "com.example.keychain"});
     int32_t radio = use(1001);
     state().setPackages(radio, {"com.example.phone"});
-    EXPECT_EQ("com.example.phone", byUidAndPid(radio, 1234));
-}
-
-TEST_F(PackagePropertyTest, RunningProcessNamesASharedUid) {
-    int32_t uid = use(10070);
-    state().setPackages(uid, {"com.example.a", "com.example.b"});
-    state().setProcesses({{5001, uid, "com.example.b:sync", {"com.example.b"}},
-                          {5002, 10071, "other", {"com.example.other"}}});
-    EXPECT_EQ("com.example.b", byUidAndPid(uid, 5001));
-    // A pid of another uid does not count: the packages are combined.
-    EXPECT_EQ("com.example.a|com.example.b", byUidAndPid(uid, 5002));
-}
-
-TEST_F(PackagePropertyTest, IsolatedProcessIsNamedByItsProcess) {
+    int32_t shared = use(10070);
+    state().setPackages(shared, {"com.example.a", "com.example.b"});
     int32_t isolated = use(99123);
-    state().setProcesses({{6001, 10080, "com.example.browser:sandboxed", {"com.example.browser"}}});
+    state().setProcesses({{5001, shared, "com.example.b:sync", {"com.example.b"}},
+                          {5002, 10071, "other", {"com.example.other"}},
+                          {6001, 10080, "com.example.browser:sandboxed", {"com.example.browser"}}});
+    // No CPU handler and no running process: the fixed name wins, unless
+    // the fixed uid holds one package.
+    EXPECT_EQ("system", byUidAndPid(system, 1234));
+    EXPECT_EQ("com.example.phone", byUidAndPid(radio, 1234));
+    EXPECT_EQ("com.example.b", byUidAndPid(shared, 5001));
+    // A pid of another uid does not count: the packages are combined.
+    EXPECT_EQ("com.example.a|com.example.b", byUidAndPid(shared, 5002));
+    // An isolated process is named by its process.
     EXPECT_EQ("com.example.browser", byUidAndPid(isolated, 6001));
     int32_t ret = 0;
     EXPECT_EQ("", byUidAndPid(isolated, 6002, &ret));
