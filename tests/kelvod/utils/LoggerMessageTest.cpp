@@ -3,6 +3,7 @@
 #include <cctype>
 #include <cstring>
 #include <memory>
+#include <ostream>
 #include <string>
 #include <vector>
 
@@ -89,6 +90,11 @@ const Case kCases[] = {
     {"number wider than the output", "delta=5", "delta=", nullptr, "%lld", 4, -5, "Invalid format",
      INT32, kUntouched32, nullptr},
 };
+
+// Test names and failure messages show the case by its name.
+void PrintTo(const Case& c, std::ostream* os) {
+    *os << c.name;
+}
 
 class LoggerMessageTest : public ::testing::TestWithParam<Case> {};
 
