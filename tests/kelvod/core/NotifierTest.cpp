@@ -5,6 +5,7 @@
 #include <thread>
 #include <vector>
 
+#include "common/RecordingHandler.h"
 #include "common/TestEnv.h"
 #include "core/Notifier.h"
 #include "utils/HandlerThread.h"
@@ -20,29 +21,7 @@ using kelvo::test::waitFor;
 
 namespace {
 
-struct Got {
-    int32_t type;
-    int32_t what;
-    int64_t time;
-};
-
-class ListeningThread : public HandlerThread {
-public:
-    explicit ListeningThread(const char* name) : HandlerThread(name, 11) {}
-    int32_t handleParcelMessage(const ParcelMessage& msg) override {
-        std::lock_guard<std::mutex> guard(mLock);
-        mGot.push_back({msg.type, msg.what, msg.getParcel().readInt64()});
-        return 0;
-    }
-    std::vector<Got> got() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mGot;
-    }
-
-private:
-    std::mutex mLock;
-    std::vector<Got> mGot;
-};
+using ListeningThread = kelvo::test::RecordingHandler;
 
 int32_t notify(Notifier* notifier, int32_t type, int64_t t) {
     Parcel body;
@@ -85,7 +64,7 @@ TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
     drain(notifier);
     ASSERT_TRUE(waitFor([&] { return a->got().size() == 6 && b->got().size() == 5; }));
 
-    std::vector<Got> gotA = a->got();
+    std::vector<kelvo::test::RecordingHandler::Got> gotA = a->got();
     for (int i = 0; i < 5; ++i) {
         EXPECT_EQ(kelvo::MESSAGE_NOTIFICATION, gotA[i].type);
         EXPECT_EQ(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, gotA[i].what);

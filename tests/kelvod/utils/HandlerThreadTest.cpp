@@ -9,6 +9,7 @@
 
 #include "HealthCounters.h"
 #include "KelvoLog.h"
+#include "common/RecordingHandler.h"
 #include "common/TestEnv.h"
 #include "utils/HandlerThread.h"
 
@@ -21,25 +22,17 @@ using kelvo::test::waitFor;
 
 namespace {
 
-struct Received {
-    int32_t type;
-    int32_t what;
-    int32_t value;
-};
-
-// Records what it receives. Code 7 sleeps for the body's milliseconds then
-// replies; code 8 replies with the body's value doubled; code 9 replies
-// nothing; code 10 holds the thread until released.
-class RecordingThread : public HandlerThread {
+// Records what it receives (the body: one int64 value). Code 7 sleeps for
+// the value's milliseconds then replies; code 8 replies with the value
+// doubled; code 9 replies nothing; code 10 holds the thread until released.
+class RecordingThread : public kelvo::test::RecordingHandler {
 public:
-    explicit RecordingThread(const char* name = "RecordingThread") : HandlerThread(name, 11) {}
+    explicit RecordingThread(const char* name = "RecordingThread") : RecordingHandler(name) {}
 
     int32_t handleParcelMessage(const ParcelMessage& msg) override {
-        int32_t value = msg.getParcel().readInt32();
-        {
-            std::lock_guard<std::mutex> guard(mLock);
-            mReceived.push_back({msg.type, msg.what, value});
-        }
+        RecordingHandler::handleParcelMessage(msg);
+        msg.getParcel().setDataPosition(0);
+        int32_t value = static_cast<int32_t>(msg.getParcel().readInt64());
         switch (msg.what) {
             case 7:
                 std::this_thread::sleep_for(std::chrono::milliseconds(value));
@@ -59,26 +52,14 @@ public:
                 return 0;
         }
     }
-
-    std::vector<Received> received() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mReceived;
-    }
-    size_t count() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mReceived.size();
-    }
+    size_t count() { return got().size(); }
 
     std::atomic<bool> mRelease{false};
-
-private:
-    std::mutex mLock;
-    std::vector<Received> mReceived;
 };
 
 ParcelMessage makeMessage(int32_t what, int32_t value, Parcel* reply = nullptr) {
     Parcel p;
-    p.writeInt32(value);
+    p.writeInt64(value);
     return ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, what, p, reply);
 }
 
@@ -96,10 +77,10 @@ TEST_F(HandlerThreadTest, DeliversAsynchronousMessagesInOrderWithTheirBodies) {
         ids.push_back(t->sendMessage(makeMessage(1, i)));
     }
     ASSERT_TRUE(waitFor([&] { return t->count() == 100; }));
-    std::vector<Received> got = t->received();
+    std::vector<kelvo::test::RecordingHandler::Got> got = t->got();
     for (int i = 0; i < 100; ++i) {
         EXPECT_EQ(kelvo::MESSAGE_CUSTOMIZED, got[i].type);
-        EXPECT_EQ(i, got[i].value);
+        EXPECT_EQ(i, got[i].time);
     }
     // Ids run 1, 2, 3 ...
     for (size_t i = 0; i < ids.size(); ++i) {
@@ -118,7 +99,7 @@ TEST_F(HandlerThreadTest, DelayedMessageWaitsAndCanBeRemoved) {
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     EXPECT_EQ(0u, t->count());
     ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
-    EXPECT_EQ(1, t->received()[0].value);
+    EXPECT_EQ(1, t->got()[0].time);
 
     // An id already delivered (or removed) is unknown.
     LogCapture log;
@@ -247,9 +228,9 @@ TEST_F(HandlerThreadTest, IdsWrapToZeroAndSkipPendingOnes) {
     EXPECT_EQ(2, t->sendMessage(makeMessage(1, 3)));
     t->mRelease = true;
     ASSERT_TRUE(waitFor([&] { return t->count() == 4; }));
-    std::vector<Received> got = t->received();
-    EXPECT_EQ(1, got[1].value);
-    EXPECT_EQ(2, got[2].value);
-    EXPECT_EQ(3, got[3].value);
+    std::vector<kelvo::test::RecordingHandler::Got> got = t->got();
+    EXPECT_EQ(1, got[1].time);
+    EXPECT_EQ(2, got[2].time);
+    EXPECT_EQ(3, got[3].time);
     t->requestThreadExit();
 }

@@ -14,6 +14,7 @@
 #include <vector>
 
 #include "KelvoLog.h"
+#include "common/RecordingHandler.h"
 #include "common/TestEnv.h"
 #include "utils/HandlerThread.h"
 #include "utils/TimerCallback.h"
@@ -30,55 +31,11 @@ using namespace std::chrono_literals;
 
 namespace {
 
-constexpr int32_t kMarker = -1;
-
-// Records (type, what) of every message it handles.
-class RecordingThread : public HandlerThread {
+// Records what reaches it; counts the timer messages of one id.
+class RecordingThread : public kelvo::test::RecordingHandler {
 public:
-    explicit RecordingThread(const char* name) : HandlerThread(name, 11) {}
-
-    int32_t handleParcelMessage(const ParcelMessage& msg) override {
-        std::lock_guard<std::mutex> guard(mLock);
-        mGot.emplace_back(msg.type, msg.what);
-        return 0;
-    }
-
-    // Timer messages received for the timer id.
-    size_t timerCount(int32_t id) {
-        std::lock_guard<std::mutex> guard(mLock);
-        size_t n = 0;
-        for (const auto& got : mGot) {
-            n += (got.first == kelvo::MESSAGE_TIMER && got.second == id) ? 1 : 0;
-        }
-        return n;
-    }
-
-    std::vector<std::pair<int32_t, int32_t>> got() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mGot;
-    }
-
-    // Waits until everything posted to this thread so far has been handled.
-    bool drain() {
-        size_t before = markerCount();
-        if (sendMessage(ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, kMarker)) < 0) {
-            return false;
-        }
-        return waitFor([&] { return markerCount() > before; });
-    }
-
-private:
-    size_t markerCount() {
-        std::lock_guard<std::mutex> guard(mLock);
-        size_t n = 0;
-        for (const auto& got : mGot) {
-            n += (got.first == kelvo::MESSAGE_CUSTOMIZED && got.second == kMarker) ? 1 : 0;
-        }
-        return n;
-    }
-
-    std::mutex mLock;
-    std::vector<std::pair<int32_t, int32_t>> mGot;
+    explicit RecordingThread(const char* name) : RecordingHandler(name) {}
+    size_t timerCount(int32_t id) { return count(kelvo::MESSAGE_TIMER, id); }
 };
 
 // Timer descriptors currently open in this process.
@@ -151,8 +108,8 @@ TEST_F(TimerManagerTest, OneShotFiresOncePeriodicRepeatsAndADuplicateIsRefused) 
     EXPECT_EQ(0, mManager->getExpireTime(once));
     EXPECT_LE(mManager->getExpireTime(a), 20);
     for (const auto& got : mThread->got()) {
-        if (got.first == kelvo::MESSAGE_TIMER) {
-            EXPECT_TRUE(got.second == 1 || got.second == 2 || got.second == 7) << got.second;
+        if (got.type == kelvo::MESSAGE_TIMER) {
+            EXPECT_TRUE(got.what == 1 || got.what == 2 || got.what == 7) << got.what;
         }
     }
 }

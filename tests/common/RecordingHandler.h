@@ -1,0 +1,57 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <mutex>
+#include <vector>
+
+#include "common/TestEnv.h"
+#include "utils/HandlerThread.h"
+
+namespace kelvo {
+namespace test {
+
+// A handler thread that records the type, `what` and leading int64 of every
+// message it handles (0 when the body holds none).
+class RecordingHandler : public HandlerThread {
+public:
+    struct Got {
+        int32_t type;
+        int32_t what;
+        int64_t time;
+    };
+
+    explicit RecordingHandler(const char* name) : HandlerThread(name, 11) {}
+
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.push_back({msg.type, msg.what, msg.getParcel().readInt64()});
+        return 0;
+    }
+
+    std::vector<Got> got() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mGot;
+    }
+
+    size_t count(int32_t type, int32_t what) {
+        size_t n = 0;
+        for (const Got& g : got()) n += g.type == type && g.what == what ? 1 : 0;
+        return n;
+    }
+
+    // Waits until everything posted to this thread so far has been handled.
+    bool drain() {
+        size_t before = count(MESSAGE_CUSTOMIZED, kMarker);
+        return sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, kMarker)) >= 0 &&
+                waitFor([&] { return count(MESSAGE_CUSTOMIZED, kMarker) > before; });
+    }
+
+private:
+    static constexpr int32_t kMarker = -1;
+    std::mutex mLock;
+    std::vector<Got> mGot;
+};
+
+} // namespace test
+} // namespace kelvo
