@@ -68,10 +68,7 @@ public:
         std::lock_guard<std::mutex> guard(mLock);
         return mLogged;
     }
-    size_t count() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mLogged.size();
-    }
+    size_t count() { return logged().size(); }
     const std::vector<int32_t>& results() const { return mResults; }
 
 private:
@@ -81,15 +78,9 @@ private:
     std::vector<Logged> mLogged;
 };
 
-void put16(std::string* s, size_t at, uint32_t v) {
-    (*s)[at] = static_cast<char>(v & 0xff);
-    (*s)[at + 1] = static_cast<char>((v >> 8) & 0xff);
-}
-
-void put32(std::string* s, size_t at, uint32_t v) {
-    for (int i = 0; i < 4; ++i) {
-        (*s)[at + i] = static_cast<char>((v >> (8 * i)) & 0xff);
-    }
+// Writes v little-endian in `bytes` bytes at `at`.
+void put(std::string* s, size_t at, uint32_t v, int bytes) {
+    for (int i = 0; i < bytes; ++i) (*s)[at + i] = static_cast<char>((v >> (8 * i)) & 0xff);
 }
 
 // A record with the given payload; its header declares `declared` bytes of
@@ -97,9 +88,9 @@ void put32(std::string* s, size_t at, uint32_t v) {
 std::string rawRecord(const std::string& payload, long declared = -1, uint32_t seconds = 1,
                       uint32_t nanoseconds = 0) {
     std::string record(LogDevice::kHeaderSize, '\0');
-    put16(&record, 0, static_cast<uint32_t>(declared < 0 ? payload.size() : declared));
-    put32(&record, 12, seconds);
-    put32(&record, 16, nanoseconds);
+    put(&record, 0, static_cast<uint32_t>(declared < 0 ? payload.size() : declared), 2);
+    put(&record, 12, seconds, 4);
+    put(&record, 16, nanoseconds, 4);
     return record + payload;
 }
 
@@ -113,9 +104,7 @@ protected:
         mRoot.reset(new kelvo::test::TempRoot());
         Dispatcher::resetForTest();
         mSavedInfo = kelvo::gLogInfoEnable.load();
-        mSavedMask = kelvo::gLogModuleMask.load();
         kelvo::gLogInfoEnable.store(1);
-        kelvo::gLogModuleMask.store(0);
         mWriter.reset(new LogWriter(kelvo::RootPath::resolve(KELVO_LOG_DEVICE)));
         // A reader that stopped reading fails the test instead of hanging it.
         mWriter->setTimeout(kLongWait.count());
@@ -128,7 +117,6 @@ protected:
         }
         mOperators.clear();
         kelvo::gLogInfoEnable.store(mSavedInfo);
-        kelvo::gLogModuleMask.store(mSavedMask);
         mWriter.reset();
         mRoot.reset();
     }
@@ -152,7 +140,6 @@ protected:
     std::unique_ptr<LogWriter> mWriter;
     std::vector<sp<RecordingOperator>> mOperators;
     int32_t mSavedInfo = 1;
-    uint32_t mSavedMask = 0;
 };
 
 } // namespace
