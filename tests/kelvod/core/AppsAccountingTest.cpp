@@ -31,47 +31,35 @@ namespace {
 constexpr int64_t kTen = 1796551200000LL;
 constexpr int64_t kHour = 3600000;
 
-void common(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bg, int64_t on,
-            int64_t off, int32_t v1, int32_t v2, int32_t v3, int32_t v4) {
+// One record: time, name, code, then the 32-bit fields (shared sub-key)
+// and 64-bit fields in the order of the code's kind.
+void record(int64_t t, const char* name, int32_t code, std::initializer_list<int32_t> lead,
+            std::initializer_list<int64_t> energies, std::initializer_list<int32_t> values) {
     Parcel p;
     p.writeInt64(t);
     p.writeString8(String8(name));
     p.writeInt32(code);
-    for (int64_t e : {fg, bg, on, off}) p.writeInt64(e);
-    for (int32_t v : {v1, v2, v3, v4}) p.writeInt32(v);
+    for (int32_t v : lead) p.writeInt32(v);
+    for (int64_t e : energies) p.writeInt64(e);
+    for (int32_t v : values) p.writeInt32(v);
     EXPECT_EQ(0, AppsAccounting::getInstance()->addAppsData(p));
+}
+
+void common(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bg, int64_t on,
+            int64_t off, int32_t v1, int32_t v2, int32_t v3, int32_t v4) {
+    record(t, name, code, {}, {fg, bg, on, off}, {v1, v2, v3, v4});
 }
 
 void shared(int64_t t, const char* name, int32_t code, int32_t key, int64_t fg, int32_t v1) {
-    Parcel p;
-    p.writeInt64(t);
-    p.writeString8(String8(name));
-    p.writeInt32(code);
-    p.writeInt32(key);
-    for (int64_t e : {fg, int64_t(0), fg, int64_t(0)}) p.writeInt64(e);
-    for (int32_t v : {v1, 0, v1, 0}) p.writeInt32(v);
-    EXPECT_EQ(0, AppsAccounting::getInstance()->addAppsData(p));
+    record(t, name, code, {key}, {fg, 0, fg, 0}, {v1, 0, v1, 0});
 }
 
 void display(int64_t t, const char* name, int64_t energy, int64_t duration) {
-    Parcel p;
-    p.writeInt64(t);
-    p.writeString8(String8(name));
-    p.writeInt32(kelvo::APPS_DISPLAY);
-    p.writeInt64(energy);
-    p.writeInt64(duration);
-    EXPECT_EQ(0, AppsAccounting::getInstance()->addAppsData(p));
+    record(t, name, kelvo::APPS_DISPLAY, {}, {energy, duration}, {});
 }
 
 void network(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bytes) {
-    Parcel p;
-    p.writeInt64(t);
-    p.writeString8(String8(name));
-    p.writeInt32(code);
-    for (int64_t v : {fg, int64_t(0), fg, int64_t(0), bytes, int64_t(0), bytes, int64_t(0)}) {
-        p.writeInt64(v);
-    }
-    EXPECT_EQ(0, AppsAccounting::getInstance()->addAppsData(p));
+    record(t, name, code, {}, {fg, 0, fg, 0, bytes, 0, bytes, 0}, {});
 }
 
 class AppsAccountingTest : public ::testing::Test {
