@@ -44,6 +44,15 @@ void drain(Notifier* notifier) {
     std::this_thread::sleep_for(std::chrono::milliseconds(50));
 }
 
+// Unregisters the listeners when the test ends, however it ends: the
+// notifier must never keep a record that left the stack.
+struct Registered {
+    std::vector<NotifierListener*> listeners;
+    ~Registered() {
+        for (NotifierListener* l : listeners) Notifier::getInstance()->unregisterAll(l);
+    }
+};
+
 } // namespace
 
 TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
@@ -52,13 +61,13 @@ TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
     sp<ListeningThread> b = new ListeningThread("ListenerB");
     NotifierListener la(a);
     NotifierListener lb(b);
+    Registered cleanup{{&la, &lb}};
     ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &la));
     ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, &lb));
     ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_HOURLY_TICK, &la));
 
     for (int64_t t = 1; t <= 5; ++t) {
-        EXPECT_GE(notify(notifier, kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, t),
-                  0);
+        EXPECT_GE(notify(notifier, kelvo::NOTIFICATION_SCREEN_STATE_CHANGED, t), 0);
     }
     notify(notifier, kelvo::NOTIFICATION_HOURLY_TICK, 100);
     drain(notifier);
@@ -81,7 +90,6 @@ TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
     drain(notifier);
     EXPECT_EQ(6u, a->got().size());
     EXPECT_EQ(5u, b->got().size());
-    notifier->unregisterListener(kelvo::NOTIFICATION_HOURLY_TICK, &la);
     a->requestThreadExit();
     b->requestThreadExit();
 }
@@ -90,6 +98,7 @@ TEST(NotifierTest, BadAndDuplicateRegistrationsAreRefused) {
     Notifier* notifier = Notifier::getInstance();
     sp<ListeningThread> a = new ListeningThread("ListenerDup");
     NotifierListener la(a);
+    Registered cleanup{{&la}};
     LogCapture log;
     EXPECT_EQ(-5, notifier->registerListener(23, &la));
     EXPECT_EQ(-5, notifier->registerListener(0, nullptr));
@@ -120,6 +129,7 @@ TEST(NotifierTest, ListenerWhoseThreadEndedIsSkippedWithoutHarm) {
     sp<ListeningThread> alive = new ListeningThread("ListenerAlive");
     NotifierListener lg(gone);
     NotifierListener la(alive);
+    Registered cleanup{{&lg, &la}};
     ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &lg));
     ASSERT_EQ(0, notifier->registerListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &la));
     gone->requestThreadExit();
@@ -129,7 +139,5 @@ TEST(NotifierTest, ListenerWhoseThreadEndedIsSkippedWithoutHarm) {
     drain(notifier);
     ASSERT_TRUE(waitFor([&] { return alive->got().size() == 1; }));
     EXPECT_TRUE(log.contains("ListenerGone is not running or is pending to exit"));
-    notifier->unregisterListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &lg);
-    notifier->unregisterListener(kelvo::NOTIFICATION_BOOT_COMPLETED, &la);
     alive->requestThreadExit();
 }
