@@ -182,7 +182,9 @@ TEST_F(DataUploaderTest, LibraryFailuresAreRecordedAndNotReportedAsSuccess) {
     Parcel p;
     DataUploader::formIntData(0, 1, p);
     LogCapture log;
+    uint64_t failures = kelvo::HealthCounters::get(kelvo::Health::UploadFailures);
     EXPECT_EQ(-22, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_ABNORMALITY, p, true));
+    EXPECT_EQ(failures + 1, kelvo::HealthCounters::get(kelvo::Health::UploadFailures));
     EXPECT_TRUE(log.contains("Failed to send event: 903002050"));
     EXPECT_FALSE(log.contains("Upload eventid(903002050) success"));
 
