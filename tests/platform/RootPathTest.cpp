@@ -7,56 +7,37 @@
 
 using kelvo::RootPath;
 
-namespace {
-
-// Puts the process's root back as it was.
-class RootPathTest : public ::testing::Test {
-protected:
-    void SetUp() override { mSaved = RootPath::root(); }
-    void TearDown() override {
-        RootPath::setRoot(mSaved.c_str());
-        kelvo::HostProperties::reload();
+TEST(RootPathTest, AbsolutePathsGoUnderTheRootAndOthersAreLeftAlone) {
+    std::string saved = RootPath::root();
+    struct Case {
+        const char* root;
+        const char* path;
+        const char* resolved;
+    } cases[] = {
+            {"/tmp/kr", "/sys/class/power_supply", "/tmp/kr/sys/class/power_supply"},
+            {"/tmp/kr", "/", "/tmp/kr/"},
+            {"/tmp/kr", "data/x", "data/x"},
+            {"/tmp/kr", "./x", "./x"},
+            {"/tmp/kr", "", ""},
+            {"/tmp/kr", nullptr, ""},
+            // Trailing slashes of the root are dropped; "/" and "" are the
+            // real root, which adds nothing.
+            {"/tmp/kr///", "/vendor/build.prop", "/tmp/kr/vendor/build.prop"},
+            {"/", "/vendor/build.prop", "/vendor/build.prop"},
+            {"", "/data/x", "/data/x"},
+            {nullptr, "/proc/stat", "/proc/stat"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(std::string(c.root ? c.root : "null") + " " + (c.path ? c.path : "null"));
+        RootPath::setRoot(c.root);
+        EXPECT_EQ(c.resolved, RootPath::resolve(c.path));
     }
-
-private:
-    std::string mSaved;
-};
-
-} // namespace
-
-TEST_F(RootPathTest, AbsolutePathsGoUnderTheRoot) {
-    RootPath::setRoot("/tmp/kelvo-root");
-    EXPECT_EQ("/tmp/kelvo-root", RootPath::root());
-    EXPECT_EQ("/tmp/kelvo-root/sys/class/power_supply",
-              RootPath::resolve("/sys/class/power_supply"));
-    EXPECT_EQ("/tmp/kelvo-root/", RootPath::resolve("/"));
-    EXPECT_EQ("/tmp/kelvo-root/data/x", RootPath::resolve(std::string("/data/x")));
-
-    // The real root adds nothing.
-    RootPath::setRoot("");
-    EXPECT_EQ("", RootPath::root());
-    EXPECT_EQ("/data/x", RootPath::resolve("/data/x"));
-    RootPath::setRoot(nullptr);
-    EXPECT_EQ("/proc/stat", RootPath::resolve("/proc/stat"));
-}
-
-TEST_F(RootPathTest, RelativePathsAreLeftAlone) {
-    RootPath::setRoot("/tmp/kelvo-root");
-    EXPECT_EQ("data/x", RootPath::resolve("data/x"));
-    EXPECT_EQ("./x", RootPath::resolve("./x"));
-    EXPECT_EQ("", RootPath::resolve(""));
-    EXPECT_EQ("", RootPath::resolve(static_cast<const char*>(nullptr)));
-}
-
-TEST_F(RootPathTest, TrailingSlashesOfTheRootAreDropped) {
-    for (const char* root : {"/tmp/kelvo-root/", "/tmp/kelvo-root///"}) {
-        SCOPED_TRACE(root);
-        RootPath::setRoot(root);
-        EXPECT_EQ("/tmp/kelvo-root", RootPath::root());
-        EXPECT_EQ("/tmp/kelvo-root/vendor/build.prop", RootPath::resolve("/vendor/build.prop"));
-    }
-    // "/" alone is the real root.
+    RootPath::setRoot("/tmp/kr/");
+    EXPECT_EQ("/tmp/kr", RootPath::root());
+    EXPECT_EQ("/tmp/kr/data/x", RootPath::resolve(std::string("/data/x")));
     RootPath::setRoot("/");
     EXPECT_EQ("", RootPath::root());
-    EXPECT_EQ("/vendor/build.prop", RootPath::resolve("/vendor/build.prop"));
+
+    RootPath::setRoot(saved.c_str());
+    kelvo::HostProperties::reload();
 }

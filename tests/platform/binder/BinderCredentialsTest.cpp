@@ -6,10 +6,10 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <map>
-#include <mutex>
-#include <utility>
+#include <memory>
 
+#include "FakePermissionService.h"
+#include "PlatformState.h"
 #include "common/TestEnv.h"
 #include "platform/binder/BinderTestUtil.h"
 
@@ -22,44 +22,6 @@ namespace {
 
 constexpr uid_t kAppUid = 10123;
 const char kDump[] = "android.permission.DUMP";
-
-// Answers the permission check from a table of grants; counts the questions.
-class FakePermissionService : public android::BBinder {
-public:
-    void grant(const char* permission, uid_t uid, bool granted) {
-        std::lock_guard<std::mutex> guard(mLock);
-        mGrants[{permission, uid}] = granted;
-    }
-    int asked() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mAsked;
-    }
-
-protected:
-    android::status_t onTransact(uint32_t code, const Parcel& data, Parcel* reply,
-                                 uint32_t flags) override {
-        if (code != IBinder::FIRST_CALL_TRANSACTION) {
-            return BBinder::onTransact(code, data, reply, flags);
-        }
-        if (!data.enforceInterface(String16("android.os.IPermissionController"))) {
-            return android::PERMISSION_DENIED;
-        }
-        std::string permission = android::String8(data.readString16()).string();
-        data.readInt32();  // pid
-        uid_t uid = static_cast<uid_t>(data.readInt32());
-        std::lock_guard<std::mutex> guard(mLock);
-        mAsked++;
-        auto it = mGrants.find({permission, uid});
-        reply->writeNoException();
-        reply->writeInt32(it != mGrants.end() && it->second ? 1 : 0);
-        return android::NO_ERROR;
-    }
-
-private:
-    std::mutex mLock;
-    std::map<std::pair<std::string, uid_t>, bool> mGrants;
-    int mAsked = 0;
-};
 
 // Answers kEcho only to callers holding the permission (checked through
 // the cache when cached is set).
@@ -81,9 +43,9 @@ protected:
         // A child of another uid must reach the sockets below the root.
         chmod(mRoot.path().c_str(), 0755);
         android::PermissionCache::purge();
-        mPermissions = new FakePermissionService();
         auto sm = android::defaultServiceManager();
-        ASSERT_EQ(android::NO_ERROR, sm->addService(String16("permission"), mPermissions));
+        ASSERT_EQ(android::NO_ERROR, sm->addService(String16("permission"),
+                                                    new kelvo::FakePermissionService(mState)));
         ASSERT_EQ(android::NO_ERROR, sm->addService(String16("test.guarded"), new GuardedService()));
         ASSERT_EQ(android::NO_ERROR,
                   sm->addService(String16("test.who"), new kelvo::test::TestService()));
@@ -127,8 +89,11 @@ protected:
         });
     }
 
+    // Permission checks the fake permission service was asked.
+    int asked() { return mState->calls("permission", IBinder::FIRST_CALL_TRANSACTION); }
+
     kelvo::test::TempRoot mRoot;
-    sp<FakePermissionService> mPermissions;
+    std::shared_ptr<kelvo::PlatformState> mState = std::make_shared<kelvo::PlatformState>();
 };
 
 TEST_F(BinderCredentialsTest, CallerIdentityIsTheKernelsNotTheCallersWord) {
@@ -158,40 +123,33 @@ TEST_F(BinderCredentialsTest, CallerIdentityIsTheKernelsNotTheCallersWord) {
     EXPECT_EQ(0, status);
 }
 
-TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionService) {
+TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionServiceAndCached) {
     if (getuid() != 0) {
         GTEST_SKIP() << "needs root to call as another uid";
     }
     EXPECT_EQ(0, appAllowed(false));
-    EXPECT_EQ(1, mPermissions->asked());
-    mPermissions->grant(kDump, kAppUid, true);
+    EXPECT_EQ(1, asked());
+    mState->grant(kDump, kAppUid, true);
     EXPECT_EQ(1, appAllowed(false));
     // Another permission, or another uid, is not granted by it.
     EXPECT_FALSE(android::checkPermission(String16("android.permission.OTHER"), 1, kAppUid));
     EXPECT_FALSE(android::checkPermission(String16(kDump), 1, kAppUid + 1));
     // Root and this very process never need asking.
-    int before = mPermissions->asked();
+    int before = asked();
     EXPECT_TRUE(android::checkPermission(String16(kDump), 1, 0));
     EXPECT_TRUE(android::checkPermission(String16(kDump), getpid(), kAppUid + 1));
-    EXPECT_EQ(before, mPermissions->asked());
-}
+    EXPECT_EQ(before, asked());
 
-TEST_F(BinderCredentialsTest, CacheRemembersGrantsUntilPurged) {
-    if (getuid() != 0) {
-        GTEST_SKIP() << "needs root to call as another uid";
-    }
-    // Refusals are asked again each time.
+    // The cache asks again after a refusal, and remembers a grant even once
+    // revoked, until it is purged.
+    mState->grant(kDump, kAppUid, false);
     EXPECT_EQ(0, appAllowed(true));
-    EXPECT_EQ(0, appAllowed(true));
-    EXPECT_EQ(2, mPermissions->asked());
-    mPermissions->grant(kDump, kAppUid, true);
+    EXPECT_EQ(before + 1, asked());
+    mState->grant(kDump, kAppUid, true);
     EXPECT_EQ(1, appAllowed(true));
-    EXPECT_EQ(3, mPermissions->asked());
-    // A grant is remembered, even once revoked...
-    mPermissions->grant(kDump, kAppUid, false);
+    mState->grant(kDump, kAppUid, false);
     EXPECT_EQ(1, appAllowed(true));
-    EXPECT_EQ(3, mPermissions->asked());
-    // ...until the cache is purged.
+    EXPECT_EQ(before + 2, asked());
     android::PermissionCache::purge();
     EXPECT_EQ(0, appAllowed(true));
 }

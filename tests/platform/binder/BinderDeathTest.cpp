@@ -50,8 +50,16 @@ TEST_F(BinderDeathTest, DeathIsToldOnceOnTheDeathThread) {
     ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 1));
     sp<DeathCounter> first = new DeathCounter();
     sp<DeathCounter> second = new DeathCounter();
+    sp<DeathCounter> dropped = new DeathCounter();
     ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(first));
     ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(second, reinterpret_cast<void*>(2)));
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(dropped, reinterpret_cast<void*>(7)));
+    // An unlinked recipient is not told; the cookie is part of the link.
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped));
+    android::wp<IBinder::DeathRecipient> out;
+    EXPECT_EQ(android::NO_ERROR, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7), 0, &out));
+    EXPECT_EQ(dropped.get(), out.promote().get());
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7)));
 
     killRemote();
     ASSERT_TRUE(kelvo::test::waitFor([&] { return first->count() > 0 && second->count() > 0; },
@@ -76,6 +84,7 @@ TEST_F(BinderDeathTest, DeathIsToldOnceOnTheDeathThread) {
     EXPECT_EQ(1, first->count());
     EXPECT_EQ(1, second->count());
     EXPECT_EQ(0, late->count());
+    EXPECT_EQ(0, dropped->count());
 }
 
 TEST_F(BinderDeathTest, DeathDuringACallFailsTheCall) {
@@ -102,46 +111,6 @@ TEST_F(BinderDeathTest, DeathDuringACallFailsTheCall) {
         kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
 }
 
-TEST_F(BinderDeathTest, UnlinkedRecipientIsNotTold) {
-    sp<IBinder> proxy = startRemote();
-    ASSERT_NE(nullptr, proxy);
-    sp<DeathCounter> kept = new DeathCounter();
-    sp<DeathCounter> dropped = new DeathCounter();
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(kept));
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(dropped, reinterpret_cast<void*>(7)));
-    // The cookie is part of the link.
-    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped));
-    android::wp<IBinder::DeathRecipient> out;
-    EXPECT_EQ(android::NO_ERROR, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7), 0, &out));
-    EXPECT_EQ(dropped.get(), out.promote().get());
-    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7)));
-
-    killRemote();
-    // The kept link shows when the death has been told.
-    ASSERT_TRUE(kelvo::test::waitFor([&] { return kept->count() == 1; }, std::chrono::seconds(10)));
-    EXPECT_EQ(0, dropped->count());
-}
-
-TEST_F(BinderDeathTest, RestartedServiceIsAnotherObject) {
-    sp<IBinder> before = startRemote();
-    ASSERT_NE(nullptr, before);
-    ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(before, 1));
-    killRemote();
-    // A dead server's socket is no service.
-    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.remote")));
-
-    sp<IBinder> after = startRemote();
-    ASSERT_NE(nullptr, after);
-    EXPECT_NE(before.get(), after.get());
-    int32_t answer = 0;
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(after, 4, &answer));
-    EXPECT_EQ(5, answer);
-    // The old proxy never reaches the new server.
-    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(before, 1));
-    EXPECT_FALSE(before->isBinderAlive());
-    EXPECT_TRUE(after->isBinderAlive());
-}
-
 TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
     sp<IBinder> proxy = startRemote();
     ASSERT_NE(nullptr, proxy);
@@ -163,6 +132,15 @@ TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
     ASSERT_TRUE(
         kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
     EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(object, 1));
+    // A dead server's socket is no service; a restarted one is another
+    // object, which the old proxy never reaches.
+    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.remote")));
+    sp<IBinder> after = startRemote();
+    ASSERT_NE(nullptr, after);
+    EXPECT_NE(proxy.get(), after.get());
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(after, 4));
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 1));
+    EXPECT_FALSE(proxy->isBinderAlive());
 }
 
 TEST_F(BinderDeathTest, StoppedServiceOfThisProcessDies) {

@@ -15,68 +15,48 @@ using android::String16;
 
 namespace {
 
-// dumpsys sits beside the test program in bin/.
-std::string dumpsysPath() {
+TEST(DumpsysTest, DumpsToItsStandardOutputAndFailsClearly) {
+    // dumpsys sits beside the test program in bin/.
     char self[PATH_MAX] = {};
     ssize_t n = readlink("/proc/self/exe", self, sizeof(self) - 1);
-    std::string path(self, n > 0 ? static_cast<size_t>(n) : 0);
-    return path.substr(0, path.find_last_of('/') + 1) + "dumpsys";
-}
-
-// Runs the command; returns its exit status and standard output.
-int run(const std::string& command, std::string* out) {
-    FILE* p = popen(command.c_str(), "r");
-    if (p == nullptr) {
-        return -1;
+    std::string tool(self, n > 0 ? static_cast<size_t>(n) : 0);
+    tool = tool.substr(0, tool.find_last_of('/') + 1) + "dumpsys";
+    if (access(tool.c_str(), X_OK) != 0) {
+        GTEST_SKIP() << "dumpsys not built beside the tests";
     }
-    char buf[256];
-    size_t n;
-    while ((n = fread(buf, 1, sizeof(buf), p)) > 0) {
-        out->append(buf, n);
-    }
-    int status = pclose(p);
-    return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
-}
-
-class DumpsysTest : public ::testing::Test {
-protected:
-    void SetUp() override {
-        if (access(dumpsysPath().c_str(), X_OK) != 0) {
-            GTEST_SKIP() << "dumpsys not built beside the tests";
+    kelvo::test::TempRoot root;
+    ASSERT_EQ(android::NO_ERROR, android::defaultServiceManager()->addService(
+                                     String16("test.dumped"), new kelvo::test::TestService()));
+    // Runs dumpsys with the arguments; its exit status and standard output.
+    auto run = [&](const std::string& args, std::string* out, const char* env = "") {
+        out->clear();
+        std::string command = std::string(env) + tool + " " + args;
+        FILE* p = popen(command.c_str(), "r");
+        char buf[256];
+        size_t got;
+        while (p != nullptr && (got = fread(buf, 1, sizeof(buf), p)) > 0) {
+            out->append(buf, got);
         }
-        ASSERT_EQ(android::NO_ERROR, android::defaultServiceManager()->addService(
-                                         String16("test.dumped"), new kelvo::test::TestService()));
-    }
-    void TearDown() override { kelvo::ServiceControl::stopService(String16("test.dumped")); }
-
-    kelvo::test::TempRoot mRoot;
-};
-
-TEST_F(DumpsysTest, DumpWritesToItsStandardOutput) {
+        int status = p != nullptr ? pclose(p) : -1;
+        return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    };
+    std::string at = "-r " + root.path() + " ";
     std::string out;
-    EXPECT_EQ(0, run(dumpsysPath() + " -r " + mRoot.path() + " test.dumped --log cpu 1", &out));
+    EXPECT_EQ(0, run(at + "test.dumped --log cpu 1", &out));
     EXPECT_EQ("dump of test service: --log cpu 1\n", out);
-
-    out.clear();
-    EXPECT_EQ(0, run(dumpsysPath() + " -r " + mRoot.path() + " test.dumped", &out));
+    EXPECT_EQ(0, run(at + "test.dumped", &out));
     EXPECT_EQ("dump of test service:\n", out);
-
     // The root may come from the environment too.
-    out.clear();
-    EXPECT_EQ(0, run("KELVO_ROOT=" + mRoot.path() + " " + dumpsysPath() + " test.dumped -v", &out));
+    std::string env = "KELVO_ROOT=" + root.path() + " ";
+    EXPECT_EQ(0, run("test.dumped -v", &out, env.c_str()));
     EXPECT_EQ("dump of test service: -v\n", out);
-}
 
-TEST_F(DumpsysTest, UnknownServiceAndBadUsageFail) {
-    std::string out;
-    EXPECT_EQ(1, run(dumpsysPath() + " -r " + mRoot.path() + " test.absent 2>&1", &out));
+    EXPECT_EQ(1, run(at + "test.absent 2>&1", &out));
     EXPECT_NE(std::string::npos, out.find("Can't find service: test.absent")) << out;
-    out.clear();
-    EXPECT_EQ(2, run(dumpsysPath() + " -r " + mRoot.path() + " 2>/dev/null", &out));
-
-    out.clear();
-    EXPECT_EQ(0, run(dumpsysPath() + " -r " + mRoot.path() + " -l", &out));
+    EXPECT_EQ(2, run(at + "2>/dev/null", &out));
+    EXPECT_EQ(0, run(at + "-l", &out));
     EXPECT_NE(std::string::npos, out.find("  test.dumped\n")) << out;
+    kelvo::ServiceControl::stopService(String16("test.dumped"));
 }
 
 } // namespace
