@@ -5,7 +5,9 @@
 //   watched with epoll, the wake-up primitive of libutils' Looper that every
 //   handler thread waits on;
 // - a request and its reply over a Unix stream socket pair between two
-//   threads, the medium of the host binder transport.
+//   threads, the medium of the host binder transport; and the same between
+//   two processes, as the binder benchmark's client and service are (a
+//   switch between processes costs more than one between threads).
 // BenchMain divides the handler and binder round trips by these.
 
 #include <benchmark/benchmark.h>
@@ -13,6 +15,7 @@
 #include <sys/epoll.h>
 #include <sys/eventfd.h>
 #include <sys/socket.h>
+#include <sys/wait.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -118,6 +121,13 @@ void BM_RawThreadPingPong(benchmark::State& state) {
 }
 BENCHMARK(BM_RawThreadPingPong)->Iterations(1)->UseRealTime();
 
+// A request the size of the binder bench's echo call (an int32 and an
+// int64); the reply is one int32.
+struct Request {
+    int32_t seq;
+    int64_t stamp;
+};
+
 // Reads exactly size bytes; false at the end of the stream or on an error.
 bool readFully(int fd, void* buffer, size_t size) {
     uint8_t* at = static_cast<uint8_t*>(buffer);
@@ -151,27 +161,36 @@ bool writeFully(int fd, const void* buffer, size_t size) {
     return true;
 }
 
-void BM_RawUnixSocketRoundTrip(benchmark::State& state) {
+// Answers each request with its sequence number plus one until the peer
+// closes.
+void serveEcho(int fd);
+
+// Request/reply round trips over a socket pair whose other end another
+// thread or a child process serves.
+void socketRoundTrips(benchmark::State& state, bool process, const char* figure) {
     int fds[2];
     if (socketpair(AF_UNIX, SOCK_STREAM | SOCK_CLOEXEC, 0, fds) != 0) {
         state.SkipWithError("no socket pair");
         return;
     }
-    // A request the size of the binder bench's echo call (an int32 and an
-    // int64); the reply is one int32.
-    struct Request {
-        int32_t seq;
-        int64_t stamp;
-    };
-    std::thread server([fd = fds[1]] {
-        Request request;
-        while (readFully(fd, &request, sizeof(request))) {
-            int32_t reply = request.seq + 1;
-            if (!writeFully(fd, &reply, sizeof(reply))) {
-                return;
-            }
+    std::thread server;
+    pid_t child = -1;
+    if (process) {
+        child = fork();
+        if (child == 0) {
+            close(fds[0]);
+            serveEcho(fds[1]);
+            _exit(0);
         }
-    });
+        if (child < 0) {
+            close(fds[0]);
+            close(fds[1]);
+            state.SkipWithError("no child");
+            return;
+        }
+    } else {
+        server = std::thread(serveEcho, fds[1]);
+    }
     std::vector<double> micros;
     micros.reserve(kRoundTrips);
     bool failed = false;
@@ -189,15 +208,38 @@ void BM_RawUnixSocketRoundTrip(benchmark::State& state) {
         }
     }
     shutdown(fds[0], SHUT_RDWR);
-    server.join();
+    if (child > 0) {
+        waitpid(child, nullptr, 0);
+    } else {
+        server.join();
+    }
     close(fds[0]);
     close(fds[1]);
     if (failed) {
         state.SkipWithError("round trip failed");
         return;
     }
-    state.counters["raw_unix_socket_roundtrip_us_p50"] = median(&micros);
+    state.counters[figure] = median(&micros);
+}
+
+void serveEcho(int fd) {
+    Request request;
+    while (readFully(fd, &request, sizeof(request))) {
+        int32_t reply = request.seq + 1;
+        if (!writeFully(fd, &reply, sizeof(reply))) {
+            return;
+        }
+    }
+}
+
+void BM_RawUnixSocketRoundTrip(benchmark::State& state) {
+    socketRoundTrips(state, false, "raw_unix_socket_roundtrip_us_p50");
 }
 BENCHMARK(BM_RawUnixSocketRoundTrip)->Iterations(1)->UseRealTime();
+
+void BM_RawUnixSocketProcessRoundTrip(benchmark::State& state) {
+    socketRoundTrips(state, true, "raw_unix_socket_process_roundtrip_us_p50");
+}
+BENCHMARK(BM_RawUnixSocketProcessRoundTrip)->Iterations(1)->UseRealTime();
 
 } // namespace
