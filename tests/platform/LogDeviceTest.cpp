@@ -6,12 +6,13 @@
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <algorithm>
 #include <cstring>
 #include <memory>
 #include <string>
 #include <thread>
 #include <vector>
+
+#include <android-base/unique_fd.h>
 
 #include "common/TestEnv.h"
 #include "core/LoggerRecord.h"
@@ -72,40 +73,21 @@ int runTool(const std::vector<std::string>& args) {
 
 class LogDeviceTest : public ::testing::Test {
 protected:
-    void SetUp() override {
-        mRoot.reset(new kelvo::test::TempRoot());
-        mPath = RootPath::resolve(KELVO_LOG_DEVICE);
-    }
-    void TearDown() override {
-        for (int fd : mReaders) {
-            close(fd);
-        }
-        mRoot.reset();
-    }
-    int openReader() {
-        int fd = LogDevice::openForReading(mPath.c_str());
-        if (fd >= 0) {
-            mReaders.push_back(fd);
-        }
-        return fd;
-    }
-    void closeReader(int fd) {
-        close(fd);
-        mReaders.erase(std::find(mReaders.begin(), mReaders.end(), fd));
+    // The host socket's reader, closed when it goes.
+    android::base::unique_fd openReader() {
+        return android::base::unique_fd(LogDevice::openForReading(mPath.c_str()));
     }
 
-    std::unique_ptr<kelvo::test::TempRoot> mRoot;
-    std::string mPath;
-    std::vector<int> mReaders;
+    std::unique_ptr<kelvo::test::TempRoot> mRoot = std::make_unique<kelvo::test::TempRoot>();
+    std::string mPath = RootPath::resolve(KELVO_LOG_DEVICE);
 };
 
 } // namespace
 
-TEST_F(LogDeviceTest, WrittenRecordsAreReadOneWholeRecordPerRead) {
-    int fd = openReader();
+TEST_F(LogDeviceTest, WrittenRecordsAreReadOneWholeRecordPerReadAndBadOnesRefused) {
+    android::base::unique_fd fd = openReader();
     ASSERT_GE(fd, 0) << strerror(errno);
     LogWriter writer(mPath);
-
     // Seconds above INT32_MAX: the field is unsigned.
     const int64_t kLate = 3000000000LL * 1000 + 123;
     ASSERT_EQ(
@@ -133,6 +115,27 @@ TEST_F(LogDeviceTest, WrittenRecordsAreReadOneWholeRecordPerRead) {
     ASSERT_TRUE(readRecord(fd, &third));
     EXPECT_GE(third.time / 1000, before);
     EXPECT_LE(third.time / 1000, time(nullptr));
+
+    // What a record cannot carry is refused and never reaches the reader;
+    // the last valid time does.
+    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, nullptr, "a=1"));
+    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", nullptr));
+    EXPECT_EQ(-EINVAL, writer.write(256, "KELVO_TAG_X", "a=1"));
+    EXPECT_EQ(-EINVAL, writer.write(-1, "KELVO_TAG_X", "a=1"));
+    const int64_t kLastMs = 4294967295LL * 1000 + 999;
+    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "a=1", kLastMs + 1));
+    // The payload length field has 16 bits: priority, two terminators and
+    // the tag leave this much for the text.
+    std::string tooLong(LogDevice::kMaxPayloadSize - 3 - strlen("KELVO_TAG_X") + 1, 'x');
+    EXPECT_EQ(-EMSGSIZE, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", tooLong.c_str()));
+    ASSERT_EQ(0, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "last", kLastMs));
+    ASSERT_TRUE(readRecord(fd, &third));
+    EXPECT_EQ("last", third.text);
+    EXPECT_EQ(kLastMs, third.time);
+    // Without a reader there is nothing to write to.
+    fd.reset();
+    ASSERT_EQ(0, unlink(mPath.c_str()));
+    EXPECT_EQ(-ENOENT, LogWriter(mPath).write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "a=1"));
 }
 
 // What the daemon sees through its reader, whatever stands behind the path.
@@ -177,36 +180,8 @@ TEST_F(LogDeviceTest, ReaderGivesWholeRecordsAndHidesTheHostSocket) {
     EXPECT_FALSE(reader.isOpen());
 }
 
-TEST_F(LogDeviceTest, WriterRefusesWhatARecordCannotCarry) {
-    // No reader yet: nothing to write to.
-    LogWriter writer(mPath);
-    EXPECT_EQ(-ENOENT, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "a=1"));
-
-    int fd = openReader();
-    ASSERT_GE(fd, 0);
-    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, nullptr, "a=1"));
-    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", nullptr));
-    EXPECT_EQ(-EINVAL, writer.write(256, "KELVO_TAG_X", "a=1"));
-    EXPECT_EQ(-EINVAL, writer.write(-1, "KELVO_TAG_X", "a=1"));
-    const int64_t kLastMs = 4294967295LL * 1000 + 999;
-    EXPECT_EQ(-EINVAL, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "a=1", kLastMs + 1));
-    // The payload length field has 16 bits: priority, two terminators and
-    // the tag leave this much for the text.
-    std::string tag = "KELVO_TAG_X";
-    std::string fits(LogDevice::kMaxPayloadSize - 3 - tag.size(), 'x');
-    std::string tooLong = fits + "x";
-    EXPECT_EQ(-EMSGSIZE, writer.write(LogWriter::PRIORITY_INFO, tag.c_str(), tooLong.c_str()));
-
-    // Nothing refused reached the reader; the last valid time did.
-    ASSERT_EQ(0, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "last", kLastMs));
-    Record record;
-    ASSERT_TRUE(readRecord(fd, &record));
-    EXPECT_EQ("last", record.text);
-    EXPECT_EQ(kLastMs, record.time);
-}
-
 TEST_F(LogDeviceTest, ReaderReplacesAStaleSocketButNotALiveReaderOrAnotherFile) {
-    int first = openReader();
+    android::base::unique_fd first = openReader();
     ASSERT_GE(first, 0);
     // A second reader while the first one lives is refused.
     EXPECT_EQ(-1, LogDevice::openForReading(mPath.c_str()));
@@ -219,16 +194,16 @@ TEST_F(LogDeviceTest, ReaderReplacesAStaleSocketButNotALiveReaderOrAnotherFile) 
     EXPECT_EQ("to first", record.text);
 
     // The first reader goes; its socket file stays behind, stale.
-    closeReader(first);
+    first.reset();
     EXPECT_TRUE(kelvo::test::hostPathExists(mPath));
     EXPECT_EQ(-ECONNREFUSED, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "lost"));
-    int second = openReader();
+    android::base::unique_fd second = openReader();
     ASSERT_GE(second, 0) << strerror(errno);
     // The writer finds the new reader by itself.
     ASSERT_EQ(0, writer.write(LogWriter::PRIORITY_INFO, "KELVO_TAG_X", "to second"));
     ASSERT_TRUE(readRecord(second, &record));
     EXPECT_EQ("to second", record.text);
-    closeReader(second);
+    second.reset();
 
     // A file of another kind is left alone.
     ASSERT_EQ(0, unlink(mPath.c_str()));
@@ -252,7 +227,7 @@ TEST_F(LogDeviceTest, KelvoLogToolWritesOneRecordToTheRootsDevice) {
     // No reader: nothing written.
     EXPECT_EQ(1, runTool({"-r", mRoot->path(), "KELVO_TAG_X", "a=1"}));
 
-    int fd = openReader();
+    android::base::unique_fd fd = openReader();
     ASSERT_GE(fd, 0);
     ASSERT_EQ(0, runTool({"-r", mRoot->path(), "-p", "w", "-t", "1234567", "KELVO_TAG_APP_WAKEUP",
                           "procname=com.example", "source=alarm", "gpio=-1"}));
@@ -280,7 +255,7 @@ TEST_F(LogDeviceTest, KelvoLogToolWritesOneRecordToTheRootsDevice) {
 }
 
 TEST_F(LogDeviceTest, AWriterWaitsForRoomAndCanBeToldHowLong) {
-    int fd = openReader();
+    android::base::unique_fd fd = openReader();
     ASSERT_GE(fd, 0);
     LogWriter writer(mPath);
     writer.setTimeout(100);

@@ -57,9 +57,6 @@ std::string toStd(const String8& s) {
 
 } // namespace
 
-// ---------------------------------------------------------------------------
-// The wire layout, byte by byte.
-
 TEST(ParcelLayoutTest, NumbersAreLittleEndianAndBoolIsAnInt32) {
     Parcel p;
     p.writeInt32(0x01020304);
@@ -153,9 +150,6 @@ TEST(ParcelLayoutTest, RawBlockPaddingIsZeroedEvenOverOldBytes) {
     EXPECT_EQ(16u, p.dataSize());
 }
 
-// ---------------------------------------------------------------------------
-// What is written reads back.
-
 TEST(ParcelRoundTripTest, EveryKindReadsBackInOrder) {
     const uint8_t raw[] = {0xde, 0xad, 0xbe, 0xef, 0x01, 0x02};
     String8 withNul("a\0b", 3);
@@ -209,10 +203,6 @@ TEST(ParcelRoundTripTest, EveryKindReadsBackInOrder) {
     EXPECT_EQ(0u, p.dataAvail());
 }
 
-// ---------------------------------------------------------------------------
-// Reads past the end: nothing is read from outside the buffer, the value
-// reads return zero or empty, the status reads report NOT_ENOUGH_DATA.
-
 TEST(ParcelReadPastEndTest, ShortReadsFailInPlace) {
     Parcel empty;
     Parcel tail;  // an int32, then three bytes
@@ -256,6 +246,16 @@ TEST(ParcelReadPastEndTest, ShortReadsFailInPlace) {
         EXPECT_EQ(nullptr, p.readInplace(SIZE_MAX));
         EXPECT_EQ(at, p.dataPosition());
     }
+    // Impossible lengths never wrap around the buffer's end.
+    Parcel eight;
+    load(&eight, ascii("abcdefgh"));
+    for (size_t len : {static_cast<size_t>(9), static_cast<size_t>(INT32_MAX) + 1, SIZE_MAX}) {
+        uint8_t out[16];
+        EXPECT_EQ(nullptr, eight.readInplace(len));
+        EXPECT_NE(android::NO_ERROR, eight.read(out, len));
+    }
+    EXPECT_EQ(android::BAD_VALUE, eight.read(nullptr, 4));
+    EXPECT_EQ(0u, eight.dataPosition());
     // Far positions are held at the largest parcel size, never wrap; back
     // inside, reading works again.
     EXPECT_GT(beyond.dataPosition(), beyond.dataSize());
@@ -274,10 +274,6 @@ TEST(ParcelReadPastEndTest, ShortReadsFailInPlace) {
     EXPECT_STREQ("xy", open.readCString());
     EXPECT_EQ(3u, open.dataPosition());
 }
-
-// ---------------------------------------------------------------------------
-// Malformed lengths: a bad string never reads outside the data and leaves the
-// cursor at its length word.
 
 TEST(ParcelMalformedTest, StringsWithBadLengthsAreRejected) {
     const Bytes hi = {0x68, 0, 0x69, 0};
@@ -330,25 +326,6 @@ TEST(ParcelMalformedTest, StringsWithBadLengthsAreRejected) {
     }
 }
 
-TEST(ParcelMalformedTest, RawReadsOfImpossibleLengths) {
-    Parcel p;
-    load(&p, ascii("abcdefgh"));
-    for (size_t len : {static_cast<size_t>(9), static_cast<size_t>(INT32_MAX),
-                       static_cast<size_t>(INT32_MAX) + 1, SIZE_MAX - 2, SIZE_MAX}) {
-        SCOPED_TRACE(len);
-        EXPECT_EQ(nullptr, p.readInplace(len));
-        EXPECT_EQ(0u, p.dataPosition());
-    }
-    uint8_t out[16];
-    EXPECT_EQ(android::NOT_ENOUGH_DATA, p.read(out, 9));
-    EXPECT_NE(android::NO_ERROR, p.read(out, SIZE_MAX));
-    EXPECT_EQ(android::BAD_VALUE, p.read(nullptr, 4));
-    EXPECT_EQ(0u, p.dataPosition());
-    // The whole buffer is still readable.
-    EXPECT_EQ(android::NO_ERROR, p.read(out, 8));
-    EXPECT_EQ(0, memcmp(out, "abcdefgh", 8));
-}
-
 TEST(ParcelMalformedTest, StringsAtAnOddPositionReadCleanly) {
     // A cursor moved to an odd offset must still give the bytes that are
     // there, without relying on the buffer's alignment.
@@ -374,10 +351,7 @@ TEST(ParcelMalformedTest, StringsAtAnOddPositionReadCleanly) {
     EXPECT_EQ(q.dataSize(), q.dataPosition());
 }
 
-// ---------------------------------------------------------------------------
-// Buffer management.
-
-TEST(ParcelBufferTest, AppendFromChecksTheRange) {
+TEST(ParcelBufferTest, AppendFromChecksTheRangeAndMayReadItself) {
     Parcel src;
     src.writeInt32(1);
     src.writeInt32(2);
@@ -404,9 +378,8 @@ TEST(ParcelBufferTest, AppendFromChecksTheRange) {
     dst.setDataPosition(4);
     EXPECT_EQ(android::NO_ERROR, dst.appendFrom(&src, 0, 12));
     EXPECT_EQ(cat({le32(9), le32(1), le32(2), le32(3)}), bytesOf(dst));
-}
 
-TEST(ParcelBufferTest, AppendFromItself) {
+    // From itself.
     Parcel p;
     load(&p, cat({le32(1), le32(2), le32(3)}));
     // The buffer is exactly full, so the append must grow it before copying.
@@ -456,7 +429,7 @@ TEST(ParcelBufferTest, SetDataSizeGrowsWithZeroesAndShrinksTheCursor) {
     EXPECT_EQ(12u, p.dataSize());
 }
 
-TEST(ParcelBufferTest, SetDataCopiesAndRejectsNull) {
+TEST(ParcelBufferTest, SetDataCopiesAndCapacityNeverCuts) {
     Parcel p;
     EXPECT_EQ(android::BAD_VALUE, p.setData(nullptr, 4));
     EXPECT_EQ(android::NO_ERROR, p.setData(nullptr, 0));
@@ -471,6 +444,16 @@ TEST(ParcelBufferTest, SetDataCopiesAndRejectsNull) {
     ASSERT_EQ(android::NO_ERROR, p.setData(p.data() + 4, 8));
     EXPECT_EQ(cat({le32(6), le32(7)}), bytesOf(p));
     EXPECT_EQ(0u, p.dataPosition());
+
+    // A smaller capacity never cuts data; freeData empties it for reuse.
+    ASSERT_EQ(android::NO_ERROR, p.setDataCapacity(4));
+    EXPECT_EQ(cat({le32(6), le32(7)}), bytesOf(p));
+    p.freeData();
+    EXPECT_EQ(nullptr, p.data());
+    EXPECT_EQ(0u, p.dataSize() + p.dataCapacity() + p.dataPosition() + p.dataAvail());
+    EXPECT_EQ(0u, p.readString8().size());
+    p.writeInt32(3);
+    EXPECT_EQ(le32(3), bytesOf(p));
 }
 
 TEST(ParcelBufferTest, WritesFromItsOwnBytesSurviveGrowth) {
@@ -502,24 +485,6 @@ TEST(ParcelBufferTest, WritesFromItsOwnBytesSurviveGrowth) {
     EXPECT_STREQ("hello", p.readCString());
     EXPECT_EQ(0u, p.dataAvail());
 }
-
-TEST(ParcelBufferTest, CapacityNeverCutsDataAndFreeDataEmptiesForReuse) {
-    Parcel p;
-    p.writeString8(String8("something"));
-    ASSERT_EQ(android::NO_ERROR, p.setDataCapacity(4));
-    EXPECT_EQ("something", (p.setDataPosition(0), toStd(p.readString8())));
-    p.freeData();
-    EXPECT_EQ(nullptr, p.data());
-    EXPECT_EQ(0u, p.dataSize() + p.dataCapacity() + p.dataPosition() + p.dataAvail());
-    EXPECT_EQ(0u, p.readString8().size());
-    p.freeData();
-
-    p.writeInt32(3);
-    EXPECT_EQ(le32(3), bytesOf(p));
-}
-
-// ---------------------------------------------------------------------------
-// The message record between threads.
 
 TEST(ParcelMessageTest, CopiesAndAssignmentsTakeTheBodyFromItsStart) {
     Parcel body;

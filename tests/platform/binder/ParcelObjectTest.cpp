@@ -31,18 +31,15 @@ std::string passThrough(int writeFd, int readFd, const char* text) {
     return n > 0 ? std::string(buf, static_cast<size_t>(n)) : std::string();
 }
 
-class Pipe {
-public:
-    Pipe() { EXPECT_EQ(0, pipe2(mFds, O_CLOEXEC)); }
+struct Pipe {
+    Pipe() { EXPECT_EQ(0, pipe2(fds, O_CLOEXEC)); }
     ~Pipe() {
-        close(mFds[0]);
-        close(mFds[1]);
+        close(fds[0]);
+        close(fds[1]);
     }
-    int in() const { return mFds[0]; }
-    int out() const { return mFds[1]; }
-
-private:
-    int mFds[2];
+    int in() const { return fds[0]; }
+    int out() const { return fds[1]; }
+    int fds[2];
 };
 
 } // namespace
@@ -118,7 +115,7 @@ TEST(ParcelObjectTest, DescriptorsAreOwnedCopies) {
     EXPECT_EQ(0u, bad.dataSize());
 }
 
-TEST(ParcelObjectTest, AppendFromCopiesTheObjectsInsideTheRange) {
+TEST(ParcelObjectTest, AppendFromAndMessagesCopyTheObjectsInsideTheRange) {
     Pipe pipe;
     sp<IBinder> binder = new BBinder();
     Parcel src;
@@ -156,6 +153,15 @@ TEST(ParcelObjectTest, AppendFromCopiesTheObjectsInsideTheRange) {
     self.setDataPosition(0);
     EXPECT_EQ(binder.get(), self.readStrongBinder().get());
     EXPECT_EQ(binder.get(), self.readStrongBinder().get());
+
+    // Messages between threads carry them too.
+    kelvo::ParcelMessage message(kelvo::MESSAGE_CUSTOMIZED, 1, src);
+    kelvo::ParcelMessage copy(message);
+    copy.getParcel().setDataPosition(4);
+    EXPECT_EQ(binder.get(), copy.getParcel().readStrongBinder().get());
+    fd = copy.getParcel().readFileDescriptor();
+    ASSERT_GE(fd, 0);
+    EXPECT_EQ("m", passThrough(fd, pipe.in(), "m"));
 }
 
 TEST(ParcelObjectTest, OverwritingShrinkingAndFreeingDropObjects) {
@@ -187,21 +193,6 @@ TEST(ParcelObjectTest, OverwritingShrinkingAndFreeingDropObjects) {
     p.freeData();
     EXPECT_FALSE(isOpen(fd));
     EXPECT_EQ(0u, p.objectsCount());
-}
-
-TEST(ParcelObjectTest, MessagesCarryTheirObjects) {
-    Pipe pipe;
-    sp<IBinder> binder = new BBinder();
-    Parcel body;
-    body.writeStrongBinder(binder);
-    body.writeFileDescriptor(pipe.out());
-    kelvo::ParcelMessage message(kelvo::MESSAGE_CUSTOMIZED, 1, body);
-    kelvo::ParcelMessage copy(message);
-    const Parcel& carried = copy.getParcel();
-    EXPECT_EQ(binder.get(), carried.readStrongBinder().get());
-    int fd = carried.readFileDescriptor();
-    ASSERT_GE(fd, 0);
-    EXPECT_EQ("m", passThrough(fd, pipe.in(), "m"));
 }
 
 TEST(ParcelObjectTest, InterfaceTokens) {
