@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <cutils/properties.h>
-#include <sys/stat.h>
 
 #include <climits>
 #include <cstring>
@@ -23,11 +22,6 @@ std::string get(const char* key, const char* defaultValue = nullptr) {
     int len = property_get(key, value, defaultValue);
     EXPECT_EQ(static_cast<size_t>(len), strlen(value)) << key;
     return value;
-}
-
-bool fileExists(const std::string& path) {
-    struct stat st;
-    return stat(path.c_str(), &st) == 0;
 }
 
 class PropertiesTest : public ::testing::Test {
@@ -152,7 +146,7 @@ TEST_F(PropertiesTest, PersistentValuesSurviveAReload) {
     ASSERT_EQ(0, property_set("persist.kelvo.test", "kept"));
     ASSERT_EQ(0, property_set("kelvo.test.memory", "lost"));
     EXPECT_EQ("kept", mRoot.readFile("/data/property/persist.kelvo.test"));
-    EXPECT_FALSE(fileExists(mRoot.path() + "/data/property/kelvo.test.memory"));
+    EXPECT_FALSE(kelvo::test::hostPathExists(mRoot.path() + "/data/property/kelvo.test.memory"));
 
     HostProperties::reload();
     EXPECT_EQ("kept", get("persist.kelvo.test"));
@@ -200,7 +194,7 @@ TEST_F(PropertiesTest, OverlongKeysAndValuesAreRefused) {
 
     // A refused persistent value leaves no file behind.
     EXPECT_EQ(-1, property_set("persist.kelvo.big", tooLongValue.c_str()));
-    EXPECT_FALSE(fileExists(mRoot.path() + "/data/property/persist.kelvo.big"));
+    EXPECT_FALSE(kelvo::test::hostPathExists(mRoot.path() + "/data/property/persist.kelvo.big"));
     HostProperties::reload();
     EXPECT_EQ("", get("persist.kelvo.big"));
 

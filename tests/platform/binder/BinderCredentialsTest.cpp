@@ -57,14 +57,21 @@ protected:
         android::PermissionCache::purge();
     }
 
-    // Runs body in a child of uid kAppUid; returns its exit status.
-    int asApp(const std::function<int()>& body) {
+    // Calls a service from a child of uid kAppUid that claims uid 0 in its
+    // data; returns what judge makes of the reply (10: the call failed).
+    int callAsApp(const char* name, uint32_t code, bool flag, int (*judge)(const Parcel&)) {
         pid_t pid = fork();
         if (pid == 0) {
             if (setgid(kAppUid) != 0 || setuid(kAppUid) != 0) {
                 _exit(100);
             }
-            _exit(body());
+            sp<IBinder> service = android::defaultServiceManager()->checkService(String16(name));
+            Parcel data;
+            Parcel reply;
+            data.writeBool(flag);
+            data.writeInt32(0);
+            bool called = service != nullptr && service->transact(code, data, &reply) == 0;
+            _exit(called ? judge(reply) : 10);
         }
         return kelvo::test::waitChild(pid);
     }
@@ -72,21 +79,8 @@ protected:
     // The guarded service's answer to a caller of uid kAppUid: 1 allowed,
     // 0 refused, anything else a failure.
     int appAllowed(bool cached) {
-        return asApp([cached] {
-            sp<IBinder> guarded =
-                android::defaultServiceManager()->checkService(String16("test.guarded"));
-            if (guarded == nullptr) {
-                return 10;
-            }
-            Parcel data;
-            Parcel reply;
-            data.writeBool(cached);
-            if (guarded->transact(IBinder::FIRST_CALL_TRANSACTION, data, &reply) !=
-                android::NO_ERROR) {
-                return 11;
-            }
-            return reply.readBool() ? 1 : 0;
-        });
+        return callAsApp("test.guarded", IBinder::FIRST_CALL_TRANSACTION, cached,
+                         [](const Parcel& reply) { return reply.readBool() ? 1 : 0; });
     }
 
     // Permission checks the fake permission service was asked.
@@ -100,27 +94,11 @@ TEST_F(BinderCredentialsTest, CallerIdentityIsTheKernelsNotTheCallersWord) {
     if (getuid() != 0) {
         GTEST_SKIP() << "needs root to call as another uid";
     }
-    // The child claims to be root in its data; the service sees its real uid.
-    int status = asApp([] {
-        sp<IBinder> who = android::defaultServiceManager()->checkService(String16("test.who"));
-        if (who == nullptr) {
-            return 10;
-        }
-        Parcel data;
-        Parcel reply;
-        data.writeInt32(0);
-        data.writeInt32(0);
-        if (who->transact(kelvo::test::kWhoCalls, data, &reply) != android::NO_ERROR) {
-            return 11;
-        }
+    // The service sees the child's real pid and uid.
+    EXPECT_EQ(0, callAsApp("test.who", kelvo::test::kWhoCalls, false, [](const Parcel& reply) {
         int32_t pid = reply.readInt32();
-        int32_t uid = reply.readInt32();
-        if (pid != getpid()) {
-            return 12;
-        }
-        return uid == static_cast<int32_t>(kAppUid) ? 0 : 13;
-    });
-    EXPECT_EQ(0, status);
+        return pid == getpid() && reply.readInt32() == static_cast<int32_t>(kAppUid) ? 0 : 13;
+    }));
 }
 
 TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionServiceAndCached) {

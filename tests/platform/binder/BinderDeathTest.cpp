@@ -149,34 +149,6 @@ TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
     EXPECT_FALSE(proxy->isBinderAlive());
 }
 
-TEST_F(BinderDeathTest, StoppedServiceOfThisProcessDies) {
-    sp<kelvo::test::TestService> service = new kelvo::test::TestService();
-    ASSERT_EQ(android::NO_ERROR,
-              android::defaultServiceManager()->addService(String16("test.local"), service));
-    sp<IBinder> proxy = android::defaultServiceManager()->getService(String16("test.local"));
-    ASSERT_NE(nullptr, proxy);
-    sp<DeathCounter> counter = new DeathCounter();
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(counter));
-    // Local objects never die.
-    EXPECT_EQ(android::INVALID_OPERATION, service->linkToDeath(counter));
-
-    EXPECT_EQ(android::NAME_NOT_FOUND,
-              kelvo::ServiceControl::stopService(String16("test.unknown")));
-    ASSERT_EQ(android::NO_ERROR, kelvo::ServiceControl::stopService(String16("test.local")));
-    ASSERT_TRUE(
-        kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
-    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 1));
-    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.local")));
-
-    // Registered again, it answers through a new proxy.
-    ASSERT_EQ(android::NO_ERROR,
-              android::defaultServiceManager()->addService(String16("test.local"), service));
-    sp<IBinder> again = android::defaultServiceManager()->checkService(String16("test.local"));
-    ASSERT_NE(nullptr, again);
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(again, 1));
-    kelvo::ServiceControl::stopService(String16("test.local"));
-}
-
 // Many threads call several services while one of them dies and comes back:
 // every call is answered or fails as dead, nothing hangs or crashes.
 constexpr int kThreads = 8;

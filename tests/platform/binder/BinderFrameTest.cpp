@@ -22,22 +22,22 @@ namespace {
 
 constexpr uint32_t kMagic = 0x3146424b;
 
-void put32(Bytes* b, uint32_t v) {
-    for (int i = 0; i < 4; ++i) {
-        b->push_back(static_cast<uint8_t>(v >> (8 * i)));
+// Little-endian 32-bit words.
+Bytes words(std::initializer_list<uint32_t> values) {
+    Bytes b;
+    for (uint32_t v : values) {
+        for (int i = 0; i < 4; ++i) {
+            b.push_back(static_cast<uint8_t>(v >> (8 * i)));
+        }
     }
+    return b;
 }
 
 Bytes header(uint16_t kind, uint32_t code, uint32_t flags, uint64_t target, uint32_t dataSize,
              uint32_t tableSize, uint32_t magic = kMagic) {
-    Bytes b;
     // The kind takes the low half of its word, the high half is reserved.
-    for (uint32_t word : {magic, static_cast<uint32_t>(kind), code, flags,
-                          static_cast<uint32_t>(target), static_cast<uint32_t>(target >> 32),
-                          dataSize, tableSize}) {
-        put32(&b, word);
-    }
-    return b;
+    return words({magic, kind, code, flags, static_cast<uint32_t>(target),
+                  static_cast<uint32_t>(target >> 32), dataSize, tableSize});
 }
 
 // A 32-bit field of a frame read from the server.
@@ -183,25 +183,16 @@ TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
     const uint32_t binderSlot = 0x4b424e44;
     memcpy(slotData.data(), &binderSlot, 4);
     auto binderEntry = [](uint32_t offset, const std::string& name, uint32_t nameLen) {
-        Bytes t;
-        put32(&t, 1);
-        put32(&t, offset);
-        for (uint32_t word : {1u, 1u, 0u, 1u, 0u, nameLen}) {  // binder, two 64-bit ids
-            put32(&t, word);
-        }
+        // One entry: a binder at the offset, its two 64-bit ids, its name.
+        Bytes t = words({1, offset, 1, 1, 0, 1, 0, nameLen});
         t.insert(t.end(), name.begin(), name.end());
         while (t.size() % 4 != 0) {
             t.push_back(0);
         }
         return t;
     };
-    Bytes fdEntry;
-    put32(&fdEntry, 1);
-    put32(&fdEntry, 0);
-    put32(&fdEntry, 2);  // a descriptor, but none is sent
-    Bytes countTooBig;
-    put32(&countTooBig, 1000000);
-    put32(&countTooBig, 0);
+    Bytes fdEntry = words({1, 0, 2});  // a descriptor, but none is sent
+    Bytes countTooBig = words({1000000, 0});
 
     struct Case {
         const char* what;
