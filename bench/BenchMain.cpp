@@ -7,9 +7,9 @@
 // named otherwise stay internal. The usual --benchmark_filter=<regex> selects
 // benchmarks.
 //
-// Two figures are ratios of figures of the same run: a round trip over the
-// physical floor of its hand-over (see FloorBench.cpp). They are printed last,
-// when both of their figures ran.
+// Some figures are ratios of two figures of the same run: a round trip over
+// the physical floor of its hand-over, measured alongside it (HandlerBench,
+// BinderBench). They are printed last, when both of their figures ran.
 
 #include <benchmark/benchmark.h>
 
