@@ -6,15 +6,35 @@
 // itself (medians, rates over its own clock) and stores them there; counters
 // named otherwise stay internal. The usual --benchmark_filter=<regex> selects
 // benchmarks.
+//
+// Some figures are ratios of two figures of the same run: a round trip over
+// the physical floor of its hand-over, measured alongside it (HandlerBench,
+// BinderBench). They are printed last, when both of their figures ran.
 
 #include <benchmark/benchmark.h>
 
 #include <cmath>
 #include <cstdio>
+#include <map>
 #include <string>
 #include <vector>
 
 namespace {
+
+struct Ratio {
+    const char* name;
+    const char* numerator;
+    const char* denominator;
+};
+
+constexpr Ratio kRatios[] = {
+        {"handler_sync_vs_raw_ratio", "handler_sync_roundtrip_us_p50",
+         "raw_thread_pingpong_us_p50"},
+        {"binder_vs_raw_socket_ratio", "binder_roundtrip_us_p50",
+         "raw_unix_socket_roundtrip_us_p50"},
+        {"binder_vs_raw_process_socket_ratio", "binder_roundtrip_us_p50",
+         "raw_unix_socket_process_roundtrip_us_p50"},
+};
 
 bool isFigureName(const std::string& name) {
     if (name.empty() || name[0] < 'a' || name[0] > 'z' || name.find('_') == std::string::npos) {
@@ -57,10 +77,20 @@ public:
             }
             for (const auto& counter : run.counters) {
                 if (isFigureName(counter.first)) {
-                    printf("%s %s\n", counter.first.c_str(),
-                           formatValue(counter.second.value).c_str());
-                    fflush(stdout);
+                    print(counter.first, counter.second.value);
+                    mFigures[counter.first] = counter.second.value;
                 }
+            }
+        }
+    }
+
+    void printRatios() const {
+        for (const Ratio& ratio : kRatios) {
+            auto numerator = mFigures.find(ratio.numerator);
+            auto denominator = mFigures.find(ratio.denominator);
+            if (numerator != mFigures.end() && denominator != mFigures.end() &&
+                denominator->second > 0) {
+                print(ratio.name, numerator->second / denominator->second);
             }
         }
     }
@@ -68,7 +98,13 @@ public:
     bool failed() const { return mFailed; }
 
 private:
+    static void print(const std::string& name, double value) {
+        printf("%s %s\n", name.c_str(), formatValue(value).c_str());
+        fflush(stdout);
+    }
+
     bool mFailed = false;
+    std::map<std::string, double> mFigures;
 };
 
 } // namespace
@@ -80,6 +116,7 @@ int main(int argc, char** argv) {
     }
     FigureReporter reporter;
     size_t ran = benchmark::RunSpecifiedBenchmarks(&reporter);
+    reporter.printRatios();
     benchmark::Shutdown();
     if (ran == 0) {
         fprintf(stderr, "no benchmark matched\n");

@@ -1,6 +1,8 @@
 // The host binder transport between two processes: the median round trip
-// of a small two-way transaction, and the rate of one-way calls a service
-// takes in. The service runs in a forked child on a private root.
+// of a small two-way transaction, next to the floors of a socket round trip
+// between two threads and between two processes measured in the same
+// stretch of time, and the rate of one-way calls a service takes in. The
+// service runs in a forked child on a private root.
 
 #include <benchmark/benchmark.h>
 #include <binder/Binder.h>
@@ -18,6 +20,7 @@
 #include <thread>
 #include <vector>
 
+#include "SocketEcho.h"
 #include "kelvo/RootPath.h"
 
 using android::IBinder;
@@ -94,18 +97,40 @@ private:
     sp<IBinder> mService;
 };
 
+double median(std::vector<double>* values) {
+    std::nth_element(values->begin(), values->begin() + values->size() / 2, values->end());
+    return (*values)[values->size() / 2];
+}
+
 void BM_BinderRoundTrip(benchmark::State& state) {
     RemoteService remote;
     if (remote.service() == nullptr) {
         state.SkipWithError("no bench service");
         return;
     }
+    SocketEcho threadFloor(false);
+    SocketEcho processFloor(true);
+    if (!threadFloor.ok() || !processFloor.ok()) {
+        state.SkipWithError("no socket floor");
+        return;
+    }
     constexpr int kWarmUp = 500;
     constexpr int kCalls = 20000;
+    // Blocks of calls alternate with blocks of socket round trips, so that
+    // all medians see the same wake-up latencies.
+    constexpr int kBlock = 500;
     std::vector<double> micros;
+    std::vector<double> threadMicros;
+    std::vector<double> processMicros;
     micros.reserve(kCalls);
     for (auto _ : state) {
         for (int i = 0; i < kWarmUp + kCalls; ++i) {
+            if (i >= kWarmUp && (i - kWarmUp) % kBlock == 0) {
+                for (int j = 0; j < kBlock; ++j) {
+                    threadMicros.push_back(threadFloor.roundTripUs());
+                    processMicros.push_back(processFloor.roundTripUs());
+                }
+            }
             Parcel data;
             Parcel reply;
             data.writeInt32(i);
@@ -122,8 +147,15 @@ void BM_BinderRoundTrip(benchmark::State& state) {
             }
         }
     }
-    std::nth_element(micros.begin(), micros.begin() + micros.size() / 2, micros.end());
-    state.counters["binder_roundtrip_us_p50"] = micros[micros.size() / 2];
+    for (const std::vector<double>* floor : {&threadMicros, &processMicros}) {
+        if (*std::min_element(floor->begin(), floor->end()) < 0) {
+            state.SkipWithError("socket round trip failed");
+            return;
+        }
+    }
+    state.counters["binder_roundtrip_us_p50"] = median(&micros);
+    state.counters["raw_unix_socket_roundtrip_us_p50"] = median(&threadMicros);
+    state.counters["raw_unix_socket_process_roundtrip_us_p50"] = median(&processMicros);
 }
 BENCHMARK(BM_BinderRoundTrip)->Iterations(1)->UseRealTime();
 

@@ -1,5 +1,6 @@
 // Message passing through HandlerThread: asynchronous throughput and the
-// round trip of a synchronous request with a reply.
+// round trip of a synchronous request with a reply, next to the floor of a
+// hand-over between two threads measured in the same stretch of time.
 
 #include <benchmark/benchmark.h>
 
@@ -12,6 +13,7 @@
 
 #include <binder/Parcel.h>
 
+#include "ThreadPingPong.h"
 #include "utils/HandlerThread.h"
 #include "utils/ParcelMessage.h"
 
@@ -121,19 +123,31 @@ BENCHMARK(BM_HandlerAsyncThroughput)
         ->UseRealTime()
         ->Unit(benchmark::kMillisecond);
 
+// Blocks of synchronous round trips alternate with blocks of the raw
+// ping-pong, so that both medians see the same wake-up latencies (on a
+// shared machine they move between runs, and even within one).
 void BM_HandlerSyncRoundTrip(benchmark::State& state) {
     constexpr int kRoundTrips = 5000;
+    constexpr int kBlock = 250;
 
     android::sp<CountingThread> thread = new CountingThread();
-    if (!warmUp(thread.get())) {
-        state.SkipWithError("handler thread did not answer");
+    ThreadPingPong floor;
+    if (!warmUp(thread.get()) || !floor.ok()) {
+        state.SkipWithError("handler thread or ping-pong did not answer");
         stop(thread);
         return;
     }
     std::vector<double> micros;
+    std::vector<double> floorMicros;
     micros.reserve(kRoundTrips);
+    floorMicros.reserve(kRoundTrips);
     for (auto _ : state) {
         for (int i = 1; i <= kRoundTrips; ++i) {
+            if (i % kBlock == 1) {
+                for (int j = 0; j < kBlock; ++j) {
+                    floorMicros.push_back(floor.roundTripUs());
+                }
+            }
             Parcel reply;
             ParcelMessage msg = makeMessage(i, &reply);
             Clock::time_point start = Clock::now();
@@ -149,6 +163,7 @@ void BM_HandlerSyncRoundTrip(benchmark::State& state) {
     }
     stop(thread);
     state.counters["handler_sync_roundtrip_us_p50"] = median(micros);
+    state.counters["raw_thread_pingpong_us_p50"] = median(floorMicros);
 }
 BENCHMARK(BM_HandlerSyncRoundTrip)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
 

@@ -1,10 +1,11 @@
 #include "core/AppsAccounting.h"
 
+#include <powerlog/powerlog.h>
+
 #include <cinttypes>
 #include <vector>
 
 #include "KelvoLog.h"
-#include "kelvo/PowerLog.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/PackageProperty.h"

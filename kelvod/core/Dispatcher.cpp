@@ -2,9 +2,6 @@
 
 #include <binder/Parcel.h>
 #include <errno.h>
-#include <sys/socket.h>
-#include <sys/stat.h>
-#include <unistd.h>
 
 #include <cstring>
 #include <string_view>
@@ -16,8 +13,6 @@
 #include "core/DispatcherThread.h"
 #include "core/KelvoOperator.h"
 #include "core/LoggerRecord.h"
-#include "kelvo/LogDevice.h"
-#include "kelvo/RootPath.h"
 
 namespace kelvo {
 
@@ -55,37 +50,21 @@ void Dispatcher::resetForTest() {
 }
 
 Dispatcher::Dispatcher()
-    : mFd(-1),
-      mDatagram(false),
-      mStopping(false),
-      mLogCount(0),
-      mMalformedSinceSummary(0),
-      mLastMalformedSummaryNs(0) {
+    : mStopping(false), mLogCount(0), mMalformedSinceSummary(0), mLastMalformedSummaryNs(0) {
     memset(mBuffer, 0, sizeof(mBuffer));
-    std::string path = RootPath::resolve(KELVO_LOG_DEVICE);
-    mFd = LogDevice::openForReading(path.c_str());
-    if (mFd < 0) {
+    if (mReader.open(KELVO_LOG_DEVICE) < 0) {
         int err = errno;
-        KLOGE("Failed to open %s: %s", path.c_str(), strerror(err));
+        KLOGE("Failed to open %s: %s", mReader.getPath().c_str(), strerror(err));
         return;
     }
-    struct stat st;
-    mDatagram = fstat(mFd, &st) == 0 && S_ISSOCK(st.st_mode);
     mThread = new DispatcherThread(this);
 }
 
-Dispatcher::~Dispatcher() {
-    if (mFd >= 0) {
-        close(mFd);
-    }
-}
+Dispatcher::~Dispatcher() = default;
 
 void Dispatcher::closeDevice() {
     std::lock_guard<std::mutex> guard(mLock);
-    if (mFd >= 0) {
-        close(mFd);
-        mFd = -1;
-    }
+    mReader.close();
 }
 
 void Dispatcher::stop() {
@@ -99,11 +78,8 @@ void Dispatcher::stop() {
         mStopping.store(true);
         if (thread != nullptr) {
             thread->requestExit();
-            // Wakes a blocked read at once; a character device is left to
-            // its next record.
-            if (mDatagram && mFd >= 0) {
-                shutdown(mFd, SHUT_RDWR);
-            }
+            // Wakes a blocked read at once where the device allows it.
+            mReader.interrupt();
         }
     }
     if (thread != nullptr) {
@@ -132,7 +108,7 @@ int32_t Dispatcher::registerTag(const dispatcher_tag& tag,
 int32_t Dispatcher::startDispatchMessage() {
     std::lock_guard<std::mutex> guard(mLock);
     // No device, or it was closed when the thread ended for good.
-    if (mThread == nullptr || mFd < 0) {
+    if (mThread == nullptr || !mReader.isOpen()) {
         return -2;
     }
     if (!mThread->isRunning() && mThread->run("Dispatcher", kThreadPriority) != android::OK) {
@@ -146,15 +122,12 @@ uint32_t Dispatcher::getLogCount() {
 }
 
 int32_t Dispatcher::readLoggerMessage() {
-    ssize_t n;
-    do {
-        n = read(mFd, mBuffer, kMaxRecordSize);
-    } while (n < 0 && errno == EINTR);
+    ssize_t n = mReader.read(mBuffer, kMaxRecordSize);
     if (mStopping.load()) {
         return 1;
     }
-    if (n < 0 || (n == 0 && !mDatagram)) {
-        int err = n < 0 ? errno : ENODATA;
+    if (n < 0) {
+        int err = errno;
         KLOGE("Failed to read log device: %s", strerror(err));
         return -14;
     }

@@ -11,6 +11,8 @@
 #include <mutex>
 #include <string>
 
+#include "kelvo/LogDeviceReader.h"
+
 namespace kelvo {
 
 class DispatcherThread;
@@ -89,12 +91,9 @@ private:
     // up at most once a minute.
     void noteMalformedRecord(size_t size);
 
-    // Written under mLock once the thread has started; read without it only
+    // Closed under mLock once the thread has started; read without it only
     // by the thread itself.
-    int mFd;
-    // A datagram socket stands in for the device on the host: an empty read
-    // is then an empty record, not the end of the device.
-    bool mDatagram;
+    LogDeviceReader mReader;
     std::atomic<bool> mStopping;
     std::atomic<uint32_t> mLogCount;
     // Only the dispatcher thread touches these.

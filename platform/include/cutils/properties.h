@@ -22,7 +22,6 @@ int8_t property_get_bool(const char* key, int8_t default_value);
 int64_t property_get_int64(const char* key, int64_t default_value);
 int32_t property_get_int32(const char* key, int32_t default_value);
 int property_set(const char* key, const char* value);
-int property_list(void (*propfn)(const char* key, const char* value, void* cookie), void* cookie);
 
 #ifdef __cplusplus
 }

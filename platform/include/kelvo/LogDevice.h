@@ -3,8 +3,7 @@
 #include <stddef.h>
 #include <stdint.h>
 
-// The device path of the kernel's log device for the daemon's events.
-#define KELVO_LOG_DEVICE "/dev/tvlog_kelvo"
+#include "kelvo/LogDeviceReader.h"
 
 namespace kelvo {
 
@@ -23,7 +22,8 @@ namespace kelvo {
 // no character device is there, the reader binds a Unix datagram socket at
 // the path and every datagram is one record: writers need no connection, many
 // may write at once, and a writer blocks while the reader's queue is full, so
-// nothing is dropped.
+// nothing is dropped. The daemon reads through LogDeviceReader, which hides
+// which of the two it is.
 class LogDevice {
 public:
     static constexpr size_t kHeaderSize = 20;

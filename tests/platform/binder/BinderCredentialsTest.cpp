@@ -6,10 +6,10 @@
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 
-#include <map>
-#include <mutex>
-#include <utility>
+#include <memory>
 
+#include "FakePermissionService.h"
+#include "PlatformState.h"
 #include "common/TestEnv.h"
 #include "platform/binder/BinderTestUtil.h"
 
@@ -22,44 +22,6 @@ namespace {
 
 constexpr uid_t kAppUid = 10123;
 const char kDump[] = "android.permission.DUMP";
-
-// Answers the permission check from a table of grants; counts the questions.
-class FakePermissionService : public android::BBinder {
-public:
-    void grant(const char* permission, uid_t uid, bool granted) {
-        std::lock_guard<std::mutex> guard(mLock);
-        mGrants[{permission, uid}] = granted;
-    }
-    int asked() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mAsked;
-    }
-
-protected:
-    android::status_t onTransact(uint32_t code, const Parcel& data, Parcel* reply,
-                                 uint32_t flags) override {
-        if (code != IBinder::FIRST_CALL_TRANSACTION) {
-            return BBinder::onTransact(code, data, reply, flags);
-        }
-        if (!data.enforceInterface(String16("android.os.IPermissionController"))) {
-            return android::PERMISSION_DENIED;
-        }
-        std::string permission = android::String8(data.readString16()).string();
-        data.readInt32();  // pid
-        uid_t uid = static_cast<uid_t>(data.readInt32());
-        std::lock_guard<std::mutex> guard(mLock);
-        mAsked++;
-        auto it = mGrants.find({permission, uid});
-        reply->writeNoException();
-        reply->writeInt32(it != mGrants.end() && it->second ? 1 : 0);
-        return android::NO_ERROR;
-    }
-
-private:
-    std::mutex mLock;
-    std::map<std::pair<std::string, uid_t>, bool> mGrants;
-    int mAsked = 0;
-};
 
 // Answers kEcho only to callers holding the permission (checked through
 // the cache when cached is set).
@@ -81,9 +43,9 @@ protected:
         // A child of another uid must reach the sockets below the root.
         chmod(mRoot.path().c_str(), 0755);
         android::PermissionCache::purge();
-        mPermissions = new FakePermissionService();
         auto sm = android::defaultServiceManager();
-        ASSERT_EQ(android::NO_ERROR, sm->addService(String16("permission"), mPermissions));
+        ASSERT_EQ(android::NO_ERROR, sm->addService(String16("permission"),
+                                                    new kelvo::FakePermissionService(mState)));
         ASSERT_EQ(android::NO_ERROR, sm->addService(String16("test.guarded"), new GuardedService()));
         ASSERT_EQ(android::NO_ERROR,
                   sm->addService(String16("test.who"), new kelvo::test::TestService()));
@@ -95,14 +57,21 @@ protected:
         android::PermissionCache::purge();
     }
 
-    // Runs body in a child of uid kAppUid; returns its exit status.
-    int asApp(const std::function<int()>& body) {
+    // Calls a service from a child of uid kAppUid that claims uid 0 in its
+    // data; returns what judge makes of the reply (10: the call failed).
+    int callAsApp(const char* name, uint32_t code, bool flag, int (*judge)(const Parcel&)) {
         pid_t pid = fork();
         if (pid == 0) {
             if (setgid(kAppUid) != 0 || setuid(kAppUid) != 0) {
                 _exit(100);
             }
-            _exit(body());
+            sp<IBinder> service = android::defaultServiceManager()->checkService(String16(name));
+            Parcel data;
+            Parcel reply;
+            data.writeBool(flag);
+            data.writeInt32(0);
+            bool called = service != nullptr && service->transact(code, data, &reply) == 0;
+            _exit(called ? judge(reply) : 10);
         }
         return kelvo::test::waitChild(pid);
     }
@@ -110,88 +79,55 @@ protected:
     // The guarded service's answer to a caller of uid kAppUid: 1 allowed,
     // 0 refused, anything else a failure.
     int appAllowed(bool cached) {
-        return asApp([cached] {
-            sp<IBinder> guarded =
-                android::defaultServiceManager()->checkService(String16("test.guarded"));
-            if (guarded == nullptr) {
-                return 10;
-            }
-            Parcel data;
-            Parcel reply;
-            data.writeBool(cached);
-            if (guarded->transact(IBinder::FIRST_CALL_TRANSACTION, data, &reply) !=
-                android::NO_ERROR) {
-                return 11;
-            }
-            return reply.readBool() ? 1 : 0;
-        });
+        return callAsApp("test.guarded", IBinder::FIRST_CALL_TRANSACTION, cached,
+                         [](const Parcel& reply) { return reply.readBool() ? 1 : 0; });
     }
 
+    // Permission checks the fake permission service was asked.
+    int asked() { return mState->calls("permission", IBinder::FIRST_CALL_TRANSACTION); }
+
     kelvo::test::TempRoot mRoot;
-    sp<FakePermissionService> mPermissions;
+    std::shared_ptr<kelvo::PlatformState> mState = std::make_shared<kelvo::PlatformState>();
 };
 
 TEST_F(BinderCredentialsTest, CallerIdentityIsTheKernelsNotTheCallersWord) {
     if (getuid() != 0) {
         GTEST_SKIP() << "needs root to call as another uid";
     }
-    // The child claims to be root in its data; the service sees its real uid.
-    int status = asApp([] {
-        sp<IBinder> who = android::defaultServiceManager()->checkService(String16("test.who"));
-        if (who == nullptr) {
-            return 10;
-        }
-        Parcel data;
-        Parcel reply;
-        data.writeInt32(0);
-        data.writeInt32(0);
-        if (who->transact(kelvo::test::kWhoCalls, data, &reply) != android::NO_ERROR) {
-            return 11;
-        }
+    // The service sees the child's real pid and uid.
+    EXPECT_EQ(0, callAsApp("test.who", kelvo::test::kWhoCalls, false, [](const Parcel& reply) {
         int32_t pid = reply.readInt32();
-        int32_t uid = reply.readInt32();
-        if (pid != getpid()) {
-            return 12;
-        }
-        return uid == static_cast<int32_t>(kAppUid) ? 0 : 13;
-    });
-    EXPECT_EQ(0, status);
+        return pid == getpid() && reply.readInt32() == static_cast<int32_t>(kAppUid) ? 0 : 13;
+    }));
 }
 
-TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionService) {
+TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionServiceAndCached) {
     if (getuid() != 0) {
         GTEST_SKIP() << "needs root to call as another uid";
     }
     EXPECT_EQ(0, appAllowed(false));
-    EXPECT_EQ(1, mPermissions->asked());
-    mPermissions->grant(kDump, kAppUid, true);
+    EXPECT_EQ(1, asked());
+    mState->grant(kDump, kAppUid, true);
     EXPECT_EQ(1, appAllowed(false));
     // Another permission, or another uid, is not granted by it.
     EXPECT_FALSE(android::checkPermission(String16("android.permission.OTHER"), 1, kAppUid));
     EXPECT_FALSE(android::checkPermission(String16(kDump), 1, kAppUid + 1));
     // Root and this very process never need asking.
-    int before = mPermissions->asked();
+    int before = asked();
     EXPECT_TRUE(android::checkPermission(String16(kDump), 1, 0));
     EXPECT_TRUE(android::checkPermission(String16(kDump), getpid(), kAppUid + 1));
-    EXPECT_EQ(before, mPermissions->asked());
-}
+    EXPECT_EQ(before, asked());
 
-TEST_F(BinderCredentialsTest, CacheRemembersGrantsUntilPurged) {
-    if (getuid() != 0) {
-        GTEST_SKIP() << "needs root to call as another uid";
-    }
-    // Refusals are asked again each time.
+    // The cache asks again after a refusal, and remembers a grant even once
+    // revoked, until it is purged.
+    mState->grant(kDump, kAppUid, false);
     EXPECT_EQ(0, appAllowed(true));
-    EXPECT_EQ(0, appAllowed(true));
-    EXPECT_EQ(2, mPermissions->asked());
-    mPermissions->grant(kDump, kAppUid, true);
+    EXPECT_EQ(before + 1, asked());
+    mState->grant(kDump, kAppUid, true);
     EXPECT_EQ(1, appAllowed(true));
-    EXPECT_EQ(3, mPermissions->asked());
-    // A grant is remembered, even once revoked...
-    mPermissions->grant(kDump, kAppUid, false);
+    mState->grant(kDump, kAppUid, false);
     EXPECT_EQ(1, appAllowed(true));
-    EXPECT_EQ(3, mPermissions->asked());
-    // ...until the cache is purged.
+    EXPECT_EQ(before + 2, asked());
     android::PermissionCache::purge();
     EXPECT_EQ(0, appAllowed(true));
 }

@@ -1,8 +1,14 @@
+// Deaths of services and of the processes that serve them, also under load.
+
 #include <gtest/gtest.h>
 
+#include <atomic>
 #include <chrono>
 #include <future>
+#include <mutex>
+#include <string>
 #include <thread>
+#include <vector>
 
 #include "common/TestEnv.h"
 #include "platform/binder/BinderTestUtil.h"
@@ -50,8 +56,16 @@ TEST_F(BinderDeathTest, DeathIsToldOnceOnTheDeathThread) {
     ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 1));
     sp<DeathCounter> first = new DeathCounter();
     sp<DeathCounter> second = new DeathCounter();
+    sp<DeathCounter> dropped = new DeathCounter();
     ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(first));
     ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(second, reinterpret_cast<void*>(2)));
+    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(dropped, reinterpret_cast<void*>(7)));
+    // An unlinked recipient is not told; the cookie is part of the link.
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped));
+    android::wp<IBinder::DeathRecipient> out;
+    EXPECT_EQ(android::NO_ERROR, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7), 0, &out));
+    EXPECT_EQ(dropped.get(), out.promote().get());
+    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7)));
 
     killRemote();
     ASSERT_TRUE(kelvo::test::waitFor([&] { return first->count() > 0 && second->count() > 0; },
@@ -76,6 +90,7 @@ TEST_F(BinderDeathTest, DeathIsToldOnceOnTheDeathThread) {
     EXPECT_EQ(1, first->count());
     EXPECT_EQ(1, second->count());
     EXPECT_EQ(0, late->count());
+    EXPECT_EQ(0, dropped->count());
 }
 
 TEST_F(BinderDeathTest, DeathDuringACallFailsTheCall) {
@@ -102,46 +117,6 @@ TEST_F(BinderDeathTest, DeathDuringACallFailsTheCall) {
         kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
 }
 
-TEST_F(BinderDeathTest, UnlinkedRecipientIsNotTold) {
-    sp<IBinder> proxy = startRemote();
-    ASSERT_NE(nullptr, proxy);
-    sp<DeathCounter> kept = new DeathCounter();
-    sp<DeathCounter> dropped = new DeathCounter();
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(kept));
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(dropped, reinterpret_cast<void*>(7)));
-    // The cookie is part of the link.
-    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped));
-    android::wp<IBinder::DeathRecipient> out;
-    EXPECT_EQ(android::NO_ERROR, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7), 0, &out));
-    EXPECT_EQ(dropped.get(), out.promote().get());
-    EXPECT_EQ(android::NAME_NOT_FOUND, proxy->unlinkToDeath(dropped, reinterpret_cast<void*>(7)));
-
-    killRemote();
-    // The kept link shows when the death has been told.
-    ASSERT_TRUE(kelvo::test::waitFor([&] { return kept->count() == 1; }, std::chrono::seconds(10)));
-    EXPECT_EQ(0, dropped->count());
-}
-
-TEST_F(BinderDeathTest, RestartedServiceIsAnotherObject) {
-    sp<IBinder> before = startRemote();
-    ASSERT_NE(nullptr, before);
-    ASSERT_EQ(android::NO_ERROR, kelvo::test::echo(before, 1));
-    killRemote();
-    // A dead server's socket is no service.
-    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.remote")));
-
-    sp<IBinder> after = startRemote();
-    ASSERT_NE(nullptr, after);
-    EXPECT_NE(before.get(), after.get());
-    int32_t answer = 0;
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(after, 4, &answer));
-    EXPECT_EQ(5, answer);
-    // The old proxy never reaches the new server.
-    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(before, 1));
-    EXPECT_FALSE(before->isBinderAlive());
-    EXPECT_TRUE(after->isBinderAlive());
-}
-
 TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
     sp<IBinder> proxy = startRemote();
     ASSERT_NE(nullptr, proxy);
@@ -163,34 +138,124 @@ TEST_F(BinderDeathTest, ObjectsOfADeadProcessDieWithIt) {
     ASSERT_TRUE(
         kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
     EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(object, 1));
+    // A dead server's socket is no service; a restarted one is another
+    // object, which the old proxy never reaches.
+    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.remote")));
+    sp<IBinder> after = startRemote();
+    ASSERT_NE(nullptr, after);
+    EXPECT_NE(proxy.get(), after.get());
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(after, 4));
+    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 1));
+    EXPECT_FALSE(proxy->isBinderAlive());
 }
 
-TEST_F(BinderDeathTest, StoppedServiceOfThisProcessDies) {
-    sp<kelvo::test::TestService> service = new kelvo::test::TestService();
-    ASSERT_EQ(android::NO_ERROR,
-              android::defaultServiceManager()->addService(String16("test.local"), service));
-    sp<IBinder> proxy = android::defaultServiceManager()->getService(String16("test.local"));
-    ASSERT_NE(nullptr, proxy);
-    sp<DeathCounter> counter = new DeathCounter();
-    ASSERT_EQ(android::NO_ERROR, proxy->linkToDeath(counter));
-    // Local objects never die.
-    EXPECT_EQ(android::INVALID_OPERATION, service->linkToDeath(counter));
+// Many threads call several services while one of them dies and comes back:
+// every call is answered or fails as dead, nothing hangs or crashes.
+constexpr int kThreads = 8;
+constexpr int kRestarts = 6;
+const char* const kServices[] = {"stress.local.a", "stress.local.b", "stress.remote"};
 
-    EXPECT_EQ(android::NAME_NOT_FOUND,
-              kelvo::ServiceControl::stopService(String16("test.unknown")));
-    ASSERT_EQ(android::NO_ERROR, kelvo::ServiceControl::stopService(String16("test.local")));
-    ASSERT_TRUE(
-        kelvo::test::waitFor([&] { return counter->count() == 1; }, std::chrono::seconds(10)));
-    EXPECT_EQ(android::DEAD_OBJECT, kelvo::test::echo(proxy, 1));
-    EXPECT_EQ(nullptr, android::defaultServiceManager()->checkService(String16("test.local")));
+struct Tally {
+    std::atomic<int> answered{0};
+    std::atomic<int> dead{0};
+    std::mutex lock;
+    std::vector<std::string> wrong;
 
-    // Registered again, it answers through a new proxy.
+    void bad(const std::string& what) {
+        std::lock_guard<std::mutex> guard(lock);
+        wrong.push_back(what);
+    }
+};
+
+TEST(BinderStressTest, CallsAreAnsweredOrDeadWhileAServiceRestarts) {
+    kelvo::test::TempRoot root;
+    kelvo::test::ServiceWait wait(10000);
+    auto sm = android::defaultServiceManager();
+    sp<kelvo::test::TestService> local = new kelvo::test::TestService();
+    ASSERT_EQ(android::NO_ERROR, sm->addService(String16(kServices[0]), local));
     ASSERT_EQ(android::NO_ERROR,
-              android::defaultServiceManager()->addService(String16("test.local"), service));
-    sp<IBinder> again = android::defaultServiceManager()->checkService(String16("test.local"));
-    ASSERT_NE(nullptr, again);
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(again, 1));
-    kelvo::ServiceControl::stopService(String16("test.local"));
+              sm->addService(String16(kServices[1]), new kelvo::test::TestService()));
+    sp<IBinder> first;
+    std::atomic<pid_t> remote{kelvo::test::startRemoteService(kServices[2], &first)};
+    ASSERT_NE(nullptr, first);
+
+    Tally tally;
+    std::atomic<bool> stop{false};
+    std::atomic<int> deathsTold{0};
+    std::vector<std::thread> callers;
+    for (int t = 0; t < kThreads; ++t) {
+        callers.emplace_back([&, t] {
+            sp<IBinder> proxies[3];
+            std::vector<sp<kelvo::test::DeathCounter>> counters;
+            for (int i = 0; !stop.load() && i < 20000; ++i) {
+                int which = (i + t) % 3;
+                if (proxies[which] == nullptr || !proxies[which]->isBinderAlive()) {
+                    proxies[which] = sm->checkService(String16(kServices[which]));
+                    if (proxies[which] == nullptr) {
+                        tally.dead++;  // between a kill and the restart
+                        continue;
+                    }
+                    if (which == 2 && t % 2 == 0) {
+                        sp<kelvo::test::DeathCounter> counter = new kelvo::test::DeathCounter();
+                        if (proxies[which]->linkToDeath(counter) == android::NO_ERROR) {
+                            counters.push_back(counter);
+                        }
+                    }
+                }
+                android::status_t err;
+                if (i % 7 == 0) {
+                    Parcel data;
+                    data.writeInt32(i);
+                    err = proxies[which]->transact(kelvo::test::kRecord, data, nullptr,
+                                                   IBinder::FLAG_ONEWAY);
+                } else {
+                    int32_t answer = 0;
+                    err = kelvo::test::echo(proxies[which], i, &answer);
+                    if (err == android::NO_ERROR && answer != i + 1) {
+                        tally.bad("wrong answer from " + std::string(kServices[which]));
+                        continue;
+                    }
+                }
+                if (err == android::NO_ERROR) {
+                    tally.answered++;
+                } else if (err == android::DEAD_OBJECT && which == 2) {
+                    tally.dead++;
+                } else {
+                    tally.bad(std::string(kServices[which]) + " failed with " + std::to_string(err));
+                }
+            }
+            for (const auto& counter : counters) {
+                if (counter->count() > 1) {
+                    tally.bad("a death told twice");  // each link is told once at most
+                }
+                deathsTold += counter->count();
+            }
+        });
+    }
+
+    for (int r = 0; r < kRestarts; ++r) {
+        std::this_thread::sleep_for(std::chrono::milliseconds(150));
+        kelvo::test::killChild(remote.load());
+        std::this_thread::sleep_for(std::chrono::milliseconds(30));
+        remote = kelvo::test::forkService(kServices[2]);
+    }
+    std::this_thread::sleep_for(std::chrono::milliseconds(150));
+    stop = true;
+    // A child forked from this busy process may itself be stuck (a lock
+    // some other thread held at the fork): its death ends any call waiting
+    // on it, as a death must.
+    kelvo::test::killChild(remote.load());
+    for (std::thread& t : callers) {
+        t.join();
+    }
+    for (int i = 0; i < 2; ++i) {
+        kelvo::ServiceControl::stopService(String16(kServices[i]));
+    }
+
+    EXPECT_EQ(0u, tally.wrong.size()) << tally.wrong.front();
+    EXPECT_GT(tally.answered.load(), kThreads * 10);
+    EXPECT_GT(tally.dead.load(), 0);
+    EXPECT_GT(deathsTold.load(), 0);
 }
 
 } // namespace

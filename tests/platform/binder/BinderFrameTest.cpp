@@ -22,28 +22,29 @@ namespace {
 
 constexpr uint32_t kMagic = 0x3146424b;
 
-void put32(Bytes* b, uint32_t v) {
-    for (int i = 0; i < 4; ++i) {
-        b->push_back(static_cast<uint8_t>(v >> (8 * i)));
+// Little-endian 32-bit words.
+Bytes words(std::initializer_list<uint32_t> values) {
+    Bytes b;
+    for (uint32_t v : values) {
+        for (int i = 0; i < 4; ++i) {
+            b.push_back(static_cast<uint8_t>(v >> (8 * i)));
+        }
     }
-}
-
-void put64(Bytes* b, uint64_t v) {
-    put32(b, static_cast<uint32_t>(v));
-    put32(b, static_cast<uint32_t>(v >> 32));
+    return b;
 }
 
 Bytes header(uint16_t kind, uint32_t code, uint32_t flags, uint64_t target, uint32_t dataSize,
              uint32_t tableSize, uint32_t magic = kMagic) {
-    Bytes b;
-    put32(&b, magic);
-    put32(&b, kind);  // kind, then the reserved half
-    put32(&b, code);
-    put32(&b, flags);
-    put64(&b, target);
-    put32(&b, dataSize);
-    put32(&b, tableSize);
-    return b;
+    // The kind takes the low half of its word, the high half is reserved.
+    return words({magic, kind, code, flags, static_cast<uint32_t>(target),
+                  static_cast<uint32_t>(target >> 32), dataSize, tableSize});
+}
+
+// A 32-bit field of a frame read from the server.
+uint32_t field(const Bytes& frame, size_t offset) {
+    uint32_t v = 0;
+    memcpy(&v, frame.data() + offset, 4);
+    return v;
 }
 
 // A transaction frame with the given data and table.
@@ -150,13 +151,9 @@ TEST_F(BinderFrameTest, HandWrittenFramesFollowTheWireFormat) {
     ASSERT_TRUE(client->connected());
     Bytes hello = client->read(32);
     ASSERT_EQ(32u, hello.size());
-    uint32_t magic = 0;
-    memcpy(&magic, hello.data(), 4);
-    EXPECT_EQ(kMagic, magic);
+    EXPECT_EQ(kMagic, field(hello, 0));
     EXPECT_EQ(3, hello[4]);  // kind: hello
-    uint64_t incarnation = 0;
-    memcpy(&incarnation, hello.data() + 16, 8);
-    EXPECT_NE(0u, incarnation);
+    EXPECT_NE(0u, field(hello, 16) | field(hello, 20));  // the incarnation
 
     // Two requests on one connection, each answered with a reply frame.
     for (int32_t n : {10, 20}) {
@@ -164,25 +161,17 @@ TEST_F(BinderFrameTest, HandWrittenFramesFollowTheWireFormat) {
         Bytes reply = client->read(32);
         ASSERT_EQ(32u, reply.size());
         EXPECT_EQ(2, reply[4]);  // kind: reply
-        int32_t status = -1;
-        uint32_t dataSize = 0;
-        memcpy(&status, reply.data() + 8, 4);
-        memcpy(&dataSize, reply.data() + 24, 4);
-        EXPECT_EQ(android::NO_ERROR, status);
-        Bytes data = client->read(dataSize);
-        ASSERT_EQ(dataSize, data.size());
-        int32_t answer = 0;
-        memcpy(&answer, data.data(), 4);
-        EXPECT_EQ(n + 1, answer);
+        EXPECT_EQ(android::NO_ERROR, static_cast<int32_t>(field(reply, 8)));  // status
+        Bytes data = client->read(field(reply, 24));
+        ASSERT_EQ(field(reply, 24), data.size());
+        EXPECT_EQ(static_cast<uint32_t>(n + 1), field(data, 0));
     }
 
     // An object id that was never handed out is no object.
     ASSERT_TRUE(client->send(frame(echoData(1), {}, kelvo::test::kEcho, 0, 99)));
     Bytes reply = client->read(32);
     ASSERT_EQ(32u, reply.size());
-    int32_t status = 0;
-    memcpy(&status, reply.data() + 8, 4);
-    EXPECT_EQ(android::NAME_NOT_FOUND, status);
+    EXPECT_EQ(android::NAME_NOT_FOUND, static_cast<int32_t>(field(reply, 8)));
 }
 
 TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
@@ -194,26 +183,16 @@ TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
     const uint32_t binderSlot = 0x4b424e44;
     memcpy(slotData.data(), &binderSlot, 4);
     auto binderEntry = [](uint32_t offset, const std::string& name, uint32_t nameLen) {
-        Bytes t;
-        put32(&t, 1);
-        put32(&t, offset);
-        put32(&t, 1);  // binder
-        put64(&t, 1);
-        put64(&t, 1);
-        put32(&t, nameLen);
+        // One entry: a binder at the offset, its two 64-bit ids, its name.
+        Bytes t = words({1, offset, 1, 1, 0, 1, 0, nameLen});
         t.insert(t.end(), name.begin(), name.end());
         while (t.size() % 4 != 0) {
             t.push_back(0);
         }
         return t;
     };
-    Bytes fdEntry;
-    put32(&fdEntry, 1);
-    put32(&fdEntry, 0);
-    put32(&fdEntry, 2);  // a descriptor, but none is sent
-    Bytes countTooBig;
-    put32(&countTooBig, 1000000);
-    put32(&countTooBig, 0);
+    Bytes fdEntry = words({1, 0, 2});  // a descriptor, but none is sent
+    Bytes countTooBig = words({1000000, 0});
 
     struct Case {
         const char* what;

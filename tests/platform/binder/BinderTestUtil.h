@@ -49,9 +49,8 @@ public:
             text += " " + std::string(android::String8(args[i]).string());
         }
         text += "\n";
-        return write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size())
-                   ? android::NO_ERROR
-                   : android::UNKNOWN_ERROR;
+        bool whole = write(fd, text.data(), text.size()) == static_cast<ssize_t>(text.size());
+        return whole ? android::NO_ERROR : android::UNKNOWN_ERROR;
     }
 
     // One-way records, in arrival order, and the most that ran at once.
@@ -146,31 +145,21 @@ private:
     std::vector<int32_t> mRecords;
 };
 
-// Counts the deaths it is told of, and on which thread.
+// Counts the deaths it is told of, and remembers on which thread and of
+// whom (read those once the count shows the death).
 class DeathCounter : public android::IBinder::DeathRecipient {
 public:
     void binderDied(const android::wp<android::IBinder>& who) override {
-        std::lock_guard<std::mutex> guard(mLock);
         mWho = who;
         mThread = std::this_thread::get_id();
         mCount++;
     }
-    int count() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mCount;
-    }
-    std::thread::id thread() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mThread;
-    }
-    android::wp<android::IBinder> who() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mWho;
-    }
+    int count() const { return mCount.load(); }
+    std::thread::id thread() const { return mThread; }
+    android::wp<android::IBinder> who() const { return mWho; }
 
 private:
-    std::mutex mLock;
-    int mCount = 0;
+    std::atomic<int> mCount{0};
     std::thread::id mThread;
     android::wp<android::IBinder> mWho;
 };
@@ -201,7 +190,12 @@ inline pid_t forkService(const char* name) {
     return pid;
 }
 
-inline void killChild(pid_t pid);
+inline void killChild(pid_t pid) {
+    if (pid > 0) {
+        kill(pid, SIGKILL);
+        waitpid(pid, nullptr, 0);
+    }
+}
 
 // Forks the service and waits for it to answer. A child forked from a busy
 // multi-threaded process can be stuck on a lock another thread held at the
@@ -220,14 +214,6 @@ inline pid_t startRemoteService(const char* name, android::sp<android::IBinder>*
         killChild(pid);
     }
     return -1;
-}
-
-inline void killChild(pid_t pid) {
-    if (pid > 0) {
-        kill(pid, SIGKILL);
-        int status = 0;
-        waitpid(pid, &status, 0);
-    }
 }
 
 // Waits for a child and returns its exit status (-1 when it did not exit

@@ -1,6 +1,10 @@
+// Service names, the wait for them, and the dumpsys tool.
+
 #include <gtest/gtest.h>
-#include <sys/socket.h>
-#include <sys/un.h>
+#include <limits.h>
+#include <stdio.h>
+#include <sys/wait.h>
+#include <unistd.h>
 
 #include <chrono>
 #include <string>
@@ -18,15 +22,13 @@ namespace {
 class ServiceManagerTest : public ::testing::Test {
 protected:
     void TearDown() override {
-        for (const char* name : {"test.late", "test.a", "test.b", "test.stale"}) {
-            kelvo::ServiceControl::stopService(String16(name));
-        }
+        kelvo::ServiceControl::stopService(String16("test.late"));
     }
     kelvo::test::TempRoot mRoot;
     sp<android::IServiceManager> mManager = android::defaultServiceManager();
 };
 
-TEST_F(ServiceManagerTest, GetServiceWaitsForTheNameToAppear) {
+TEST_F(ServiceManagerTest, GetServiceWaitsForTheNameToAppearOrItsTimeOut) {
     kelvo::test::ServiceWait wait(10000);
     std::thread late([this] {
         std::this_thread::sleep_for(std::chrono::milliseconds(300));
@@ -36,10 +38,9 @@ TEST_F(ServiceManagerTest, GetServiceWaitsForTheNameToAppear) {
     late.join();
     ASSERT_NE(nullptr, service);
     EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(service, 1));
-}
 
-TEST_F(ServiceManagerTest, GetServiceGivesUpAfterItsWaitAndCheckServiceDoesNotWait) {
-    kelvo::test::ServiceWait wait(300);
+    // It gives up after its wait; checkService does not wait.
+    kelvo::test::ServiceWait shortWait(300);
     Clock::time_point start = Clock::now();
     EXPECT_EQ(nullptr, mManager->getService(String16("test.missing")));
     Clock::duration waited = Clock::now() - start;
@@ -48,8 +49,8 @@ TEST_F(ServiceManagerTest, GetServiceGivesUpAfterItsWaitAndCheckServiceDoesNotWa
 
     kelvo::test::ServiceWait longWait(60000);
     start = Clock::now();
-    EXPECT_EQ(nullptr, mManager->checkService(String16("test.missing")));
-    EXPECT_LT(Clock::now() - start, std::chrono::seconds(5));
+    EXPECT_TRUE(mManager->checkService(String16("test.missing")) == nullptr &&
+                Clock::now() - start < std::chrono::seconds(5));
 }
 
 TEST_F(ServiceManagerTest, NamesThatCannotBeSocketsAreRefused) {
@@ -66,36 +67,44 @@ TEST_F(ServiceManagerTest, NamesThatCannotBeSocketsAreRefused) {
     EXPECT_FALSE(kelvo::test::hostPathExists(mRoot.path() + "/dev/up"));
 }
 
-TEST_F(ServiceManagerTest, StaleSocketIsNoServiceAndIsReplaced) {
-    // What a killed server leaves behind: a socket file nobody listens on.
-    std::string dir = kelvo::ServiceControl::socketDir();
-    kelvo::test::makeHostDirs(dir);
-    std::string path = dir + "/test.stale";
-    int fd = socket(AF_UNIX, SOCK_STREAM, 0);
-    struct sockaddr_un addr = {};
-    addr.sun_family = AF_UNIX;
-    snprintf(addr.sun_path, sizeof(addr.sun_path), "%s", path.c_str());
-    ASSERT_EQ(0, bind(fd, reinterpret_cast<sockaddr*>(&addr), sizeof(addr)));
-    close(fd);
-    ASSERT_TRUE(kelvo::test::hostPathExists(path));
-
-    EXPECT_EQ(nullptr, mManager->checkService(String16("test.stale")));
-    ASSERT_EQ(android::NO_ERROR,
-              mManager->addService(String16("test.stale"), new kelvo::test::TestService()));
-    sp<android::IBinder> service = mManager->checkService(String16("test.stale"));
-    ASSERT_NE(nullptr, service);
-    EXPECT_EQ(android::NO_ERROR, service->pingBinder());
-}
-
-TEST_F(ServiceManagerTest, ListServicesNamesTheLiveOnes) {
-    mManager->addService(String16("test.b"), new kelvo::test::TestService());
-    mManager->addService(String16("test.a"), new kelvo::test::TestService());
-    mManager->addService(String16("test.late"), new kelvo::test::TestService());
-    kelvo::ServiceControl::stopService(String16("test.late"));
-    android::Vector<String16> names = mManager->listServices();
-    ASSERT_EQ(2u, names.size());
-    EXPECT_EQ(String16("test.a"), names[0]);
-    EXPECT_EQ(String16("test.b"), names[1]);
+TEST(DumpsysTest, DumpsToItsStandardOutputAndFailsClearly) {
+    // dumpsys sits beside the test program in bin/.
+    char self[PATH_MAX] = {};
+    ssize_t n = readlink("/proc/self/exe", self, sizeof(self) - 1);
+    std::string tool(self, n > 0 ? static_cast<size_t>(n) : 0);
+    tool = tool.substr(0, tool.find_last_of('/') + 1) + "dumpsys";
+    if (access(tool.c_str(), X_OK) != 0) {
+        GTEST_SKIP() << "dumpsys not built beside the tests";
+    }
+    kelvo::test::TempRoot root;
+    ASSERT_EQ(android::NO_ERROR, android::defaultServiceManager()->addService(
+                                     String16("test.dumped"), new kelvo::test::TestService()));
+    // Runs dumpsys with the arguments; its exit status and standard output.
+    auto run = [&](const std::string& args, std::string* out, const char* env = "") {
+        out->clear();
+        std::string command = std::string(env) + tool + " " + args;
+        FILE* p = popen(command.c_str(), "r");
+        char buf[256];
+        size_t got;
+        while (p != nullptr && (got = fread(buf, 1, sizeof(buf), p)) > 0) {
+            out->append(buf, got);
+        }
+        int status = p != nullptr ? pclose(p) : -1;
+        return WIFEXITED(status) ? WEXITSTATUS(status) : -1;
+    };
+    std::string at = "-r " + root.path() + " ";
+    std::string out;
+    EXPECT_EQ(0, run(at + "test.dumped --log cpu 1", &out));
+    EXPECT_EQ("dump of test service: --log cpu 1\n", out);
+    // The root may come from the environment too.
+    std::string env = "KELVO_ROOT=" + root.path() + " ";
+    EXPECT_EQ(0, run("test.dumped -v", &out, env.c_str()));
+    EXPECT_EQ("dump of test service: -v\n", out);
+    EXPECT_EQ(1, run(at + "test.absent 2>&1", &out));
+    EXPECT_NE(std::string::npos, out.find("Can't find service: test.absent")) << out;
+    EXPECT_EQ(0, run(at + "-l", &out));
+    EXPECT_NE(std::string::npos, out.find("  test.dumped\n")) << out;
+    kelvo::ServiceControl::stopService(String16("test.dumped"));
 }
 
 } // namespace

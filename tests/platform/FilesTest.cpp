@@ -1,10 +1,49 @@
-#include <gtest/gtest.h>
+// The root-path resolver and the customisation locator.
 
+#include <gtest/gtest.h>
 #include <string.h>
 
 #include <cust/CustConfig.h>
 
+#include <string>
+
 #include "common/TestEnv.h"
+#include "kelvo/HostProperties.h"
+#include "kelvo/RootPath.h"
+
+using kelvo::RootPath;
+
+TEST(RootPathTest, AbsolutePathsGoUnderTheRootAndOthersAreLeftAlone) {
+    std::string saved = RootPath::root();
+    // Trailing slashes of the root are dropped; "/" and "" are the real
+    // root, which adds nothing.
+    struct Case {
+        const char* root;
+        const char* rootSeen;
+        const char* path;
+        const char* resolved;
+    } cases[] = {
+            {"/tmp/kr", "/tmp/kr", "/sys/class/power_supply", "/tmp/kr/sys/class/power_supply"},
+            {"/tmp/kr", "/tmp/kr", "/", "/tmp/kr/"},
+            {"/tmp/kr", "/tmp/kr", "data/x", "data/x"},
+            {"/tmp/kr", "/tmp/kr", "./x", "./x"},
+            {"/tmp/kr", "/tmp/kr", "", ""},
+            {"/tmp/kr", "/tmp/kr", nullptr, ""},
+            {"/tmp/kr///", "/tmp/kr", "/vendor/build.prop", "/tmp/kr/vendor/build.prop"},
+            {"/", "", "/vendor/build.prop", "/vendor/build.prop"},
+            {"", "", "/data/x", "/data/x"},
+            {nullptr, "", "/proc/stat", "/proc/stat"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(std::string(c.root ? c.root : "null") + " " + (c.path ? c.path : "null"));
+        RootPath::setRoot(c.root);
+        EXPECT_EQ(c.rootSeen, RootPath::root());
+        EXPECT_EQ(c.resolved, RootPath::resolve(c.path));
+    }
+
+    RootPath::setRoot(saved.c_str());
+    kelvo::HostProperties::reload();
+}
 
 namespace {
 

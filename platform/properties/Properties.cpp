@@ -238,24 +238,6 @@ extern "C" int property_set(const char* key, const char* value) {
     return 0;
 }
 
-extern "C" int property_list(void (*propfn)(const char* key, const char* value, void* cookie),
-                             void* cookie) {
-    if (propfn == nullptr) {
-        return -1;
-    }
-    std::map<std::string, std::string> copy;
-    {
-        PropertyStore& s = store();
-        std::lock_guard<std::mutex> guard(s.lock);
-        loadLocked(s);
-        copy = s.values;
-    }
-    for (const auto& kv : copy) {
-        propfn(kv.first.c_str(), kv.second.c_str(), cookie);
-    }
-    return 0;
-}
-
 namespace kelvo {
 
 void HostProperties::reload() {
