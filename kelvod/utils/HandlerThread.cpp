@@ -4,6 +4,7 @@
 #include <chrono>
 #include <climits>
 #include <cstring>
+#include <memory>
 #include <tuple>
 #include <utility>
 #include <vector>
@@ -141,8 +142,11 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
         KLOGE("Already existed message id[%d] in %s", id, mName.string());
         return -13;
     }
-    sync_result waiter;
-    mWaiting.emplace(id, &waiter);
+    // Shared with the handler, which wakes the caller after it let go of
+    // the lock: the caller does not wake only to block on it again.
+    std::shared_ptr<sync_result> waiter = std::make_shared<sync_result>();
+    mWaiting.emplace(id, waiter);
+    lock.unlock();
     postMessage(id, systemTime(SYSTEM_TIME_MONOTONIC));
 
     using Clock = std::chrono::steady_clock;
@@ -153,9 +157,10 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
                 .count() > timeoutMs) {
         deadline = now + std::chrono::milliseconds(timeoutMs);
     }
+    lock.lock();
     // A spurious wake-up goes back to waiting until done or the deadline.
-    bool done = waiter.cond.wait_until(lock, deadline, [&waiter] { return waiter.done; });
-    int32_t result = waiter.result;
+    bool done = waiter->cond.wait_until(lock, deadline, [&waiter] { return waiter->done; });
+    int32_t result = waiter->result;
     mWaiting.erase(id);
     lock.unlock();
     if (!done) {
@@ -215,16 +220,22 @@ size_t HandlerThread::dropAllMessages() {
 void HandlerThread::releaseWaiters(const int32_t* ids, size_t count) {
     // A caller waiting for a removed message would otherwise sit out the
     // whole time-out: it returns at once with -1.
-    std::lock_guard<std::mutex> guard(mSyncLock);
-    if (mWaiting.empty()) {
-        return;
-    }
-    for (size_t i = 0; i < count; ++i) {
-        auto it = mWaiting.find(ids[i]);
-        if (it != mWaiting.end()) {
-            it->second->done = true;
-            it->second->cond.notify_one();
+    std::vector<std::shared_ptr<sync_result>> released;
+    {
+        std::lock_guard<std::mutex> guard(mSyncLock);
+        if (mWaiting.empty()) {
+            return;
         }
+        for (size_t i = 0; i < count; ++i) {
+            auto it = mWaiting.find(ids[i]);
+            if (it != mWaiting.end()) {
+                it->second->done = true;
+                released.push_back(it->second);
+            }
+        }
+    }
+    for (const auto& waiter : released) {
+        waiter->cond.notify_one();
     }
 }
 
@@ -292,19 +303,23 @@ void HandlerThread::deliver(int32_t id, pending_message& entry) {
         status = handleParcelMessage(msg);
     }
 
-    std::lock_guard<std::mutex> guard(mSyncLock);
-    auto it = mWaiting.find(id);
-    if (it == mWaiting.end()) {
-        return; // asynchronous, or the caller gave up waiting
+    std::shared_ptr<sync_result> waiter;
+    {
+        std::lock_guard<std::mutex> guard(mSyncLock);
+        auto it = mWaiting.find(id);
+        if (it == mWaiting.end()) {
+            return;  // asynchronous, or the caller gave up waiting
+        }
+        waiter = it->second;
+        waiter->result = status;
+        // The caller's reply is written while it still waits under the lock.
+        if (callerReply != nullptr && reply.dataSize() > 0) {
+            callerReply->freeData();
+            callerReply->appendFrom(&reply, 0, reply.dataSize());
+            callerReply->setDataPosition(0);
+        }
+        waiter->done = true;
     }
-    sync_result* waiter = it->second;
-    waiter->result = status;
-    if (callerReply != nullptr && reply.dataSize() > 0) {
-        callerReply->freeData();
-        callerReply->appendFrom(&reply, 0, reply.dataSize());
-        callerReply->setDataPosition(0);
-    }
-    waiter->done = true;
     waiter->cond.notify_one();
 }
 

@@ -5,6 +5,7 @@
 #include <atomic>
 #include <condition_variable>
 #include <map>
+#include <memory>
 #include <mutex>
 #include <unordered_map>
 
@@ -109,7 +110,7 @@ private:
     bool mDraining;
 
     std::mutex mSyncLock;
-    std::unordered_map<int32_t, sync_result*> mWaiting;
+    std::unordered_map<int32_t, std::shared_ptr<sync_result>> mWaiting;
 
     static std::atomic<int64_t> sSyncTimeoutMs;
 };
