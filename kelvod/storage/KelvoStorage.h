@@ -31,9 +31,11 @@ enum storage_entry_type {
     STORAGE_REMOTE_DEBUG = 7,    // int32 action, String8 argument
 };
 
-// The one thread that touches the database. Inserts are buffered and written
-// in one transaction when the buffer passes its limits, when the periodic
-// flush fires, or when a flush is forced.
+// The one thread that touches the database: every statement, the start-up
+// rebuild and the closing included, runs on it. Inserts are buffered and
+// written in one transaction when the buffer passes its limits, when the
+// periodic flush fires, or when a flush is forced. Until the tables exist
+// (before the start, after the close) a flush keeps the buffer.
 class KelvoStorage : public HandlerThread, public DatabaseCopier {
 public:
     static constexpr const char* kDatabaseDir = "/data/log/kelvo";
@@ -48,8 +50,14 @@ public:
     explicit KelvoStorage(KelvoAgent* agent);
     ~KelvoStorage() override;
 
+    // Opens the database and checks or rebuilds its tables, as one
+    // synchronous message to the storage thread.
     int32_t startConnection();
+    // Closes the connection on the storage thread; buffered rows stay.
     int32_t closeConnection();
+    // The orderly stop: writes the buffered rows, then closes the connection,
+    // in one synchronous message (bounded by the synchronous time-out).
+    int32_t shutdown();
     int32_t addSchema(const table_attribute& table);
 
     int32_t createTable(const android::Parcel& data);
@@ -70,6 +78,15 @@ public:
     int32_t handleParcelMessage(const ParcelMessage& msg) override;
 
 private:
+    friend class SchemaTable;
+
+    int32_t doStartConnection();
+    int32_t doCloseConnection();
+    // A query run on the storage thread itself; the reply is rewound.
+    int32_t runQuery(const android::String8& sql, android::Parcel* reply);
+    int32_t runStatement(const android::String8& sql);
+    // Appends one insert parcel to the buffer without flushing.
+    void bufferInsert(const ParcelMessage& msg);
     int64_t getTableCount();
     bool isSoftwareVersionChanged();
     int32_t dropAllTables();
@@ -92,10 +109,12 @@ private:
     std::vector<ParcelMessage> mBuffer;
     int64_t mBufferSize;
     int64_t mFlushPeriodNs;
-    // Set once the tables exist: until then inserts only wait in the buffer.
-    std::atomic<bool> mTablesReady;
+    // Set once the tables exist, cleared by the close: until then rows only
+    // wait in the buffer. Storage thread only.
+    bool mTablesReady;
     // The pending flush tick, so a second start does not arm a second one.
-    std::atomic<int32_t> mFlushTickId;
+    // Storage thread only.
+    int32_t mFlushTickId;
 };
 
 } // namespace kelvo
