@@ -74,7 +74,8 @@ KelvoStorage::KelvoStorage(KelvoAgent* agent)
       mBufferSize(0),
       mFlushPeriodNs(readFlushPeriod()),
       mTablesReady(false),
-      mFlushTickId(-1) {
+      mFlushTickId(-1),
+      mThreadId(0) {
     mSchema.reset(new SchemaTable(this));
     mManager.reset(new StorageManager(this));
 }
@@ -115,7 +116,7 @@ int32_t KelvoStorage::doStartConnection() {
     std::string path = RootPath::resolve(kDatabasePath);
     android::Parcel open;
     open.writeCString(path.c_str());
-    if (doSqliteOperation(SQL_OPEN_CONNECTION, &open, nullptr) < 0) {
+    if (runSql(SQL_OPEN_CONNECTION, &open, nullptr) < 0) {
         KLOGE("Failed to open database connection!");
         mManager->moveDatabase();
         return -17;
@@ -158,7 +159,7 @@ int32_t KelvoStorage::doStartConnection() {
 int32_t KelvoStorage::doCloseConnection() {
     // Rows that come later wait in the buffer, as before the start.
     mTablesReady = false;
-    if (doSqliteOperation(SQL_CLOSE_CONNECTION, nullptr, nullptr) < 0) {
+    if (runSql(SQL_CLOSE_CONNECTION, nullptr, nullptr) < 0) {
         KLOGE("Failed to close database connection!");
         return -17;
     }
@@ -172,6 +173,15 @@ void KelvoStorage::armFlushTimer() {
         removeMessage(mFlushTickId);
     }
     mFlushTickId = sendMessageDelayed(mFlushPeriodNs, ParcelMessage(MESSAGE_CUSTOMIZED, kFlushTick));
+}
+
+int32_t KelvoStorage::runSql(int32_t action, const android::Parcel* in, android::Parcel* out) {
+    // The one-SQL-thread rule, checked: the connection has no lock.
+    if (gettid() != mThreadId.load(std::memory_order_relaxed)) {
+        KLOGE("SQL refused off the storage thread: %d", action);
+        return -1;
+    }
+    return doSqliteOperation(action, in, out);
 }
 
 int32_t KelvoStorage::runQuery(const android::String8& sql, android::Parcel* reply) {
@@ -307,6 +317,7 @@ int32_t KelvoStorage::remoteDebug(int32_t action, const android::String8& argume
 }
 
 int32_t KelvoStorage::handleParcelMessage(const ParcelMessage& msg) {
+    mThreadId.store(gettid(), std::memory_order_relaxed);
     switch (msg.type) {
         case MESSAGE_STORAGE_ENTRY:
             if (msg.what == STORAGE_INSERT_ENTRIES) {
@@ -378,7 +389,7 @@ int32_t KelvoStorage::handleCustomized(int32_t what) {
 }
 
 int32_t KelvoStorage::doCreateTable(const android::Parcel& data) {
-    if (doSqliteOperation(SQL_CREATE_TABLE, &data, nullptr) < 0) {
+    if (runSql(SQL_CREATE_TABLE, &data, nullptr) < 0) {
         KLOGE("Failed to create table");
         return -17;
     }
@@ -414,7 +425,7 @@ int32_t KelvoStorage::doFlushEntries() {
     for (const ParcelMessage& request : mBuffer) {
         rowCount += rowsOf(request.getParcel());
     }
-    if (doSqliteOperation(SQL_BEGIN_TRANSACTION, nullptr, nullptr) < 0) {
+    if (runSql(SQL_BEGIN_TRANSACTION, nullptr, nullptr) < 0) {
         mBuffer.clear();
         mBufferSize = 0;
         HealthCounters::add(Health::FlushRowsAbandoned, rowCount);
@@ -425,7 +436,7 @@ int32_t KelvoStorage::doFlushEntries() {
     for (const ParcelMessage& request : mBuffer) {
         const android::Parcel& rows = request.getParcel();
         rows.setDataPosition(0);
-        if (doSqliteOperation(SQL_INSERT_ENTRIES, &rows, nullptr) < 0) {
+        if (runSql(SQL_INSERT_ENTRIES, &rows, nullptr) < 0) {
             // A parcel is stored whole or not at all.
             int64_t lost = rowsOf(rows);
             HealthCounters::add(Health::FlushRowsAbandoned, lost);
@@ -442,7 +453,7 @@ int32_t KelvoStorage::doFlushEntries() {
     if (faulty) {
         KLOGE("Some error occurred while inserting entries");
     }
-    if (doSqliteOperation(SQL_COMMIT_TRANSACTION, nullptr, nullptr) < 0) {
+    if (runSql(SQL_COMMIT_TRANSACTION, nullptr, nullptr) < 0) {
         // The batch is rolled back.
         HealthCounters::add(Health::FlushRowsAbandoned, rowCount);
         doVacuumDatabase();
@@ -454,7 +465,7 @@ int32_t KelvoStorage::doFlushEntries() {
 }
 
 int32_t KelvoStorage::doVacuumDatabase() {
-    if (doSqliteOperation(SQL_VACUUM_DATABASE, nullptr, nullptr) < 0) {
+    if (runSql(SQL_VACUUM_DATABASE, nullptr, nullptr) < 0) {
         KLOGE("Failed to vacuum database");
         return -17;
     }
@@ -463,7 +474,7 @@ int32_t KelvoStorage::doVacuumDatabase() {
 }
 
 int32_t KelvoStorage::doExecuteEntry(const android::Parcel& data) {
-    if (doSqliteOperation(SQL_EXECUTE_ENTRY, &data, nullptr) < 0) {
+    if (runSql(SQL_EXECUTE_ENTRY, &data, nullptr) < 0) {
         KLOGE("Failed to execute entry");
         return -17;
     }
@@ -471,7 +482,7 @@ int32_t KelvoStorage::doExecuteEntry(const android::Parcel& data) {
 }
 
 int32_t KelvoStorage::doQueryEntries(const android::Parcel& data, android::Parcel* reply) {
-    if (doSqliteOperation(SQL_SIMPLE_QUERY, &data, reply) < 0) {
+    if (runSql(SQL_SIMPLE_QUERY, &data, reply) < 0) {
         KLOGE("Failed to query entries");
         return -17;
     }
@@ -493,7 +504,7 @@ int32_t KelvoStorage::doCleanDatabase(const android::Parcel& data) {
 
 int32_t KelvoStorage::doBackupCopy(const android::Parcel& data) {
     data.setDataPosition(0);
-    if (doSqliteOperation(SQL_BACKUP_COPY, &data, nullptr) < 0) {
+    if (runSql(SQL_BACKUP_COPY, &data, nullptr) < 0) {
         KLOGE("Failed to backup copy");
         return -17;
     }

@@ -1,6 +1,7 @@
 #pragma once
 
 #include <stdint.h>
+#include <sys/types.h>
 
 #include <atomic>
 #include <memory>
@@ -80,6 +81,8 @@ public:
 private:
     friend class SchemaTable;
 
+    // Every statement goes through here; refused on any other thread.
+    int32_t runSql(int32_t action, const android::Parcel* in, android::Parcel* out);
     int32_t doStartConnection();
     int32_t doCloseConnection();
     // A query run on the storage thread itself; the reply is rewound.
@@ -115,6 +118,9 @@ private:
     // The pending flush tick, so a second start does not arm a second one.
     // Storage thread only.
     int32_t mFlushTickId;
+    // The thread that handles this thread's messages, once it has handled
+    // one: the only one allowed to run SQL.
+    std::atomic<pid_t> mThreadId;
 };
 
 } // namespace kelvo

@@ -6,6 +6,7 @@
 #include <thread>
 #include <vector>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
@@ -13,10 +14,13 @@
 #include "storage/KelvoStorage.h"
 #include "storage/SchemaTable.h"
 #include "utils/KelvoUtils.h"
+#include "utils/SqlOperator.h"
 
 using android::Parcel;
 using android::sp;
 using android::String8;
+using kelvo::Health;
+using kelvo::HealthCounters;
 using kelvo::KelvoStorage;
 using kelvo::column_attribute;
 using kelvo::table_attribute;
@@ -48,16 +52,20 @@ const column_attribute kMixedColumns[] = {
 };
 const table_attribute kMixed = {"2.0", 1, 2, kMixedColumns, "hourly_component_test"};
 
-// An insert parcel of one raw_screen_state row per call.
+// The head of an insert parcel of one row: table name and columns.
+void writeHead(Parcel* p, const table_attribute& table) {
+    p->writeString8(String8(table.name));
+    p->writeInt32(table.count);
+    for (int32_t i = 0; i < table.count; ++i) {
+        p->writeString8(String8(table.columns[i].name));
+        p->writeInt32(table.columns[i].type);
+    }
+    p->writeInt32(1);
+}
+
 void insertScreenRow(KelvoStorage* storage, int64_t time, int32_t state) {
     Parcel p;
-    p.writeString8(String8(kScreenState.name));
-    p.writeInt32(2);
-    p.writeString8(String8("timestamp"));
-    p.writeInt32(kelvo::COLUMN_TIME);
-    p.writeString8(String8("state"));
-    p.writeInt32(kelvo::COLUMN_INT);
-    p.writeInt32(1);
+    writeHead(&p, kScreenState);
     p.writeInt64(time);
     p.writeInt32(state);
     ASSERT_GE(storage->insertEntries(p), 0);
@@ -65,15 +73,7 @@ void insertScreenRow(KelvoStorage* storage, int64_t time, int32_t state) {
 
 void insertAbout(KelvoStorage* storage, const char* key, const char* value) {
     Parcel p;
-    p.writeString8(String8(kAbout.name));
-    p.writeInt32(3);
-    p.writeString8(String8("timestamp"));
-    p.writeInt32(kelvo::COLUMN_TIME);
-    p.writeString8(String8("key"));
-    p.writeInt32(kelvo::COLUMN_TEXT);
-    p.writeString8(String8("value"));
-    p.writeInt32(kelvo::COLUMN_TEXT);
-    p.writeInt32(1);
+    writeHead(&p, kAbout);
     p.writeInt64(1000);
     p.writeString8(String8(key));
     p.writeString8(String8(value));
@@ -93,9 +93,15 @@ int64_t countThroughStorage(KelvoStorage* storage) {
 
 class KelvoStorageTest : public ::testing::Test {
 protected:
-    void SetUp() override { mRoot.reset(new TempRoot()); }
+    void SetUp() override {
+        mRoot.reset(new TempRoot());
+        // A lock held by another connection fails fast.
+        kelvo::SqlOperator::setBusyTimeoutMs(100);
+        HealthCounters::resetForTest();
+    }
     void TearDown() override {
         stop();
+        kelvo::SqlOperator::setBusyTimeoutMs(0);
         mRoot.reset();
     }
 
@@ -280,16 +286,30 @@ TEST_F(KelvoStorageTest, FlushPeriodComesFromItsPropertyWithAFloorOfOneSecond) {
                         std::chrono::milliseconds(5000)));
 }
 
-TEST_F(KelvoStorageTest, RowsQueuedBeforeTheStartWaitForTheTables) {
+TEST_F(KelvoStorageTest, RowsWithoutTablesWaitForThem) {
     mStorage = new KelvoStorage(nullptr);
     mStorage->addSchema(kScreenState);
     LogCapture log;
     for (int i = 0; i < 350; ++i) {
         insertScreenRow(mStorage.get(), 1000 + i, 1);
     }
+    // Neither the size limit nor a forced flush before the start drops them.
+    EXPECT_EQ(0, mStorage->flushAllEntries());
     ASSERT_EQ(0, mStorage->startConnection());
     EXPECT_FALSE(log.contains("reach upper limit"));
+    EXPECT_FALSE(log.contains("abandon all entries"));
     EXPECT_EQ(350, countThroughStorage(mStorage.get()));
+
+    // After the close, rows wait for the next start (no flush tick drops them).
+    ASSERT_EQ(0, mStorage->closeConnection());
+    insertScreenRow(mStorage.get(), 9000, 1);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(2u, HealthCounters::get(Health::InsertsDeferred));
+    mStorage->addSchema(kScreenState);
+    ASSERT_EQ(0, mStorage->startConnection());
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(351, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(0u, HealthCounters::get(Health::FlushRowsAbandoned));
 }
 
 TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
@@ -304,6 +324,7 @@ TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
         EXPECT_EQ(-17, mStorage->flushAllEntries());
         other.exec("COMMIT");
     }
+    EXPECT_EQ(1u, HealthCounters::get(Health::FlushRowsAbandoned));
     insertScreenRow(mStorage.get(), 2000, 0);
     EXPECT_EQ(0, mStorage->flushAllEntries());
     insertScreenRow(mStorage.get(), 3000, 0);
@@ -315,6 +336,12 @@ TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
 TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {
     start({&kScreenState});
     LogCapture log;
+    Parcel copy;
+    copy.writeCString((mRoot->path() + "/copy.db").c_str());
+    EXPECT_EQ(-17, mStorage->doBackupCopy(copy));
+    EXPECT_TRUE(log.contains("SQL refused off the storage thread: 9", ANDROID_LOG_ERROR));
+    EXPECT_FALSE(kelvo::test::hostPathExists(mRoot->path() + "/copy.db"));
+    EXPECT_EQ(-5, mStorage->queryEntries(String8("SELECT 1"), nullptr));
     EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_STORAGE_ENTRY, 8)));
     EXPECT_TRUE(log.contains("Unknow entry type: 8", ANDROID_LOG_ERROR));
     EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, 9)));
@@ -325,6 +352,7 @@ TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {
     EXPECT_EQ(-17, mStorage->queryEntries(String8("SELECT * FROM nothing_here"), &reply));
     EXPECT_EQ(-17, mStorage->executeEntry(String8("DELETE FROM raw_screen_state; DROP TABLE x"),
                                           true));
+    EXPECT_EQ(4u, HealthCounters::get(Health::StorageEntryRefused));
 }
 
 TEST_F(KelvoStorageTest, CleaningFlushesBacksUpAndVacuums) {

@@ -13,10 +13,12 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
+#include "utils/SqlOperator.h"
 
 using android::Parcel;
 using android::String8;
@@ -96,12 +98,16 @@ protected:
     void SetUp() override {
         mSavedDebug = kelvo::gLibLogDebugEnable.load();
         mPath = mRoot.path() + "/kelvo.db";
+        kelvo::SqlOperator::setBusyTimeoutMs(kBusyMs);
+        kelvo::HealthCounters::resetForTest();
         ASSERT_EQ(0, runPath(kelvo::SQL_OPEN_CONNECTION, mPath));
     }
     void TearDown() override {
         EXPECT_EQ(0, run(kelvo::SQL_CLOSE_CONNECTION));
+        kelvo::SqlOperator::setBusyTimeoutMs(0);
         kelvo::gLibLogDebugEnable = mSavedDebug;
     }
+    static constexpr int kBusyMs = 400;
     Rows query(const std::string& sql) { return Peer(mPath).rows(sql); }
 
     kelvo::test::TempRoot mRoot;
@@ -246,6 +252,7 @@ TEST_F(SqlOperatorTest, StatementsWithASecondStatementAreRefused) {
     EXPECT_EQ(0u, reply.dataSize());
     EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
     EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
+    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
     EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
 
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
@@ -349,7 +356,7 @@ TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     // A short lock of another writer is waited out.
     ASSERT_EQ(SQLITE_OK, reader.exec("BEGIN IMMEDIATE; DELETE FROM t;"));
     std::thread release([&reader] {
-        std::this_thread::sleep_for(std::chrono::milliseconds(300));
+        std::this_thread::sleep_for(std::chrono::milliseconds(kBusyMs / 8));
         reader.exec("COMMIT;");
     });
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4)"));
@@ -384,4 +391,34 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
     mRoot.writeFile("/foreign.db", "somebody's file\n");
     EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
     EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
+}
+
+TEST_F(SqlOperatorTest, AFullStatementCacheKeepsTheStatementInUse) {
+    // Single-row inserts into distinct tables fill the cache exactly; then a
+    // parcel of several rows needs its savepoint statement besides the
+    // insert statement it holds. Going on past the cache empties it again.
+    const size_t full = kelvo::SqlOperator::kMaxCachedStatements;
+    auto insert = [](size_t table, int32_t rows) {
+        Parcel in;
+        writeHead(in, ("t" + std::to_string(table)).c_str(), {{"v", kelvo::COLUMN_INT}});
+        in.writeInt32(rows);
+        for (int32_t i = 0; i < rows; ++i) {
+            in.writeInt32(i);
+        }
+        return run(kelvo::SQL_INSERT_ENTRIES, &in);
+    };
+    ASSERT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
+    for (size_t t = 0; t < full + 44; ++t) {
+        ASSERT_EQ(0, createTable(("t" + std::to_string(t)).c_str(), {{"v", kelvo::COLUMN_INT}}));
+        ASSERT_EQ(SQLITE_DONE, insert(t, 1)) << t;
+        if (t + 1 == full) {
+            ASSERT_EQ(SQLITE_DONE, insert(t, 3));
+        }
+    }
+    for (size_t t = 0; t < full + 44; ++t) {
+        ASSERT_EQ(SQLITE_DONE, insert(t, 2)) << t;
+    }
+    ASSERT_EQ(0, run(kelvo::SQL_COMMIT_TRANSACTION));
+    EXPECT_EQ(Rows{"6"}, query("SELECT count(*) FROM t" + std::to_string(full - 1)));
+    EXPECT_EQ(Rows{"3"}, query("SELECT count(*) FROM t" + std::to_string(full + 43)));
 }
