@@ -144,24 +144,14 @@ protected:
 
 } // namespace
 
-TEST_F(KelvoStorageTest, CreatesTablesWithExactTextsAndOneVersionRowEach) {
+TEST_F(KelvoStorageTest, CreatesEveryTableWithOneVersionRowEach) {
     start({&kScreenState, &kMixed});
     DirectDb db(dbPath());
     ASSERT_TRUE(db.ok());
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE raw_screen_state(id INTEGER PRIMARY KEY, "
-                                       "timestamp INTEGER, formatted_timestamp VARCHAR, state "
-                                       "INTEGER)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'raw_screen_state'"));
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE hourly_component_test(id INTEGER PRIMARY "
-                                       "KEY, name VARCHAR, energy INTEGER)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'hourly_component_test'"));
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE schema_version(module VARCHAR, version "
-                                       "VARCHAR)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'schema_version'"));
-    EXPECT_EQ((std::vector<std::string>{"hourly_component_test=2.0", "raw_screen_state=1.0",
-                                        "schema_version=1.0"}),
-              db.column("SELECT module || '=' || version FROM schema_version ORDER BY module"));
-    // The directory and file modes of the database.
+    EXPECT_EQ((std::vector<std::string>{"hourly_component_test|2.0", "raw_screen_state|1.0",
+                                        "schema_version|1.0"}),
+              db.column("SELECT module, version FROM schema_version ORDER BY module"));
+    EXPECT_EQ(3, db.scalar("SELECT COUNT(*) FROM sqlite_master WHERE type = 'table'"));
     struct stat st = {};
     ASSERT_EQ(0, stat(dbPath().c_str(), &st));
     EXPECT_EQ(0664u, st.st_mode & 0777);
@@ -188,66 +178,50 @@ TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlush) {
 }
 
 TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
+    struct Step {
+        const table_attribute* screen;
+        const char* sql; // applied to the file before the start
+        const char* build;
+        bool kept;
+    };
+    const Step steps[] = {
+        {&kScreenState, nullptr, "BUILD.A", true},
+        {&kScreenStateV11, nullptr, "BUILD.A", false},
+        {&kScreenStateV110, nullptr, "BUILD.A", false}, // "1.1" is not "1.10"
+        // One version row missing, though every present row matches.
+        {&kScreenStateV110, "DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'",
+         "BUILD.A", false},
+        // The right number of rows, each matching on its own, one module twice.
+        {&kScreenStateV110,
+         "UPDATE schema_version SET module = 'raw_screen_state', version = '1.10' WHERE module = "
+         "'about_kelvo_daemon'",
+         "BUILD.A", false},
+        {&kScreenStateV110, nullptr, "BUILD.B", false},
+    };
     kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.A");
     start({&kScreenState, &kAbout});
-    insertScreenRow(mStorage.get(), 1000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-
-    // Same definitions, same build: the rows stay.
-    start({&kScreenState, &kAbout});
-    EXPECT_EQ(1, countThroughStorage(mStorage.get()));
-    EXPECT_TRUE(backupZips().empty());
-
-    // "1.1" is not "1.10": rebuilt, the old database backed up as a zip.
-    start({&kScreenStateV11, &kAbout});
-    insertScreenRow(mStorage.get(), 2000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    start({&kScreenStateV110, &kAbout});
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    // One backup per rebuild.
-    EXPECT_EQ(2u, backupZips().size());
-    {
-        DirectDb db(dbPath());
-        EXPECT_EQ(std::vector<std::string>{"1.10"},
-                  db.column("SELECT version FROM schema_version WHERE module = "
-                            "'raw_screen_state'"));
-    }
-    insertScreenRow(mStorage.get(), 3000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // One version row missing: rebuilt although every present row matches.
-    {
-        DirectDb db(dbPath());
-        ASSERT_EQ(SQLITE_OK, db.exec("DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'"));
-    }
-    start({&kScreenStateV110, &kAbout});
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    insertScreenRow(mStorage.get(), 4000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // A duplicate module row: rebuilt.
-    {
-        DirectDb db(dbPath());
-        // The right number of rows, each matching on its own.
-        ASSERT_EQ(SQLITE_OK, db.exec("UPDATE schema_version SET module = 'raw_screen_state', "
-                                     "version = '1.10' WHERE module = 'about_kelvo_daemon'"));
-    }
     LogCapture log;
-    start({&kScreenStateV110, &kAbout});
+    size_t rebuilds = 0;
+    for (const Step& step : steps) {
+        SCOPED_TRACE(rebuilds);
+        insertScreenRow(mStorage.get(), 1000, 1);
+        insertAbout(mStorage.get(), "software_version", "BUILD.A");
+        stop();
+        if (step.sql != nullptr) {
+            ASSERT_EQ(SQLITE_OK, DirectDb(dbPath()).exec(step.sql));
+        }
+        kelvo::HostProperties::setForTest("ro.build.display.id", step.build);
+        start({step.screen, &kAbout});
+        rebuilds += step.kept ? 0 : 1;
+        EXPECT_EQ(step.kept ? 1 : 0, countThroughStorage(mStorage.get()));
+        // One zipped backup per rebuild.
+        EXPECT_EQ(rebuilds, backupZips().size());
+    }
     EXPECT_TRUE(log.contains("schema mismatch, duplicate records", ANDROID_LOG_ERROR));
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    insertScreenRow(mStorage.get(), 5000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // A new build: rebuilt.
-    kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.B");
-    log.clear();
-    start({&kScreenStateV110, &kAbout});
     EXPECT_TRUE(log.contains("Software version: BUILD.A, current is BUILD.B", ANDROID_LOG_INFO));
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(std::vector<std::string>{"1.10"},
+              DirectDb(dbPath()).column("SELECT version FROM schema_version WHERE module = "
+                                        "'raw_screen_state'"));
 }
 
 TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {

@@ -26,8 +26,13 @@ std::vector<std::string> DirectDb::column(const std::string& sql) const {
     }
     int rc;
     while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
-        const unsigned char* text = sqlite3_column_text(stmt, 0);
-        out.push_back(text != nullptr ? reinterpret_cast<const char*>(text) : "");
+        std::string row;
+        for (int i = 0; i < sqlite3_column_count(stmt); ++i) {
+            const unsigned char* text = sqlite3_column_text(stmt, i);
+            row += (i > 0 ? "|" : "") +
+                   std::string(text != nullptr ? reinterpret_cast<const char*>(text) : "");
+        }
+        out.push_back(row);
     }
     if (rc != SQLITE_DONE) {
         out.push_back(std::string("error: ") + sqlite3_errmsg(mDb));

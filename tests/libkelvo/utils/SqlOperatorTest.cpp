@@ -18,6 +18,7 @@
 #include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
+#include "kelvod/storage/StorageTestUtil.h"
 #include "utils/SqlOperator.h"
 
 using android::Parcel;
@@ -65,34 +66,6 @@ int32_t createTable(const char* table, const Columns& columns) {
     return run(kelvo::SQL_CREATE_TABLE, &in);
 }
 
-// Another connection to the same file, as a second process would hold it.
-class Peer {
-public:
-    explicit Peer(const std::string& path) { sqlite3_open(path.c_str(), &mDb); }
-    ~Peer() { sqlite3_close(mDb); }
-    int exec(const char* sql) { return sqlite3_exec(mDb, sql, nullptr, nullptr, nullptr); }
-    // Every row of the query, its columns joined by '|' (NULL as "<null>").
-    Rows rows(const std::string& sql) {
-        Rows out;
-        sqlite3_stmt* stmt = nullptr;
-        EXPECT_EQ(SQLITE_OK, sqlite3_prepare_v2(mDb, sql.c_str(), -1, &stmt, nullptr)) << sql;
-        while (stmt != nullptr && sqlite3_step(stmt) == SQLITE_ROW) {
-            std::string row;
-            for (int i = 0; i < sqlite3_column_count(stmt); ++i) {
-                const unsigned char* text = sqlite3_column_text(stmt, i);
-                row += std::string(i > 0 ? "|" : "") +
-                       (text != nullptr ? reinterpret_cast<const char*>(text) : "<null>");
-            }
-            out.push_back(row);
-        }
-        sqlite3_finalize(stmt);
-        return out;
-    }
-
-private:
-    sqlite3* mDb = nullptr;
-};
-
 class SqlOperatorTest : public ::testing::Test {
 protected:
     void SetUp() override {
@@ -108,7 +81,7 @@ protected:
         kelvo::gLibLogDebugEnable = mSavedDebug;
     }
     static constexpr int kBusyMs = 400;
-    Rows query(const std::string& sql) { return Peer(mPath).rows(sql); }
+    Rows query(const std::string& sql) { return kelvo::test::DirectDb(mPath).column(sql); }
 
     kelvo::test::TempRoot mRoot;
     std::string mPath;
@@ -172,8 +145,8 @@ TEST_F(SqlOperatorTest, InsertBindsEveryColumnKindInOrder) {
               lines[0].text);
     EXPECT_EQ(ANDROID_LOG_DEBUG, lines[0].priority);
     EXPECT_EQ(2u, log.count("Unknown data type: 9", ANDROID_LOG_ERROR));
-    EXPECT_EQ((Rows{"1|1000|first|<null>|-5|" + std::to_string(bytes),
-                    "2|2000|second|<null>|-6|" + std::to_string(bytes + 1)}),
+    EXPECT_EQ((Rows{"1|1000|first||-5|" + std::to_string(bytes),
+                    "2|2000|second||-6|" + std::to_string(bytes + 1)}),
               query("SELECT id, ts, name, x, level, bytes FROM t ORDER BY id"));
 }
 
@@ -327,7 +300,7 @@ TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
 
 TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
-    Peer reader(mPath);
+    kelvo::test::DirectDb reader(mPath);
     LogCapture log;
     ASSERT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (1)"));
@@ -351,7 +324,7 @@ TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     EXPECT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
     EXPECT_EQ(0, run(kelvo::SQL_COMMIT_TRANSACTION));
     EXPECT_EQ(0, run(kelvo::SQL_VACUUM_DATABASE));
-    EXPECT_EQ((Rows{"2", "9"}), reader.rows("SELECT v FROM t ORDER BY v"));
+    EXPECT_EQ((Rows{"2", "9"}), reader.column("SELECT v FROM t ORDER BY v"));
 
     // A short lock of another writer is waited out.
     ASSERT_EQ(SQLITE_OK, reader.exec("BEGIN IMMEDIATE; DELETE FROM t;"));
@@ -369,7 +342,7 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
     const std::string copy = mRoot.path() + "/copy.db";
     ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
-    EXPECT_EQ((Rows{"4", "5"}), Peer(copy).rows("SELECT v FROM t ORDER BY v"));
+    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
 
     LogCapture log;
     const std::string unreachable = mRoot.path() + "/missing/copy.db";
@@ -380,7 +353,7 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
 
     // The source stays locked past the busy time-out: the new file goes.
     const std::string blocked = mRoot.path() + "/blocked.db";
-    Peer locker(mPath);
+    kelvo::test::DirectDb locker(mPath);
     ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
     EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
     EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
