@@ -8,10 +8,8 @@
 #include "ErrorLogger.h"
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
-#include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
-#include "kelvo/HostProperties.h"
 
 using kelvo::test::LogCapture;
 
@@ -50,31 +48,4 @@ TEST(KelvoLibEntryTest, UnknownActionsAndMissingParcelsAreRefused) {
     // Library errors stay out of the daemon's error table.
     EXPECT_EQ(0, gStoredErrors.load());
     kelvo::ErrorLogger::setSink(nullptr);
-}
-
-TEST(KelvoLibEntryTest, SwitchesFollowTheirProperties) {
-    const int32_t savedDebug = kelvo::gLibLogDebugEnable.load();
-    const int32_t savedInfo = kelvo::gLibLogInfoEnable.load();
-    kelvo::test::TempRoot root;
-    // debug, info, debug switch, library start lines written so far.
-    struct Case {
-        const char* debug;
-        const char* info;
-        int32_t debugOn;
-        size_t starts;
-    };
-    const Case cases[] = {{nullptr, nullptr, 0, 1}, {"1", "2", 1, 1}, {"true", "1", 0, 2}};
-    LogCapture log;
-    for (const Case& c : cases) {
-        if (c.debug != nullptr) {
-            kelvo::HostProperties::setForTest("persist.libkelvo.log.debug", c.debug);
-            kelvo::HostProperties::setForTest("persist.libkelvo.log.info", c.info);
-        }
-        kelvo::loadLibLogSwitches();
-        EXPECT_EQ(c.debugOn, kelvo::gLibLogDebugEnable.load()) << c.debug;
-        kelvo::startLibrary(1234);
-        EXPECT_EQ(c.starts, log.count("[KelvoLibAgent.cpp] start# KELVO library starting"));
-    }
-    kelvo::gLibLogDebugEnable = savedDebug;
-    kelvo::gLibLogInfoEnable = savedInfo;
 }
