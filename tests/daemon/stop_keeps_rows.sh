@@ -3,7 +3,9 @@
 # database (tables, no schema versions) and rebuilds it; on a beta device the
 # rebuild's daily upload queues a debug_upload_result row, which waits in the
 # insert buffer (the flush period is minutes). SIGTERM comes at once. The
-# second start must find that row and keep the database as it is.
+# second start must find that row and keep the database as it is. Last, a
+# database that is no database: the start fails, the file is moved aside and
+# the process ends with status 0 at once.
 set -u
 bin=$1
 root=$(mktemp -d /tmp/kelvo-stop-XXXXXX)
@@ -46,4 +48,14 @@ run 2
 grep -q 'Domestic beta user' "$root/start2.log" && fail "the second start rebuilt again"
 [ "$(rows)" = 1 ] || fail "$(rows) rows after the second start"
 [ "$(zips)" = 1 ] || fail "$(zips) backups after the second start"
+rm -rf "$root/data/log/kelvo"
+mkdir -p "$(dirname "$db")"
+head -c 8192 /dev/zero | tr '\0' 'Z' >"$db"
+KELVO_ROOT=$root timeout 20 "$bin" 2>"$root/start3.log"
+rc=$?
+[ $rc = 0 ] || fail "a failed start ended with status $rc"
+grep -q 'Failed to start storage' "$root/start3.log" || fail "the start did not fail"
+grep -q 'Failed to remove file' "$root/start3.log" && fail "deleted a file already moved aside"
+moved=$(ls "$root/data/log/kelvo/backup")
+[ "$(head -c 4 "$root/data/log/kelvo/backup/$moved")" = ZZZZ ] || fail "not moved aside: $moved"
 echo "PASS"
