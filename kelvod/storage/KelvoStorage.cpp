@@ -235,8 +235,8 @@ int32_t KelvoStorage::dropAllTables() {
     // Tables only: never indexes, views or SQLite's own tables.
     android::Parcel reply;
     if (runQuery(android::String8("SELECT name FROM sqlite_master WHERE type = 'table' AND "
-                                      "name NOT LIKE 'sqlite\\_%' ESCAPE '\\'"),
-                     &reply) < 0) {
+                                  "name NOT LIKE 'sqlite\\_%' ESCAPE '\\'"),
+                 &reply) < 0) {
         KLOGE("Failed to query sqlite_master table");
         return -2;
     }

@@ -97,14 +97,15 @@ void SchemaTable::createTables() {
         }
         android::Parcel version;
         makeVersion(*table, &version);
-        mStorage->bufferInsert(ParcelMessage(MESSAGE_STORAGE_ENTRY, STORAGE_INSERT_ENTRIES, version));
+        mStorage->bufferInsert(
+            ParcelMessage(MESSAGE_STORAGE_ENTRY, STORAGE_INSERT_ENTRIES, version));
     }
 }
 
 int32_t SchemaTable::checkVersions() {
+    android::String8 query("SELECT module, version FROM schema_version");
     android::Parcel reply;
-    if (mStorage->runQuery(android::String8("SELECT module, version FROM schema_version"),
-                           &reply) < 0) {
+    if (mStorage->runQuery(query, &reply) < 0) {
         KLOGE("Failed to query schema version table");
         return -2;
     }
