@@ -4,6 +4,7 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 
 #include <cutils/properties.h>
@@ -87,7 +88,18 @@ int32_t KelvoStorage::addSchema(const table_attribute& table) {
 }
 
 int32_t KelvoStorage::startConnection() {
-    return sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, kStart));
+    std::unique_lock<std::mutex> lock(mStartLock);
+    mStartDone = false;
+    if (sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, kStart)) < 0) {
+        KLOGE("Failed to post the storage start");
+        return -2;
+    }
+    if (!mStartCond.wait_for(lock, std::chrono::milliseconds(kStartTimeoutMs),
+                             [this] { return mStartDone; })) {
+        KLOGE("Storage start timed out");
+        return -1;
+    }
+    return mStartResult;
 }
 
 int32_t KelvoStorage::closeConnection() {
@@ -372,8 +384,14 @@ int32_t KelvoStorage::handleCustomized(int32_t what) {
             return 0;
         case kVacuum:
             return doVacuumDatabase();
-        case kStart:
-            return doStartConnection();
+        case kStart: {
+            int32_t result = doStartConnection();
+            std::lock_guard<std::mutex> guard(mStartLock);
+            mStartResult = result;
+            mStartDone = true;
+            mStartCond.notify_all();
+            return result;
+        }
         case kClose:
             return doCloseConnection();
         case kShutdown: {

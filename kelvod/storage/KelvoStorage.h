@@ -4,7 +4,9 @@
 #include <sys/types.h>
 
 #include <atomic>
+#include <condition_variable>
 #include <memory>
+#include <mutex>
 #include <vector>
 
 #include <binder/Parcel.h>
@@ -45,14 +47,17 @@ public:
     static constexpr int64_t kDefaultFlushPeriodNs = 180000000000LL;
     static constexpr int64_t kMaxBufferBytes = 5242880;
     static constexpr size_t kMaxBufferRequests = 300;
+    // Longest wait for the start: a rebuild copies and zips the old
+    // database first, which may take longer than a synchronous send waits.
+    static constexpr int64_t kStartTimeoutMs = 600000;
 
     // The agent's clean step reaches every owner's cleanTables; null in
     // tests that run the storage alone.
     explicit KelvoStorage(KelvoAgent* agent);
     ~KelvoStorage() override;
 
-    // Opens the database and checks or rebuilds its tables, as one
-    // synchronous message to the storage thread.
+    // Opens the database and checks or rebuilds its tables, as one message
+    // to the storage thread; waits for its result (kStartTimeoutMs at most).
     int32_t startConnection();
     // Closes the connection on the storage thread; buffered rows stay.
     int32_t closeConnection();
@@ -121,6 +126,11 @@ private:
     // The thread that handles this thread's messages, once it has handled
     // one: the only one allowed to run SQL.
     std::atomic<pid_t> mThreadId;
+    // The result of the start, handed back to the thread that waits for it.
+    std::mutex mStartLock;
+    std::condition_variable mStartCond;
+    bool mStartDone = false;
+    int32_t mStartResult = -1;
 };
 
 } // namespace kelvo

@@ -234,7 +234,10 @@ TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
                   db.exec("CREATE TABLE legacy(id INTEGER PRIMARY KEY AUTOINCREMENT, v TEXT)"));
         ASSERT_EQ(SQLITE_OK, db.exec("INSERT INTO legacy(v) VALUES ('x')"));
     }
+    // The rebuild (backup, zip, drop, create) outlasts a synchronous send.
+    kelvo::HandlerThread::setSyncTimeoutMs(1);
     start({&kScreenStateV11});
+    kelvo::HandlerThread::setSyncTimeoutMs(0);
     DirectDb db(dbPath());
     EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
                                                     "'legacy'"));
