@@ -157,46 +157,48 @@ TEST_F(XmlParserTest, SimpleAndTextRepliesHoldOneEntryPerParameter) {
                              ANDROID_LOG_ERROR));
 }
 
-TEST_F(XmlParserTest, GroupedRepliesKeyedUnkeyedSingleAndMissing) {
+// Grouped answers: id, then "1, [key,] value" per value, -1 after each
+// parameter and once more at the end. A bad value ends its parameter
+// without a lone "value follows" mark; the next parameter still comes.
+TEST_F(XmlParserTest, GroupedRepliesKeyedUnkeyedSingleMissingAndBad) {
     mRoot.writeFile(kDataPath, kTestXml);
-    Parcel reply;
-    ASSERT_EQ(0, grouped(0, 4, -1, true, &reply));
-    EXPECT_EQ(ints({1, 1, 10, 100, 1, 20, -200, -1, 2, 1, 30, 300, -1, -1}), bytesOf(reply));
-    EXPECT_EQ(0u, reply.dataPosition());
-    ASSERT_EQ(0, grouped(0, 4, -1, false, &reply));
-    EXPECT_EQ(ints({1, 1, 100, 1, -200, -1, 2, 1, 300, -1, -1}), bytesOf(reply));
-    ASSERT_EQ(0, grouped(0, 4, 2, true, &reply));
-    EXPECT_EQ(ints({2, 1, 30, 300, -1, -1}), bytesOf(reply));
-    ASSERT_EQ(0, grouped(0, 4, 1, false, &reply));
-    EXPECT_EQ(ints({1, 1, 100, 1, -200, -1, -1}), bytesOf(reply));
-    // A parameter the component does not have: only the end mark, success.
-    ASSERT_EQ(0, grouped(0, 4, 5, true, &reply));
-    EXPECT_EQ(ints({-1}), bytesOf(reply));
-
+    struct Case {
+        int32_t component;
+        int32_t parameter;
+        bool keyed;
+        Bytes answer;
+        const char* log;
+    };
+    const Case cases[] = {
+        {4, -1, true, ints({1, 1, 10, 100, 1, 20, -200, -1, 2, 1, 30, 300, -1, -1}), ""},
+        {4, -1, false, ints({1, 1, 100, 1, -200, -1, 2, 1, 300, -1, -1}), ""},
+        {4, 2, true, ints({2, 1, 30, 300, -1, -1}), ""},
+        {4, 1, false, ints({1, 1, 100, 1, -200, -1, -1}), ""},
+        {4, 5, true, ints({-1}), ""}, // a parameter the component does not have
+        {5, -1, true, ints({1, 1, 0, 11, -1, 2, 1, 1, 21, -1, -1}),
+         "Failed to get value attribute key of parameter"},
+        {5, -1, false, ints({1, 1, 11, 1, 12, 1, 13, -1, 2, 1, 21, -1, -1}), ""},
+        {6, -1, true, ints({0, 1, 0, 5, -1, 1, 1, 0, 7, -1, -1}), "Failed to get value of parameter"},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(testing::Message() << c.component << " " << c.parameter << " " << c.keyed);
+        mLog.clear();
+        Parcel reply;
+        ASSERT_EQ(0, grouped(0, c.component, c.parameter, c.keyed, &reply));
+        EXPECT_EQ(c.answer, bytesOf(reply));
+        EXPECT_EQ(0u, reply.dataPosition());
+        if (c.log[0] != '\0') {
+            EXPECT_EQ(1u, mLog.count(c.log, ANDROID_LOG_ERROR));
+        }
+    }
     // The reader gives the same back.
     std::vector<config_parameter> all = groups(0, 4, -1, true);
     ASSERT_EQ(2u, all.size());
     EXPECT_EQ(20, all[0].values.at(1).key);
     EXPECT_EQ(-200, all[0].values.at(1).value);
     EXPECT_EQ(300, all[1].values.at(0).value);
-}
-
-TEST_F(XmlParserTest, BadGroupedValuesEndTheirParameterAndLeaveNoLoneMark) {
-    mRoot.writeFile(kDataPath, kTestXml);
-    Parcel reply;
-    // A keyed request meets a value without key: parameter 1 ends there,
-    // parameter 2 still comes.
-    ASSERT_EQ(0, grouped(0, 5, -1, true, &reply));
-    EXPECT_EQ(ints({1, 1, 0, 11, -1, 2, 1, 1, 21, -1, -1}), bytesOf(reply));
-    EXPECT_EQ(1u, mLog.count("Failed to get value attribute key of parameter", ANDROID_LOG_ERROR));
-    // Unkeyed, the same values are all fine.
-    ASSERT_EQ(0, grouped(0, 5, -1, false, &reply));
-    EXPECT_EQ(ints({1, 1, 11, 1, 12, 1, 13, -1, 2, 1, 21, -1, -1}), bytesOf(reply));
-    // A value that is not an integer: no "value follows" mark without a value.
-    ASSERT_EQ(0, grouped(0, 6, -1, true, &reply));
-    EXPECT_EQ(ints({0, 1, 0, 5, -1, 1, 1, 0, 7, -1, -1}), bytesOf(reply));
-    EXPECT_EQ(1u, mLog.count("Failed to get value of parameter", ANDROID_LOG_ERROR));
     // A parameter without id, or with the end mark as id, fails the lookup.
+    Parcel reply;
     EXPECT_EQ(-1, grouped(0, 7, -1, false, &reply));
     EXPECT_EQ(-1, grouped(0, 8, -1, false, &reply));
     EXPECT_EQ(2u, mLog.count("Failed to get attribute id of parameter", ANDROID_LOG_ERROR));
