@@ -12,5 +12,7 @@ int main(int argc, char** argv) {
     agent->initiate();
     android::ProcessState::self()->startThreadPool();
     android::IPCThreadState::self()->joinThreadPool(true);
+    // The pool returns on an orderly stop (SIGTERM): keep what is buffered.
+    agent->stop();
     return 0;
 }

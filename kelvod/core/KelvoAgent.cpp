@@ -1,5 +1,7 @@
 #include "core/KelvoAgent.h"
 
+#include <unistd.h>
+
 #include <atomic>
 #include <cstdlib>
 
@@ -35,7 +37,9 @@ Factories& factories() {
     return *f;
 }
 
-std::atomic<KelvoAgent::ExitHook> gExitHook{&exit};
+// _exit: the other threads still run, so no static destructor may run under
+// them.
+std::atomic<KelvoAgent::ExitHook> gExitHook{&_exit};
 
 std::mutex gInstanceLock;
 android::sp<KelvoAgent>* gInstance = nullptr;
@@ -92,7 +96,7 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
 }
 
 void KelvoAgent::setExitHook(ExitHook hook) {
-    gExitHook = hook != nullptr ? hook : &exit;
+    gExitHook = hook != nullptr ? hook : &_exit;
 }
 
 KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {
@@ -197,6 +201,12 @@ void KelvoAgent::startStorage() {
         // The next start builds a fresh database; its journal goes with it.
         KelvoUtils::deleteDatabaseFiles(KelvoStorage::kDatabasePath);
         gExitHook.load()(0);
+    }
+}
+
+void KelvoAgent::stop() {
+    if (mStorage != nullptr && mStorage->shutdown() < 0) {
+        KLOGE("Failed to stop storage");
     }
 }
 

@@ -56,6 +56,9 @@ public:
     // Runs the start-up sequence; returns the result of starting the
     // dispatcher.
     int32_t initiate();
+    // The orderly stop, once the binder pool has returned: buffered rows are
+    // written and the database closed (bounded by the synchronous time-out).
+    void stop();
 
     int32_t sendToHandler(int32_t id, int32_t code, const android::Parcel& data,
                           android::Parcel* reply, bool sync);

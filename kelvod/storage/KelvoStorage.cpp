@@ -4,10 +4,12 @@
 #include <unistd.h>
 
 #include <cerrno>
+#include <chrono>
 #include <cstring>
 
 #include <cutils/properties.h>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "core/KelvoAgent.h"
@@ -22,8 +24,12 @@ namespace kelvo {
 
 namespace {
 
+// Customized tags of the storage thread's own messages.
 constexpr int32_t kFlushTick = 0;
 constexpr int32_t kVacuum = 1;
+constexpr int32_t kStart = 2;
+constexpr int32_t kClose = 3;
+constexpr int32_t kShutdown = 4;
 constexpr uid_t kSystemUid = 1000;
 
 int64_t readFlushPeriod() {
@@ -41,6 +47,26 @@ bool firstRow(const android::Parcel& reply) {
             reply.readInt32(&rows) == android::NO_ERROR && columns > 0 && rows > 0;
 }
 
+// The row count of an insert parcel (after its table name and column list);
+// 0 when the head cannot be read. The read position is kept.
+int64_t rowsOf(const android::Parcel& insert) {
+    size_t saved = insert.dataPosition();
+    insert.setDataPosition(0);
+    android::String8 text;
+    int32_t columns = 0;
+    int32_t rows = 0;
+    bool ok = insert.readString8(&text) == android::NO_ERROR &&
+              insert.readInt32(&columns) == android::NO_ERROR && columns >= 0;
+    for (int32_t i = 0; ok && i < columns; ++i) {
+        int32_t type = 0;
+        ok = insert.readString8(&text) == android::NO_ERROR &&
+             insert.readInt32(&type) == android::NO_ERROR;
+    }
+    ok = ok && insert.readInt32(&rows) == android::NO_ERROR;
+    insert.setDataPosition(saved);
+    return ok && rows > 0 ? rows : 0;
+}
+
 } // namespace
 
 KelvoStorage::KelvoStorage(KelvoAgent* agent)
@@ -49,7 +75,8 @@ KelvoStorage::KelvoStorage(KelvoAgent* agent)
       mBufferSize(0),
       mFlushPeriodNs(readFlushPeriod()),
       mTablesReady(false),
-      mFlushTickId(-1) {
+      mFlushTickId(-1),
+      mThreadId(0) {
     mSchema.reset(new SchemaTable(this));
     mManager.reset(new StorageManager(this));
 }
@@ -61,6 +88,34 @@ int32_t KelvoStorage::addSchema(const table_attribute& table) {
 }
 
 int32_t KelvoStorage::startConnection() {
+    std::unique_lock<std::mutex> lock(mStartLock);
+    mStartDone = false;
+    if (sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, kStart)) < 0) {
+        KLOGE("Failed to post the storage start");
+        return -2;
+    }
+    if (!mStartCond.wait_for(lock, std::chrono::milliseconds(kStartTimeoutMs),
+                             [this] { return mStartDone; })) {
+        KLOGE("Storage start timed out");
+        return -1;
+    }
+    return mStartResult;
+}
+
+int32_t KelvoStorage::closeConnection() {
+    return sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, kClose));
+}
+
+int32_t KelvoStorage::shutdown() {
+    return sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, kShutdown));
+}
+
+int32_t KelvoStorage::doStartConnection() {
+    if (mTablesReady) {
+        // Opening again would fail and move the live database aside.
+        KLOGI("Database connection already started");
+        return 0;
+    }
     StorageManager::checkFileSize(kDatabaseDir, kDatabaseName,
                                   StorageManager::getFileSizeThreshold(0));
 
@@ -73,7 +128,7 @@ int32_t KelvoStorage::startConnection() {
     std::string path = RootPath::resolve(kDatabasePath);
     android::Parcel open;
     open.writeCString(path.c_str());
-    if (doSqliteOperation(SQL_OPEN_CONNECTION, &open, nullptr) < 0) {
+    if (runSql(SQL_OPEN_CONNECTION, &open, nullptr) < 0) {
         KLOGE("Failed to open database connection!");
         mManager->moveDatabase();
         return -17;
@@ -104,7 +159,7 @@ int32_t KelvoStorage::startConnection() {
 
     mSchema->createTables();
     mTablesReady = true;
-    if (flushAllEntries() < 0) {
+    if (doFlushEntries() < 0) {
         KLOGE("Failed to flush all entries!");
         return -17;
     }
@@ -113,26 +168,56 @@ int32_t KelvoStorage::startConnection() {
     return 0;
 }
 
-int32_t KelvoStorage::closeConnection() {
-    if (doSqliteOperation(SQL_CLOSE_CONNECTION, nullptr, nullptr) < 0) {
+int32_t KelvoStorage::doCloseConnection() {
+    // Rows that come later wait in the buffer, as before the start.
+    mTablesReady = false;
+    if (runSql(SQL_CLOSE_CONNECTION, nullptr, nullptr) < 0) {
         KLOGE("Failed to close database connection!");
         return -17;
     }
-    mTablesReady = false;
     return 0;
 }
 
 void KelvoStorage::armFlushTimer() {
-    int32_t previous = mFlushTickId.exchange(-1);
-    if (previous >= 0) {
-        removeMessage(previous);
+    // Runs on the storage thread only, like the tick that re-arms itself, so
+    // no second start can race it into two ticks.
+    if (mFlushTickId >= 0) {
+        removeMessage(mFlushTickId);
     }
     mFlushTickId = sendMessageDelayed(mFlushPeriodNs, ParcelMessage(MESSAGE_CUSTOMIZED, kFlushTick));
 }
 
+int32_t KelvoStorage::runSql(int32_t action, const android::Parcel* in, android::Parcel* out) {
+    // The one-SQL-thread rule, checked: the connection has no lock.
+    if (gettid() != mThreadId.load(std::memory_order_relaxed)) {
+        KLOGE("SQL refused off the storage thread: %d", action);
+        return -1;
+    }
+    return doSqliteOperation(action, in, out);
+}
+
+int32_t KelvoStorage::runQuery(const android::String8& sql, android::Parcel* reply) {
+    android::Parcel data;
+    data.writeString8(sql);
+    data.setDataPosition(0);
+    return doQueryEntries(data, reply);
+}
+
+int32_t KelvoStorage::runStatement(const android::String8& sql) {
+    android::Parcel data;
+    data.writeString8(sql);
+    data.setDataPosition(0);
+    return doExecuteEntry(data);
+}
+
+void KelvoStorage::bufferInsert(const ParcelMessage& msg) {
+    mBuffer.push_back(msg);
+    mBufferSize += static_cast<int64_t>(msg.getParcel().dataSize());
+}
+
 int64_t KelvoStorage::getTableCount() {
     android::Parcel reply;
-    if (queryEntries(android::String8("SELECT COUNT(*) FROM sqlite_master"), &reply) < 0 ||
+    if (runQuery(android::String8("SELECT COUNT(*) FROM sqlite_master"), &reply) < 0 ||
         !firstRow(reply)) {
         KLOGE("Failed to query sqlite_master table");
         return -2;
@@ -144,7 +229,7 @@ bool KelvoStorage::isSoftwareVersionChanged() {
     android::String8 sql("SELECT value FROM about_kelvo_daemon WHERE key = ");
     sql.append(KelvoUtils::quoteSqlText("software_version"));
     android::Parcel reply;
-    if (queryEntries(sql, &reply) < 0) {
+    if (runQuery(sql, &reply) < 0) {
         KLOGE("Failed to query software version");
         return false;
     }
@@ -161,9 +246,9 @@ bool KelvoStorage::isSoftwareVersionChanged() {
 int32_t KelvoStorage::dropAllTables() {
     // Tables only: never indexes, views or SQLite's own tables.
     android::Parcel reply;
-    if (queryEntries(android::String8("SELECT name FROM sqlite_master WHERE type = 'table' AND "
-                                      "name NOT LIKE 'sqlite\\_%' ESCAPE '\\'"),
-                     &reply) < 0) {
+    if (runQuery(android::String8("SELECT name FROM sqlite_master WHERE type = 'table' AND "
+                                  "name NOT LIKE 'sqlite\\_%' ESCAPE '\\'"),
+                 &reply) < 0) {
         KLOGE("Failed to query sqlite_master table");
         return -2;
     }
@@ -184,7 +269,7 @@ int32_t KelvoStorage::dropTables(const android::Parcel& reply) {
         }
         android::String8 sql("DROP TABLE ");
         sql.append(KelvoUtils::quoteSqlIdentifier(name.string()));
-        int32_t ret = executeEntry(sql, true);
+        int32_t ret = runStatement(sql);
         if (ret < 0) {
             KLOGE("Failed to drop table: %s", name.string());
             return ret;
@@ -209,6 +294,11 @@ int32_t KelvoStorage::executeEntry(const android::String8& sql, bool sync) {
 }
 
 int32_t KelvoStorage::queryEntries(const android::String8& sql, android::Parcel* reply) {
+    if (reply == nullptr) {
+        KLOGE("Invalid reply parcel");
+        HealthCounters::add(Health::StorageEntryRefused);
+        return -5;
+    }
     android::Parcel data;
     data.writeString8(sql);
     return sendMessageSync(ParcelMessage(MESSAGE_STORAGE_ENTRY, STORAGE_QUERY_ENTRIES, data, reply));
@@ -239,6 +329,7 @@ int32_t KelvoStorage::remoteDebug(int32_t action, const android::String8& argume
 }
 
 int32_t KelvoStorage::handleParcelMessage(const ParcelMessage& msg) {
+    mThreadId.store(gettid(), std::memory_order_relaxed);
     switch (msg.type) {
         case MESSAGE_STORAGE_ENTRY:
             if (msg.what == STORAGE_INSERT_ENTRIES) {
@@ -249,6 +340,7 @@ int32_t KelvoStorage::handleParcelMessage(const ParcelMessage& msg) {
             return handleCustomized(msg.what);
         default:
             KLOGE("Unknow message type: %d", msg.type);
+            HealthCounters::add(Health::StorageEntryRefused);
             return -3;
     }
 }
@@ -278,6 +370,7 @@ int32_t KelvoStorage::handleEntry(int32_t what, const android::Parcel& data,
         }
         default:
             KLOGE("Unknow entry type: %d", what);
+            HealthCounters::add(Health::StorageEntryRefused);
             return -3;
     }
 }
@@ -291,14 +384,30 @@ int32_t KelvoStorage::handleCustomized(int32_t what) {
             return 0;
         case kVacuum:
             return doVacuumDatabase();
+        case kStart: {
+            int32_t result = doStartConnection();
+            std::lock_guard<std::mutex> guard(mStartLock);
+            mStartResult = result;
+            mStartDone = true;
+            mStartCond.notify_all();
+            return result;
+        }
+        case kClose:
+            return doCloseConnection();
+        case kShutdown: {
+            int32_t flushed = doFlushEntries();
+            int32_t closed = doCloseConnection();
+            return flushed < 0 ? flushed : closed;
+        }
         default:
             KLOGE("Invalid tag: %d", what);
+            HealthCounters::add(Health::StorageEntryRefused);
             return -3;
     }
 }
 
 int32_t KelvoStorage::doCreateTable(const android::Parcel& data) {
-    if (doSqliteOperation(SQL_CREATE_TABLE, &data, nullptr) < 0) {
+    if (runSql(SQL_CREATE_TABLE, &data, nullptr) < 0) {
         KLOGE("Failed to create table");
         return -17;
     }
@@ -306,8 +415,7 @@ int32_t KelvoStorage::doCreateTable(const android::Parcel& data) {
 }
 
 int32_t KelvoStorage::doInsertEntries(const ParcelMessage& msg) {
-    mBuffer.push_back(msg);
-    mBufferSize += static_cast<int64_t>(msg.getParcel().dataSize());
+    bufferInsert(msg);
     // Before the tables exist, rows only wait.
     if (!mTablesReady) {
         return 0;
@@ -326,9 +434,19 @@ int32_t KelvoStorage::doFlushEntries() {
         mBufferSize = 0;
         return 0;
     }
-    if (doSqliteOperation(SQL_BEGIN_TRANSACTION, nullptr, nullptr) < 0) {
+    // No tables (before the start, after the close): the rows wait for them.
+    if (!mTablesReady) {
+        HealthCounters::add(Health::InsertsDeferred);
+        return 0;
+    }
+    int64_t rowCount = 0;
+    for (const ParcelMessage& request : mBuffer) {
+        rowCount += rowsOf(request.getParcel());
+    }
+    if (runSql(SQL_BEGIN_TRANSACTION, nullptr, nullptr) < 0) {
         mBuffer.clear();
         mBufferSize = 0;
+        HealthCounters::add(Health::FlushRowsAbandoned, rowCount);
         KLOGE("Failed to start batch, abandon all entries");
         return -17;
     }
@@ -336,7 +454,11 @@ int32_t KelvoStorage::doFlushEntries() {
     for (const ParcelMessage& request : mBuffer) {
         const android::Parcel& rows = request.getParcel();
         rows.setDataPosition(0);
-        if (doSqliteOperation(SQL_INSERT_ENTRIES, &rows, nullptr) < 0) {
+        if (runSql(SQL_INSERT_ENTRIES, &rows, nullptr) < 0) {
+            // A parcel is stored whole or not at all.
+            int64_t lost = rowsOf(rows);
+            HealthCounters::add(Health::FlushRowsAbandoned, lost);
+            rowCount -= lost;
             faulty = true;
         }
         mBufferSize -= static_cast<int64_t>(rows.dataSize());
@@ -349,7 +471,9 @@ int32_t KelvoStorage::doFlushEntries() {
     if (faulty) {
         KLOGE("Some error occurred while inserting entries");
     }
-    if (doSqliteOperation(SQL_COMMIT_TRANSACTION, nullptr, nullptr) < 0) {
+    if (runSql(SQL_COMMIT_TRANSACTION, nullptr, nullptr) < 0) {
+        // The batch is rolled back.
+        HealthCounters::add(Health::FlushRowsAbandoned, rowCount);
         doVacuumDatabase();
         KLOGE("Failed to end batch");
         return -17;
@@ -359,7 +483,7 @@ int32_t KelvoStorage::doFlushEntries() {
 }
 
 int32_t KelvoStorage::doVacuumDatabase() {
-    if (doSqliteOperation(SQL_VACUUM_DATABASE, nullptr, nullptr) < 0) {
+    if (runSql(SQL_VACUUM_DATABASE, nullptr, nullptr) < 0) {
         KLOGE("Failed to vacuum database");
         return -17;
     }
@@ -368,7 +492,7 @@ int32_t KelvoStorage::doVacuumDatabase() {
 }
 
 int32_t KelvoStorage::doExecuteEntry(const android::Parcel& data) {
-    if (doSqliteOperation(SQL_EXECUTE_ENTRY, &data, nullptr) < 0) {
+    if (runSql(SQL_EXECUTE_ENTRY, &data, nullptr) < 0) {
         KLOGE("Failed to execute entry");
         return -17;
     }
@@ -376,11 +500,7 @@ int32_t KelvoStorage::doExecuteEntry(const android::Parcel& data) {
 }
 
 int32_t KelvoStorage::doQueryEntries(const android::Parcel& data, android::Parcel* reply) {
-    if (reply == nullptr) {
-        KLOGE("Invalid reply parcel");
-        return -5;
-    }
-    if (doSqliteOperation(SQL_SIMPLE_QUERY, &data, reply) < 0) {
+    if (runSql(SQL_SIMPLE_QUERY, &data, reply) < 0) {
         KLOGE("Failed to query entries");
         return -17;
     }
@@ -402,7 +522,7 @@ int32_t KelvoStorage::doCleanDatabase(const android::Parcel& data) {
 
 int32_t KelvoStorage::doBackupCopy(const android::Parcel& data) {
     data.setDataPosition(0);
-    if (doSqliteOperation(SQL_BACKUP_COPY, &data, nullptr) < 0) {
+    if (runSql(SQL_BACKUP_COPY, &data, nullptr) < 0) {
         KLOGE("Failed to backup copy");
         return -17;
     }

@@ -1,9 +1,12 @@
 #pragma once
 
 #include <stdint.h>
+#include <sys/types.h>
 
 #include <atomic>
+#include <condition_variable>
 #include <memory>
+#include <mutex>
 #include <vector>
 
 #include <binder/Parcel.h>
@@ -31,9 +34,11 @@ enum storage_entry_type {
     STORAGE_REMOTE_DEBUG = 7,    // int32 action, String8 argument
 };
 
-// The one thread that touches the database. Inserts are buffered and written
-// in one transaction when the buffer passes its limits, when the periodic
-// flush fires, or when a flush is forced.
+// The one thread that touches the database: every statement, the start-up
+// rebuild and the closing included, runs on it. Inserts are buffered and
+// written in one transaction when the buffer passes its limits, when the
+// periodic flush fires, or when a flush is forced. Until the tables exist
+// (before the start, after the close) a flush keeps the buffer.
 class KelvoStorage : public HandlerThread, public DatabaseCopier {
 public:
     static constexpr const char* kDatabaseDir = "/data/log/kelvo";
@@ -42,14 +47,23 @@ public:
     static constexpr int64_t kDefaultFlushPeriodNs = 180000000000LL;
     static constexpr int64_t kMaxBufferBytes = 5242880;
     static constexpr size_t kMaxBufferRequests = 300;
+    // Longest wait for the start: a rebuild copies and zips the old
+    // database first, which may take longer than a synchronous send waits.
+    static constexpr int64_t kStartTimeoutMs = 600000;
 
     // The agent's clean step reaches every owner's cleanTables; null in
     // tests that run the storage alone.
     explicit KelvoStorage(KelvoAgent* agent);
     ~KelvoStorage() override;
 
+    // Opens the database and checks or rebuilds its tables, as one message
+    // to the storage thread; waits for its result (kStartTimeoutMs at most).
     int32_t startConnection();
+    // Closes the connection on the storage thread; buffered rows stay.
     int32_t closeConnection();
+    // The orderly stop: writes the buffered rows, then closes the connection,
+    // in one synchronous message (bounded by the synchronous time-out).
+    int32_t shutdown();
     int32_t addSchema(const table_attribute& table);
 
     int32_t createTable(const android::Parcel& data);
@@ -70,6 +84,17 @@ public:
     int32_t handleParcelMessage(const ParcelMessage& msg) override;
 
 private:
+    friend class SchemaTable;
+
+    // Every statement goes through here; refused on any other thread.
+    int32_t runSql(int32_t action, const android::Parcel* in, android::Parcel* out);
+    int32_t doStartConnection();
+    int32_t doCloseConnection();
+    // A query run on the storage thread itself; the reply is rewound.
+    int32_t runQuery(const android::String8& sql, android::Parcel* reply);
+    int32_t runStatement(const android::String8& sql);
+    // Appends one insert parcel to the buffer without flushing.
+    void bufferInsert(const ParcelMessage& msg);
     int64_t getTableCount();
     bool isSoftwareVersionChanged();
     int32_t dropAllTables();
@@ -92,10 +117,20 @@ private:
     std::vector<ParcelMessage> mBuffer;
     int64_t mBufferSize;
     int64_t mFlushPeriodNs;
-    // Set once the tables exist: until then inserts only wait in the buffer.
-    std::atomic<bool> mTablesReady;
+    // Set once the tables exist, cleared by the close: until then rows only
+    // wait in the buffer. Storage thread only.
+    bool mTablesReady;
     // The pending flush tick, so a second start does not arm a second one.
-    std::atomic<int32_t> mFlushTickId;
+    // Storage thread only.
+    int32_t mFlushTickId;
+    // The thread that handles this thread's messages, once it has handled
+    // one: the only one allowed to run SQL.
+    std::atomic<pid_t> mThreadId;
+    // The result of the start, handed back to the thread that waits for it.
+    std::mutex mStartLock;
+    std::condition_variable mStartCond;
+    bool mStartDone = false;
+    int32_t mStartResult = -1;
 };
 
 } // namespace kelvo

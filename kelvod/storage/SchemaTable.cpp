@@ -1,6 +1,7 @@
 #include "storage/SchemaTable.h"
 
 #include <set>
+#include <vector>
 
 #include "KelvoLog.h"
 #include "storage/KelvoStorage.h"
@@ -27,8 +28,14 @@ SchemaTable::SchemaTable(KelvoStorage* storage) : mStorage(storage) {
 }
 
 int32_t SchemaTable::addSchema(const table_attribute& table) {
-    std::lock_guard<std::mutex> guard(mLock);
-    if (!mTables.emplace(table.name, &table).second) {
+    bool added = false;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        added = mTables.emplace(table.name, &table).second;
+    }
+    // Logged without the lock: an error line may be forwarded to other
+    // threads' locks.
+    if (!added) {
         KLOGE("Table name %s already exist", table.name);
         return -13;
     }
@@ -73,25 +80,32 @@ void SchemaTable::makeVersion(const table_attribute& table, android::Parcel* out
 }
 
 void SchemaTable::createTables() {
-    std::lock_guard<std::mutex> guard(mLock);
-    for (const auto& entry : mTables) {
-        const table_attribute& table = *entry.second;
+    std::vector<const table_attribute*> tables;
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        for (const auto& entry : mTables) {
+            tables.push_back(entry.second);
+        }
+    }
+    for (const table_attribute* table : tables) {
         android::Parcel create;
-        makeColumns(table, &create);
-        if (mStorage->createTable(create) < 0) {
-            KLOGE("Failed to create table: %s", table.name);
+        makeColumns(*table, &create);
+        create.setDataPosition(0);
+        if (mStorage->doCreateTable(create) < 0) {
+            KLOGE("Failed to create table: %s", table->name);
             continue;
         }
         android::Parcel version;
-        makeVersion(table, &version);
-        mStorage->insertEntries(version);
+        makeVersion(*table, &version);
+        mStorage->bufferInsert(
+            ParcelMessage(MESSAGE_STORAGE_ENTRY, STORAGE_INSERT_ENTRIES, version));
     }
 }
 
 int32_t SchemaTable::checkVersions() {
+    android::String8 query("SELECT module, version FROM schema_version");
     android::Parcel reply;
-    if (mStorage->queryEntries(android::String8("SELECT module, version FROM schema_version"),
-                               &reply) < 0) {
+    if (mStorage->runQuery(query, &reply) < 0) {
         KLOGE("Failed to query schema version table");
         return -2;
     }

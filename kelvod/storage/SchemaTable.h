@@ -18,6 +18,8 @@ class KelvoStorage;
 // The registry of table definitions. At start-up it either confirms that the
 // database was created from exactly these definitions (schema_version holds
 // one row per table with its version) or creates every table anew.
+// createTables and checkVersions run on the storage thread (its start-up
+// message); the registry's lock is never held while they run SQL or log.
 class SchemaTable {
 public:
     explicit SchemaTable(KelvoStorage* storage);

@@ -18,6 +18,7 @@
 #include <set>
 #include <thread>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "kelvo/RootPath.h"
 #include "storage/DatabaseCopier.h"
@@ -191,6 +192,16 @@ int64_t now() {
     return TimeProvider::getCurrentTime(TIME_TYPE_WALL);
 }
 
+// Deletes a file a clean gives up (the caller has logged why); counted, as
+// what it held is gone.
+int32_t discardFile(const char* path) {
+    int32_t ret = FileUtils::deleteFile(path);
+    if (ret == 0) {
+        HealthCounters::add(Health::FilesDeleted);
+    }
+    return ret;
+}
+
 } // namespace
 
 StorageManager::StorageManager(DatabaseCopier* copier) : mCopier(copier), mRemoteDebugDay(-1) {}
@@ -337,7 +348,7 @@ int32_t StorageManager::listValidFiles(const std::string& dir, FileList* list) {
                 KLOGE("Failed to delete directory: %s, error: %s", path.c_str(), strerror(errno));
             }
         } else {
-            FileUtils::deleteFile(path.c_str());
+            discardFile(path.c_str());
         }
     }
     for (auto& item : *list) {
@@ -359,14 +370,14 @@ int32_t StorageManager::checkHostFileSize(const std::string& dir, const std::str
     if (size > threshold) {
         KLOGE("File(%s/%s) is too large: %lld, threshold: %lld, DELETE!", dir.c_str(), name.c_str(),
               static_cast<long long>(size), static_cast<long long>(threshold));
-        if (FileUtils::deleteFile(path.c_str()) != 0) {
+        if (discardFile(path.c_str()) != 0) {
             return -2;
         }
         // A database goes with its journal files, or they would be taken for
         // the journal of the next database of that name.
         if (endsWith(name, kDbExtension)) {
             for (const std::string& companion : existingCompanions(path)) {
-                FileUtils::deleteFile(companion.c_str());
+                discardFile(companion.c_str());
             }
         }
     }
@@ -412,13 +423,13 @@ int32_t StorageManager::renameFiles(const std::string& dir) {
         std::string name;
         if (makeBackupName(src, &name, 0) != 0) {
             KLOGE("Failed to make backup name: %s", src.c_str());
-            FileUtils::deleteFile(src.c_str());
+            discardFile(src.c_str());
             continue;
         }
         std::string dest = FileUtils::join(dir, name);
         if (FileUtils::renameFile(src.c_str(), dest.c_str()) != 0) {
             KLOGE("Failed to rename file src=%s, dest=%s", src.c_str(), dest.c_str());
-            FileUtils::deleteFile(src.c_str());
+            discardFile(src.c_str());
         }
     }
     return 0;
@@ -473,7 +484,7 @@ int32_t StorageManager::cleanFiles(const std::string& dir, int32_t keep) {
     for (const std::string& name : list[STORAGE_FILE_ZIP]) {
         if (scanName(name, true).age >= keep - 2) {
             KLOGI("File(%s/%s) expired: %d, DELETE!", dir.c_str(), name.c_str(), keep);
-            FileUtils::deleteFile(FileUtils::join(dir, name).c_str());
+            discardFile(FileUtils::join(dir, name).c_str());
         }
     }
     return 0;
@@ -507,7 +518,8 @@ int32_t StorageManager::cleanFiles(const std::string& dir, const std::string& ex
     closedir(d);
     int32_t ret = 0;
     for (const std::string& name : doomed) {
-        if (FileUtils::deleteFile(FileUtils::join(dir, name).c_str()) != 0) {
+        KLOGI("File(%s/%s) left over, DELETE!", dir.c_str(), name.c_str());
+        if (discardFile(FileUtils::join(dir, name).c_str()) != 0) {
             ret = -2;
         }
     }
@@ -619,7 +631,10 @@ int32_t StorageManager::cleanDatabase(int64_t time) {
     int32_t ret = cleanExpiredFiles();
     std::string backupDir = RootPath::resolve(kBackupDir);
     std::string uploadDir = RootPath::resolve(kUploadDir);
-    if (cleanFiles(backupDir, kDbExtension) != 0 || cleanFiles(uploadDir, kDbExtension) != 0) {
+    // Copies in the backup directory (a database moved aside after a failed
+    // open, a day whose zip failed) stay: the zip step below takes them.
+    // The upload directory's copy of an earlier day has served its turn.
+    if (cleanFiles(uploadDir, kDbExtension) != 0) {
         ret = -2;
     }
     int32_t backup = backupDatabase(time);
@@ -651,7 +666,8 @@ int32_t StorageManager::moveCompanions(const std::string& src, const std::string
             continue;
         }
         // Left in place it would be taken for the next database's journal.
-        if (FileUtils::deleteFile(from.c_str()) != 0) {
+        KLOGI("File(%s) without its database, DELETE!", from.c_str());
+        if (discardFile(from.c_str()) != 0) {
             ret = -2;
         }
     }

@@ -2,6 +2,7 @@
 
 #include <cinttypes>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "core/KelvoAgent.h"
 #include "storage/KelvoStorage.h"
@@ -41,6 +42,7 @@ int32_t StorageOperator::insertEntries(const table_attribute& table, const andro
     if (count > kMaxInsertRows) {
         KLOGE("Insert entries count(%d) reach limit(%d), table: %s", count, kMaxInsertRows,
               table.name);
+        HealthCounters::add(Health::StorageEntryRefused);
         return -5;
     }
     android::Parcel insert;
@@ -59,6 +61,7 @@ int32_t StorageOperator::queryEntriesSimple(const android::String8& sql, android
                                             int32_t columns, int32_t& rows) {
     if (columns < 1 || reply == nullptr || sql.isEmpty()) {
         KLOGE("Invalid parameter");
+        HealthCounters::add(Health::StorageEntryRefused);
         return -5;
     }
     android::sp<KelvoStorage> s = storage();
@@ -115,6 +118,7 @@ int32_t StorageOperator::updateEntries(const table_attribute& table, const andro
 int32_t StorageOperator::deleteEntries(const char* table, const char* condition) {
     if (table == nullptr || condition == nullptr) {
         KLOGE("Invalid parameter");
+        HealthCounters::add(Health::StorageEntryRefused);
         return -5;
     }
     android::sp<KelvoStorage> s = storage();
@@ -130,6 +134,7 @@ int32_t StorageOperator::cleanObsoleteEntries(const char* table, int64_t time,
                                               const char* column) {
     if (table == nullptr || column == nullptr) {
         KLOGE("Invalid parameter");
+        HealthCounters::add(Health::StorageEntryRefused);
         return -5;
     }
     android::sp<KelvoStorage> s = storage();
@@ -146,6 +151,7 @@ int32_t StorageOperator::cleanObsoleteEntries(const char* table, int64_t time,
 int32_t StorageOperator::cleanAllEntries(const char* table) {
     if (table == nullptr) {
         KLOGE("Invalid parameter");
+        HealthCounters::add(Health::StorageEntryRefused);
         return -5;
     }
     android::sp<KelvoStorage> s = storage();

@@ -160,12 +160,13 @@ int32_t FileUtils::createDirectory(const char* path, mode_t mode) {
 }
 
 int32_t FileUtils::chownDir(const char* path, uid_t owner, gid_t group) {
-    if (fchownat(AT_FDCWD, path, owner, group, AT_SYMLINK_NOFOLLOW) != 0) {
+    int ret = fchownat(AT_FDCWD, path, owner, group, AT_SYMLINK_NOFOLLOW);
+    if (ret != 0) {
         // Only root may give a file away; elsewhere the change is skipped.
         if (errno == EPERM && geteuid() != 0) {
             return 0;
         }
-        KLOGE("Failed to change owner of %s: %s", path, strerror(errno));
+        KLOGE("Failed to chown dir: %d %s, error: %s", ret, path, strerror(errno));
         return -1;
     }
     return 0;
@@ -173,16 +174,16 @@ int32_t FileUtils::chownDir(const char* path, uid_t owner, gid_t group) {
 
 int32_t FileUtils::chmodFile(const char* path, mode_t mode) {
     struct stat st = {};
-    if (lstat(path, &st) != 0) {
-        KLOGE("Failed to change mode of %s: %s", path, strerror(errno));
-        return -1;
+    int ret = lstat(path, &st);
+    if (ret == 0 && S_ISLNK(st.st_mode)) {
+        // Never through a link: the mode would land on its target.
+        ret = -1;
+        errno = ELOOP;
+    } else if (ret == 0) {
+        ret = chmod(path, mode);
     }
-    if (S_ISLNK(st.st_mode)) {
-        KLOGE("Failed to change mode of %s: symbolic link", path);
-        return -1;
-    }
-    if (chmod(path, mode) != 0) {
-        KLOGE("Failed to change mode of %s: %s", path, strerror(errno));
+    if (ret != 0) {
+        KLOGE("Failed to chmod file: %d %s, error: %s", ret, path, strerror(errno));
         return -1;
     }
     return 0;

@@ -24,7 +24,10 @@ void KelvoUtils::deleteDatabaseFiles(const char* path) {
     if (path == nullptr) {
         return;
     }
-    deleteFile(path);
+    // A database already moved aside is no failure to report.
+    if (access(RootPath::resolve(path).c_str(), F_OK) == 0) {
+        deleteFile(path);
+    }
     for (const char* suffix : {"-journal", "-wal", "-shm"}) {
         std::string companion = std::string(path) + suffix;
         if (access(RootPath::resolve(companion).c_str(), F_OK) == 0) {

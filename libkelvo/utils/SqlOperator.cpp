@@ -6,10 +6,12 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <cctype>
 #include <cmath>
 #include <string>
 
+#include "HealthCounters.h"
 #include "LibKelvoLog.h"
 #include "SqlTypes.h"
 
@@ -20,9 +22,7 @@ namespace kelvo {
 
 namespace {
 
-// How long a statement waits for another connection's lock before it fails
-// with SQLITE_BUSY.
-constexpr int kBusyTimeoutMs = 2000;
+std::atomic<int> gBusyTimeoutMs{SqlOperator::kDefaultBusyTimeoutMs};
 
 // The fewest bytes one column takes in a create or insert parcel: the name's
 // length, its NUL (padded to 4) and the type.
@@ -31,11 +31,9 @@ constexpr size_t kMinColumnBytes = 12;
 // "YYYY-MM-DD HH:MM:SS" and its NUL.
 constexpr size_t kTimeTextSize = 20;
 
-// Every insert parcel runs inside this savepoint, so that a parcel is stored
-// whole or not at all, inside or outside the caller's transaction.
-// Prepared statements kept per connection; the daemon has fewer tables.
-constexpr size_t kMaxCachedStatements = 256;
-
+// Every insert parcel of more than one row runs inside this savepoint, so
+// that a parcel is stored whole or not at all, inside or outside the
+// caller's transaction.
 const char* const kInsertSavepoint = "SAVEPOINT kelvo_insert;";
 const char* const kInsertRelease = "RELEASE kelvo_insert;";
 const char* const kInsertRollback = "ROLLBACK TO kelvo_insert;";
@@ -54,12 +52,14 @@ int32_t readTableHead(const Parcel* in, std::string* table, int32_t* columns) {
     String8 name;
     if (in->readString8(&name) != android::NO_ERROR) {
         LLOGE("Invalid table name");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     int32_t count = 0;
     if (in->readInt32(&count) != android::NO_ERROR || count < 0 ||
         static_cast<size_t>(count) > in->dataAvail() / kMinColumnBytes) {
         LLOGE("Invalid column count: %d", count);
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     *table = toStdString(name);
@@ -71,6 +71,7 @@ int32_t readColumn(const Parcel* in, int32_t index, std::string* name, int32_t* 
     String8 text;
     if (in->readString8(&text) != android::NO_ERROR || in->readInt32(type) != android::NO_ERROR) {
         LLOGE("Invalid column %d", index);
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     *name = toStdString(text);
@@ -124,6 +125,10 @@ int64_t truncateReal(double value) {
 
 SqlOperator::SqlOperator() : mDatabase(nullptr) {}
 
+void SqlOperator::setBusyTimeoutMs(int ms) {
+    gBusyTimeoutMs.store(ms > 0 ? ms : kDefaultBusyTimeoutMs);
+}
+
 SqlOperator::~SqlOperator() {
     closeConnection();
 }
@@ -131,6 +136,7 @@ SqlOperator::~SqlOperator() {
 int32_t SqlOperator::openConnection(const Parcel* in) {
     if (in == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     if (mDatabase != nullptr) {
@@ -154,7 +160,7 @@ int32_t SqlOperator::openConnection(const Parcel* in) {
     // middle of a flush leaves a hot journal that the next open rolls back,
     // and every committed flush stays. The database stays a single file for
     // copies and uploads.
-    sqlite3_busy_timeout(database, kBusyTimeoutMs);
+    sqlite3_busy_timeout(database, gBusyTimeoutMs.load());
     mDatabase = database;
     if (executeStatement(String8("PRAGMA cache_size=100;")) < 0) {
         // sqlite3_open reads nothing; the pragma is the first read of the
@@ -241,6 +247,7 @@ int32_t SqlOperator::insertEntries(const Parcel* in) {
 int32_t SqlOperator::executeEntry(const Parcel* in) {
     if (in == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     String8 statement;
@@ -254,6 +261,7 @@ int32_t SqlOperator::executeEntry(const Parcel* in) {
 int32_t SqlOperator::simpleQueryEntries(const Parcel* in, Parcel* out) {
     if (in == nullptr || out == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     String8 query;
@@ -267,6 +275,7 @@ int32_t SqlOperator::simpleQueryEntries(const Parcel* in, Parcel* out) {
 int32_t SqlOperator::backupCopy(const Parcel* in) {
     if (in == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     if (mDatabase == nullptr) {
@@ -327,6 +336,7 @@ int32_t SqlOperator::backupCopy(const Parcel* in) {
 int32_t SqlOperator::translateCreate(const Parcel* in, String8* statement) {
     if (in == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     std::string table;
@@ -358,6 +368,7 @@ int32_t SqlOperator::translateCreate(const Parcel* in, String8* statement) {
                 break;
             default:
                 LLOGE("Unknown value type: %d", type);
+                HealthCounters::add(Health::LibraryParcelRefused);
                 return -1;
         }
         text += i + 1 < columns ? ", " : ");";
@@ -370,6 +381,7 @@ int32_t SqlOperator::translateInsert(const Parcel* in, String8* statement,
                                      std::vector<int32_t>* types) {
     if (in == nullptr) {
         LLOGE("Invalid parameter");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     std::string table;
@@ -408,6 +420,7 @@ int32_t SqlOperator::checkStatement(const String8& statement) {
     const char* semicolon = strchr(statement.string(), ';');
     if (semicolon != nullptr && semicolon[1] != '\0') {
         LLOGE("Statement may have injection issue");
+        HealthCounters::add(Health::LibraryParcelRefused);
         return -1;
     }
     if (mDatabase == nullptr) {
@@ -431,37 +444,45 @@ int32_t SqlOperator::prepareStatement(const String8& statement, sqlite3_stmt** s
     return 0;
 }
 
-sqlite3_stmt* SqlOperator::cachedStatement(const String8& statement) {
-    auto it = mStatements.find(statement.string());
-    if (it != mStatements.end()) {
+sqlite3_stmt* SqlOperator::cachedStatement(const String8& statement, bool fixed) {
+    std::unordered_map<std::string, sqlite3_stmt*>& cache = fixed ? mFixedStatements : mStatements;
+    auto it = cache.find(statement.string());
+    if (it != cache.end()) {
         return it->second;
     }
     sqlite3_stmt* stmt = nullptr;
     if (prepareStatement(statement, &stmt) < 0) {
         return nullptr;
     }
-    if (mStatements.size() >= kMaxCachedStatements) {
-        finalizeCachedStatements();
+    // Only an insert statement is added here, before its caller holds it:
+    // emptying the cache never pulls a statement from under a caller.
+    if (!fixed && cache.size() >= kMaxCachedStatements) {
+        for (auto& entry : cache) {
+            sqlite3_finalize(entry.second);
+        }
+        cache.clear();
     }
-    mStatements.emplace(statement.string(), stmt);
+    cache.emplace(statement.string(), stmt);
     return stmt;
 }
 
 void SqlOperator::finalizeCachedStatements() {
-    for (auto& entry : mStatements) {
-        sqlite3_finalize(entry.second);
+    for (auto* cache : {&mStatements, &mFixedStatements}) {
+        for (auto& entry : *cache) {
+            sqlite3_finalize(entry.second);
+        }
+        cache->clear();
     }
-    mStatements.clear();
 }
 
-int32_t SqlOperator::executeStatement(const String8& statement, bool cached) {
+int32_t SqlOperator::executeStatement(const String8& statement, bool fixed) {
     if (checkStatement(statement) < 0) {
         return -1;
     }
     LLOGD("%s", statement.string());
     sqlite3_stmt* stmt = nullptr;
-    if (cached) {
-        stmt = cachedStatement(statement);
+    if (fixed) {
+        stmt = cachedStatement(statement, true);
         if (stmt == nullptr) {
             return -1;
         }
@@ -473,7 +494,7 @@ int32_t SqlOperator::executeStatement(const String8& statement, bool cached) {
         LLOGE("Execute statement error: %s", sqlite3_errmsg(mDatabase));
         result = -1;
     }
-    if (cached) {
+    if (fixed) {
         sqlite3_reset(stmt);
     } else {
         sqlite3_finalize(stmt);
@@ -489,13 +510,14 @@ int32_t SqlOperator::executeStatement(const String8& statement, const std::vecto
     LLOGD("%s", statement.string());
     // One prepared form per table, kept for the connection: a flush of many
     // small requests prepares each insert once.
-    sqlite3_stmt* stmt = cachedStatement(statement);
+    sqlite3_stmt* stmt = cachedStatement(statement, false);
     if (stmt == nullptr) {
         return -1;
     }
     int32_t rows = 0;
     if (in->readInt32(&rows) != android::NO_ERROR) {
         LLOGE("Missing entry count, statement: %s", statement.string());
+        HealthCounters::add(Health::LibraryParcelRefused);
         sqlite3_reset(stmt);
         sqlite3_clear_bindings(stmt);
         return -1;
@@ -503,6 +525,7 @@ int32_t SqlOperator::executeStatement(const String8& statement, const std::vecto
     if (rows > kMaxInsertRows) {
         LLOGE("Insert entries count(%d) reach limit(%d), statement: %s", rows, kMaxInsertRows,
               statement.string());
+        HealthCounters::add(Health::LibraryParcelRefused);
         sqlite3_reset(stmt);
         sqlite3_clear_bindings(stmt);
         return -1;
@@ -531,6 +554,7 @@ int32_t SqlOperator::executeStatement(const String8& statement, const std::vecto
         int32_t bound = bindEntryValues(stmt, types, in);
         if (bound < 0) {
             LLOGE("Failed to bind entry values");
+            HealthCounters::add(Health::LibraryParcelRefused);
             result = bound;
             break;
         }
@@ -693,10 +717,10 @@ int32_t SqlOperator::writeColumnValue(sqlite3_stmt* stmt, int32_t column, Parcel
             }
             return out->writeInt64(0);
         case SQLITE_FLOAT:
-            LLOGD("Unsupported type: %d", type);
+            LLOGE("Unsupported type: %d", type);
             return out->writeInt64(truncateReal(sqlite3_column_double(stmt, column)));
         default:
-            LLOGD("Unsupported type: %d", type);
+            LLOGE("Unsupported type: %d", type);
             return out->writeString8(String8());
     }
 }

@@ -20,6 +20,13 @@ namespace kelvo {
 // failure.
 class SqlOperator {
 public:
+    // How long a statement waits for another connection's lock before it
+    // fails with SQLITE_BUSY.
+    static constexpr int kDefaultBusyTimeoutMs = 2000;
+    // Insert statements kept prepared per connection; the daemon has fewer
+    // tables. Past it the cache starts again.
+    static constexpr size_t kMaxCachedStatements = 256;
+
     SqlOperator();
     ~SqlOperator();
     SqlOperator(const SqlOperator&) = delete;
@@ -42,16 +49,20 @@ public:
     // in: C string path of the copy.
     int32_t backupCopy(const android::Parcel* in);
 
+    // The busy time-out of connections opened from now on (tests shorten
+    // it); 0 or less restores the default.
+    static void setBusyTimeoutMs(int ms);
+
 private:
     int32_t translateCreate(const android::Parcel* in, android::String8* statement);
     // Leaves the parcel at the row count.
     int32_t translateInsert(const android::Parcel* in, android::String8* statement,
                             std::vector<int32_t>* types);
 
-    // Runs a statement that returns no rows. A cached statement keeps its
-    // prepared form for the life of the connection (the fixed statements of
-    // the insert path).
-    int32_t executeStatement(const android::String8& statement, bool cached = false);
+    // Runs a statement that returns no rows. A fixed statement (the
+    // savepoints of the insert path) keeps its prepared form for the life of
+    // the connection.
+    int32_t executeStatement(const android::String8& statement, bool fixed = false);
     // Runs an insert statement once per row of the parcel.
     int32_t executeStatement(const android::String8& statement, const std::vector<int32_t>& types,
                              const android::Parcel* in);
@@ -62,9 +73,11 @@ private:
     // without a connection.
     int32_t checkStatement(const android::String8& statement);
     int32_t prepareStatement(const android::String8& statement, sqlite3_stmt** stmt);
-    // The prepared form of a statement run again and again (inserts into the
-    // same table, savepoints); null when it does not prepare. Reset after use.
-    sqlite3_stmt* cachedStatement(const android::String8& statement);
+    // The prepared form of a statement run again and again; null when it
+    // does not prepare. Reset after use. Insert statements live in a bounded
+    // cache that is emptied when full; fixed statements are never evicted,
+    // so preparing one cannot finalize an insert statement in use.
+    sqlite3_stmt* cachedStatement(const android::String8& statement, bool fixed);
     void finalizeCachedStatements();
     int32_t bindEntryValues(sqlite3_stmt* stmt, const std::vector<int32_t>& types,
                             const android::Parcel* in);
@@ -74,6 +87,7 @@ private:
 
     sqlite3* mDatabase;
     std::unordered_map<std::string, sqlite3_stmt*> mStatements;
+    std::unordered_map<std::string, sqlite3_stmt*> mFixedStatements;
 };
 
 } // namespace kelvo

@@ -6,13 +6,11 @@
 #include <utils/String8.h>
 
 #include "ErrorLogger.h"
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
-#include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
-#include "kelvo/HostProperties.h"
 
-using kelvo::HostProperties;
 using kelvo::test::LogCapture;
 
 namespace {
@@ -28,6 +26,7 @@ void countingSink(const android::Parcel&) {
 TEST(KelvoLibEntryTest, UnknownActionsAndMissingParcelsAreRefused) {
     gStoredErrors = 0;
     kelvo::ErrorLogger::setSink(countingSink);
+    kelvo::HealthCounters::resetForTest();
     LogCapture log;
     EXPECT_EQ(-1, kelvo::doSqliteOperation(10, nullptr, nullptr));
     EXPECT_EQ(-1, kelvo::doSqliteOperation(-1, nullptr, nullptr));
@@ -45,35 +44,8 @@ TEST(KelvoLibEntryTest, UnknownActionsAndMissingParcelsAreRefused) {
     query.setDataPosition(0);
     EXPECT_EQ(-1, kelvo::doSqliteOperation(kelvo::SQL_SIMPLE_QUERY, &query, nullptr));
     EXPECT_EQ(7u, log.count("Invalid parameter", ANDROID_LOG_ERROR));
+    EXPECT_EQ(9u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
     // Library errors stay out of the daemon's error table.
     EXPECT_EQ(0, gStoredErrors.load());
     kelvo::ErrorLogger::setSink(nullptr);
-}
-
-TEST(KelvoLibEntryTest, SwitchesFollowTheirProperties) {
-    const int32_t savedDebug = kelvo::gLibLogDebugEnable.load();
-    const int32_t savedInfo = kelvo::gLibLogInfoEnable.load();
-    kelvo::test::TempRoot root;
-    // Unset: information on, debug off.
-    kelvo::loadLibLogSwitches();
-    EXPECT_EQ(0, kelvo::gLibLogDebugEnable.load());
-    LogCapture log;
-    kelvo::startLibrary(1234);
-    EXPECT_EQ(1u, log.count("[KelvoLibAgent.cpp] start# KELVO library starting", ANDROID_LOG_INFO));
-
-    HostProperties::setForTest("persist.libkelvo.log.debug", "1");
-    HostProperties::setForTest("persist.libkelvo.log.info", "2");
-    kelvo::loadLibLogSwitches();
-    EXPECT_EQ(1, kelvo::gLibLogDebugEnable.load());
-    kelvo::startLibrary(1234);
-    EXPECT_EQ(1u, log.count("KELVO library starting"));
-
-    HostProperties::setForTest("persist.libkelvo.log.debug", "true");
-    HostProperties::setForTest("persist.libkelvo.log.info", "1");
-    kelvo::loadLibLogSwitches();
-    EXPECT_EQ(0, kelvo::gLibLogDebugEnable.load());
-    kelvo::startLibrary(1234);
-    EXPECT_EQ(2u, log.count("KELVO library starting"));
-    kelvo::gLibLogDebugEnable = savedDebug;
-    kelvo::gLibLogInfoEnable = savedInfo;
 }

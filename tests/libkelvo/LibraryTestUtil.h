@@ -276,6 +276,15 @@ inline Buckets screenOnBackground(int64_t usage, int64_t energy) {
     return Buckets().set(BUCKET_BACKGROUND, usage, energy).set(BUCKET_SCREEN_ON, usage, energy);
 }
 
+// The bytes of the listener's replies from index `from` on.
+inline std::vector<Bytes> replyBytes(const RecordingListener& listener, size_t from = 0) {
+    std::vector<Bytes> out;
+    for (size_t i = from; i < listener.mReplies.size(); ++i) {
+        out.push_back(listener.mReplies[i].bytes);
+    }
+    return out;
+}
+
 inline android::sp<RecordingListener> listenTo(int32_t type) {
     android::sp<RecordingListener> listener = new RecordingListener();
     registerLibraryListener(type, listener);

@@ -115,21 +115,6 @@ TEST_F(DataUploaderTest, NestedClassesArraysAndTextsArriveIntact) {
     EXPECT_EQ(mLiveBefore, ZendrelHost::liveObjects());
 }
 
-TEST_F(DataUploaderTest, TextsAreCutToTheirLimit) {
-    Parcel p;
-    DataUploader::formVarcharData(1, "abcd", 4, p); // as long as its limit: cut by one
-    DataUploader::formVarcharData(2, "abc", 4, p);  // shorter: whole
-    DataUploader::formVarcharData(3, "abc", 0, p);  // no room at all: empty
-    DataUploader::formVarcharData(4, nullptr, 8, p); // refused, nothing written
-    ASSERT_EQ(0, mUploader->setAndUploadEvent(kelvo::EVENT_THERMAL_SHELL, p, true));
-    std::vector<Json::Value> sent = events();
-    ASSERT_EQ(1u, sent.size());
-    EXPECT_EQ("abc", sent[0]["params"]["1"].asString());
-    EXPECT_EQ("abc", sent[0]["params"]["2"].asString());
-    EXPECT_EQ("", sent[0]["params"]["3"].asString());
-    EXPECT_FALSE(sent[0]["params"].isMember("4"));
-}
-
 TEST_F(DataUploaderTest, NothingIsAddedToAnEventNobodyStarted) {
     Parcel p;
     DataUploader::formIntData(0, 1, p);

@@ -6,6 +6,7 @@
 #include <thread>
 #include <vector>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
@@ -13,10 +14,13 @@
 #include "storage/KelvoStorage.h"
 #include "storage/SchemaTable.h"
 #include "utils/KelvoUtils.h"
+#include "utils/SqlOperator.h"
 
 using android::Parcel;
 using android::sp;
 using android::String8;
+using kelvo::Health;
+using kelvo::HealthCounters;
 using kelvo::KelvoStorage;
 using kelvo::column_attribute;
 using kelvo::table_attribute;
@@ -48,16 +52,20 @@ const column_attribute kMixedColumns[] = {
 };
 const table_attribute kMixed = {"2.0", 1, 2, kMixedColumns, "hourly_component_test"};
 
-// An insert parcel of one raw_screen_state row per call.
+// The head of an insert parcel of one row: table name and columns.
+void writeHead(Parcel* p, const table_attribute& table) {
+    p->writeString8(String8(table.name));
+    p->writeInt32(table.count);
+    for (int32_t i = 0; i < table.count; ++i) {
+        p->writeString8(String8(table.columns[i].name));
+        p->writeInt32(table.columns[i].type);
+    }
+    p->writeInt32(1);
+}
+
 void insertScreenRow(KelvoStorage* storage, int64_t time, int32_t state) {
     Parcel p;
-    p.writeString8(String8(kScreenState.name));
-    p.writeInt32(2);
-    p.writeString8(String8("timestamp"));
-    p.writeInt32(kelvo::COLUMN_TIME);
-    p.writeString8(String8("state"));
-    p.writeInt32(kelvo::COLUMN_INT);
-    p.writeInt32(1);
+    writeHead(&p, kScreenState);
     p.writeInt64(time);
     p.writeInt32(state);
     ASSERT_GE(storage->insertEntries(p), 0);
@@ -65,15 +73,7 @@ void insertScreenRow(KelvoStorage* storage, int64_t time, int32_t state) {
 
 void insertAbout(KelvoStorage* storage, const char* key, const char* value) {
     Parcel p;
-    p.writeString8(String8(kAbout.name));
-    p.writeInt32(3);
-    p.writeString8(String8("timestamp"));
-    p.writeInt32(kelvo::COLUMN_TIME);
-    p.writeString8(String8("key"));
-    p.writeInt32(kelvo::COLUMN_TEXT);
-    p.writeString8(String8("value"));
-    p.writeInt32(kelvo::COLUMN_TEXT);
-    p.writeInt32(1);
+    writeHead(&p, kAbout);
     p.writeInt64(1000);
     p.writeString8(String8(key));
     p.writeString8(String8(value));
@@ -93,9 +93,15 @@ int64_t countThroughStorage(KelvoStorage* storage) {
 
 class KelvoStorageTest : public ::testing::Test {
 protected:
-    void SetUp() override { mRoot.reset(new TempRoot()); }
+    void SetUp() override {
+        mRoot.reset(new TempRoot());
+        // A lock held by another connection fails fast.
+        kelvo::SqlOperator::setBusyTimeoutMs(100);
+        HealthCounters::resetForTest();
+    }
     void TearDown() override {
         stop();
+        kelvo::SqlOperator::setBusyTimeoutMs(0);
         mRoot.reset();
     }
 
@@ -138,24 +144,14 @@ protected:
 
 } // namespace
 
-TEST_F(KelvoStorageTest, CreatesTablesWithExactTextsAndOneVersionRowEach) {
+TEST_F(KelvoStorageTest, CreatesEveryTableWithOneVersionRowEach) {
     start({&kScreenState, &kMixed});
     DirectDb db(dbPath());
     ASSERT_TRUE(db.ok());
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE raw_screen_state(id INTEGER PRIMARY KEY, "
-                                       "timestamp INTEGER, formatted_timestamp VARCHAR, state "
-                                       "INTEGER)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'raw_screen_state'"));
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE hourly_component_test(id INTEGER PRIMARY "
-                                       "KEY, name VARCHAR, energy INTEGER)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'hourly_component_test'"));
-    EXPECT_EQ(std::vector<std::string>{"CREATE TABLE schema_version(module VARCHAR, version "
-                                       "VARCHAR)"},
-              db.column("SELECT sql FROM sqlite_master WHERE name = 'schema_version'"));
-    EXPECT_EQ((std::vector<std::string>{"hourly_component_test=2.0", "raw_screen_state=1.0",
-                                        "schema_version=1.0"}),
-              db.column("SELECT module || '=' || version FROM schema_version ORDER BY module"));
-    // The directory and file modes of the database.
+    EXPECT_EQ((std::vector<std::string>{"hourly_component_test|2.0", "raw_screen_state|1.0",
+                                        "schema_version|1.0"}),
+              db.column("SELECT module, version FROM schema_version ORDER BY module"));
+    EXPECT_EQ(3, db.scalar("SELECT COUNT(*) FROM sqlite_master WHERE type = 'table'"));
     struct stat st = {};
     ASSERT_EQ(0, stat(dbPath().c_str(), &st));
     EXPECT_EQ(0664u, st.st_mode & 0777);
@@ -182,66 +178,50 @@ TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlush) {
 }
 
 TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
+    struct Step {
+        const table_attribute* screen;
+        const char* sql; // applied to the file before the start
+        const char* build;
+        bool kept;
+    };
+    const Step steps[] = {
+        {&kScreenState, nullptr, "BUILD.A", true},
+        {&kScreenStateV11, nullptr, "BUILD.A", false},
+        {&kScreenStateV110, nullptr, "BUILD.A", false}, // "1.1" is not "1.10"
+        // One version row missing, though every present row matches.
+        {&kScreenStateV110, "DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'",
+         "BUILD.A", false},
+        // The right number of rows, each matching on its own, one module twice.
+        {&kScreenStateV110,
+         "UPDATE schema_version SET module = 'raw_screen_state', version = '1.10' WHERE module = "
+         "'about_kelvo_daemon'",
+         "BUILD.A", false},
+        {&kScreenStateV110, nullptr, "BUILD.B", false},
+    };
     kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.A");
     start({&kScreenState, &kAbout});
-    insertScreenRow(mStorage.get(), 1000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-
-    // Same definitions, same build: the rows stay.
-    start({&kScreenState, &kAbout});
-    EXPECT_EQ(1, countThroughStorage(mStorage.get()));
-    EXPECT_TRUE(backupZips().empty());
-
-    // "1.1" is not "1.10": rebuilt, the old database backed up as a zip.
-    start({&kScreenStateV11, &kAbout});
-    insertScreenRow(mStorage.get(), 2000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    start({&kScreenStateV110, &kAbout});
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    // One backup per rebuild.
-    EXPECT_EQ(2u, backupZips().size());
-    {
-        DirectDb db(dbPath());
-        EXPECT_EQ(std::vector<std::string>{"1.10"},
-                  db.column("SELECT version FROM schema_version WHERE module = "
-                            "'raw_screen_state'"));
-    }
-    insertScreenRow(mStorage.get(), 3000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // One version row missing: rebuilt although every present row matches.
-    {
-        DirectDb db(dbPath());
-        ASSERT_EQ(SQLITE_OK, db.exec("DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'"));
-    }
-    start({&kScreenStateV110, &kAbout});
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    insertScreenRow(mStorage.get(), 4000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // A duplicate module row: rebuilt.
-    {
-        DirectDb db(dbPath());
-        // The right number of rows, each matching on its own.
-        ASSERT_EQ(SQLITE_OK, db.exec("UPDATE schema_version SET module = 'raw_screen_state', "
-                                     "version = '1.10' WHERE module = 'about_kelvo_daemon'"));
-    }
     LogCapture log;
-    start({&kScreenStateV110, &kAbout});
+    size_t rebuilds = 0;
+    for (const Step& step : steps) {
+        SCOPED_TRACE(rebuilds);
+        insertScreenRow(mStorage.get(), 1000, 1);
+        insertAbout(mStorage.get(), "software_version", "BUILD.A");
+        stop();
+        if (step.sql != nullptr) {
+            ASSERT_EQ(SQLITE_OK, DirectDb(dbPath()).exec(step.sql));
+        }
+        kelvo::HostProperties::setForTest("ro.build.display.id", step.build);
+        start({step.screen, &kAbout});
+        rebuilds += step.kept ? 0 : 1;
+        EXPECT_EQ(step.kept ? 1 : 0, countThroughStorage(mStorage.get()));
+        // One zipped backup per rebuild.
+        EXPECT_EQ(rebuilds, backupZips().size());
+    }
     EXPECT_TRUE(log.contains("schema mismatch, duplicate records", ANDROID_LOG_ERROR));
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
-    insertScreenRow(mStorage.get(), 5000, 1);
-    insertAbout(mStorage.get(), "software_version", "BUILD.A");
-    stop();
-
-    // A new build: rebuilt.
-    kelvo::HostProperties::setForTest("ro.build.display.id", "BUILD.B");
-    log.clear();
-    start({&kScreenStateV110, &kAbout});
     EXPECT_TRUE(log.contains("Software version: BUILD.A, current is BUILD.B", ANDROID_LOG_INFO));
-    EXPECT_EQ(0, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(std::vector<std::string>{"1.10"},
+              DirectDb(dbPath()).column("SELECT version FROM schema_version WHERE module = "
+                                        "'raw_screen_state'"));
 }
 
 TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
@@ -254,7 +234,10 @@ TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
                   db.exec("CREATE TABLE legacy(id INTEGER PRIMARY KEY AUTOINCREMENT, v TEXT)"));
         ASSERT_EQ(SQLITE_OK, db.exec("INSERT INTO legacy(v) VALUES ('x')"));
     }
+    // The rebuild (backup, zip, drop, create) outlasts a synchronous send.
+    kelvo::HandlerThread::setSyncTimeoutMs(1);
     start({&kScreenStateV11});
+    kelvo::HandlerThread::setSyncTimeoutMs(0);
     DirectDb db(dbPath());
     EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
                                                     "'legacy'"));
@@ -280,16 +263,30 @@ TEST_F(KelvoStorageTest, FlushPeriodComesFromItsPropertyWithAFloorOfOneSecond) {
                         std::chrono::milliseconds(5000)));
 }
 
-TEST_F(KelvoStorageTest, RowsQueuedBeforeTheStartWaitForTheTables) {
+TEST_F(KelvoStorageTest, RowsWithoutTablesWaitForThem) {
     mStorage = new KelvoStorage(nullptr);
     mStorage->addSchema(kScreenState);
     LogCapture log;
     for (int i = 0; i < 350; ++i) {
         insertScreenRow(mStorage.get(), 1000 + i, 1);
     }
+    // Neither the size limit nor a forced flush before the start drops them.
+    EXPECT_EQ(0, mStorage->flushAllEntries());
     ASSERT_EQ(0, mStorage->startConnection());
     EXPECT_FALSE(log.contains("reach upper limit"));
+    EXPECT_FALSE(log.contains("abandon all entries"));
     EXPECT_EQ(350, countThroughStorage(mStorage.get()));
+
+    // After the close, rows wait for the next start (no flush tick drops them).
+    ASSERT_EQ(0, mStorage->closeConnection());
+    insertScreenRow(mStorage.get(), 9000, 1);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(2u, HealthCounters::get(Health::InsertsDeferred));
+    mStorage->addSchema(kScreenState);
+    ASSERT_EQ(0, mStorage->startConnection());
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(351, countThroughStorage(mStorage.get()));
+    EXPECT_EQ(0u, HealthCounters::get(Health::FlushRowsAbandoned));
 }
 
 TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
@@ -304,6 +301,7 @@ TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
         EXPECT_EQ(-17, mStorage->flushAllEntries());
         other.exec("COMMIT");
     }
+    EXPECT_EQ(1u, HealthCounters::get(Health::FlushRowsAbandoned));
     insertScreenRow(mStorage.get(), 2000, 0);
     EXPECT_EQ(0, mStorage->flushAllEntries());
     insertScreenRow(mStorage.get(), 3000, 0);
@@ -315,6 +313,12 @@ TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
 TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {
     start({&kScreenState});
     LogCapture log;
+    Parcel copy;
+    copy.writeCString((mRoot->path() + "/copy.db").c_str());
+    EXPECT_EQ(-17, mStorage->doBackupCopy(copy));
+    EXPECT_TRUE(log.contains("SQL refused off the storage thread: 9", ANDROID_LOG_ERROR));
+    EXPECT_FALSE(kelvo::test::hostPathExists(mRoot->path() + "/copy.db"));
+    EXPECT_EQ(-5, mStorage->queryEntries(String8("SELECT 1"), nullptr));
     EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_STORAGE_ENTRY, 8)));
     EXPECT_TRUE(log.contains("Unknow entry type: 8", ANDROID_LOG_ERROR));
     EXPECT_EQ(-3, mStorage->sendMessageSync(kelvo::ParcelMessage(kelvo::MESSAGE_CUSTOMIZED, 9)));
@@ -325,6 +329,7 @@ TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {
     EXPECT_EQ(-17, mStorage->queryEntries(String8("SELECT * FROM nothing_here"), &reply));
     EXPECT_EQ(-17, mStorage->executeEntry(String8("DELETE FROM raw_screen_state; DROP TABLE x"),
                                           true));
+    EXPECT_EQ(4u, HealthCounters::get(Health::StorageEntryRefused));
 }
 
 TEST_F(KelvoStorageTest, CleaningFlushesBacksUpAndVacuums) {

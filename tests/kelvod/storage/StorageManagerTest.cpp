@@ -19,6 +19,7 @@
 #include <utility>
 #include <vector>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
@@ -102,6 +103,7 @@ protected:
         StorageManager::setDailyUploadHook(nullptr);
         gUploads.clear();
         gUploadResult = 0;
+        kelvo::HealthCounters::resetForTest();
         mLive = RootPath::resolve(StorageManager::kDatabasePath);
         mBackup = RootPath::resolve(StorageManager::kBackupDir);
         mUpload = RootPath::resolve(StorageManager::kUploadDir);
@@ -181,6 +183,7 @@ TEST_F(StorageManagerTest, DailyCleansKeepSixRotatingZips) {
         EXPECT_EQ(static_cast<size_t>(kept), listDir(mBackup).size());
     }
     EXPECT_EQ(2u, mLog.count("expired: 7, DELETE!", ANDROID_LOG_INFO));
+    EXPECT_EQ(2u, kelvo::HealthCounters::get(kelvo::Health::FilesDeleted));
 }
 
 TEST_F(StorageManagerTest, ListingKeepsWholeNamesOfCopiesAndZipsOnly) {
@@ -277,14 +280,16 @@ TEST_F(StorageManagerTest, FailedZipKeepsCopiesForTheNextZip) {
     EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
     EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
 
+    // The next daily clean zips it with its own copy.
     writeHostFile(mLive, "next database");
-    ASSERT_EQ(0, mManager.moveDatabase());
+    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + kDayMs));
     std::map<int, std::string> zips = backupZips();
     ASSERT_EQ(1u, zips.size());
     std::map<std::string, std::string> entries = readZip(zips[0]);
-    ASSERT_EQ(1u, entries.size());
+    ASSERT_EQ(2u, entries.size());
     EXPECT_EQ(payload, entries[copyName(kFirstDay)]);
-    EXPECT_EQ(std::vector<std::string>{"next database"}, copiesIn(mBackup));
+    EXPECT_EQ("next database", entries[copyName(kFirstDay + kDayMs)]);
+    EXPECT_EQ(1u, listDir(mBackup).size());
 }
 
 TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
@@ -312,6 +317,7 @@ TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     StorageManager::setDailyUploadHook(recordUpload);
     ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + 5 * kDayMs));
     EXPECT_TRUE(listDir(mUpload).empty());
+    EXPECT_TRUE(mLog.contains(copyName(kFirstDay + 4 * kDayMs) + ") left over, DELETE!"));
     EXPECT_EQ(calls, gUploads.size());
     EXPECT_TRUE(mLog.contains("No need to upload database: 1", ANDROID_LOG_INFO));
 }
@@ -450,16 +456,18 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
         EXPECT_EQ(std::string("old") + suffix, readHostFile(mBackup + "/" + moved + suffix));
     }
 
-    // The next move zips the set together.
-    writeHostFile(mLive, "second database");
-    ASSERT_EQ(0, mManager.moveDatabase());
+    // The next clean (a rebuild's or the day's) zips the set with its copy.
+    writeHostFile(mLive, "rebuilt database");
+    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
     std::map<std::string, std::string> entries = readZip(backupZips()[0]);
-    EXPECT_EQ(4u, entries.size());
+    EXPECT_EQ(5u, entries.size());
+    EXPECT_EQ("rebuilt database", entries[copyName(kFirstDay)]);
     EXPECT_EQ("moved database", entries[moved]);
     EXPECT_EQ("old-wal", entries[moved + "-wal"]);
     EXPECT_FALSE(hostPathExists(mBackup + "/" + moved + "-journal"));
 
     // Journal files of a database that is gone must not meet the next one.
+    ASSERT_EQ(0, unlink(mLive.c_str()));
     writeHostFile(mLive + "-wal", "stale");
     EXPECT_EQ(-2, mManager.moveDatabase());
     EXPECT_FALSE(hostPathExists(mLive + "-wal"));

@@ -6,6 +6,7 @@
 #include <thread>
 #include <vector>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "core/KelvoAgent.h"
@@ -16,6 +17,8 @@
 using android::Parcel;
 using android::sp;
 using android::String8;
+using kelvo::Health;
+using kelvo::HealthCounters;
 using kelvo::KelvoAgent;
 using kelvo::KelvoStorage;
 using kelvo::StorageOperator;
@@ -58,6 +61,7 @@ protected:
         StorageOperator::addSchema(kHourly);
         StorageOperator::addSchema(kAbout);
         ASSERT_EQ(0, mStorage->startConnection());
+        HealthCounters::resetForTest();
     }
     void TearDown() override {
         mStorage->flushAllEntries();
@@ -75,6 +79,20 @@ void foregroundRow(Parcel* rows, int64_t time, const char* name) {
     rows->writeString8(String8(name));
 }
 
+// One about_kelvo_daemon row, replacing the row of its key.
+int32_t updateAbout(int64_t time, const char* key, const char* value) {
+    Parcel row;
+    row.writeInt64(time);
+    row.writeString8(String8(key));
+    row.writeString8(String8(value));
+    String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText(key);
+    return StorageOperator::updateEntries(kAbout, row, condition.string());
+}
+
+std::vector<std::string> aboutRows(const DirectDb& db) {
+    return db.column("SELECT key, value FROM about_kelvo_daemon ORDER BY key");
+}
+
 } // namespace
 
 TEST_F(StorageOperatorTest, InsertsBatchesWithinTheLimit) {
@@ -90,6 +108,7 @@ TEST_F(StorageOperatorTest, InsertsBatchesWithinTheLimit) {
     LogCapture log;
     foregroundRow(&many, 99999, "com.example.many");
     EXPECT_EQ(-5, StorageOperator::insertEntries(kForeground, many, 5001, false));
+    EXPECT_EQ(1u, HealthCounters::get(Health::StorageEntryRefused));
     EXPECT_TRUE(log.contains("Insert entries count(5001) reach limit(5000), table: raw_foreground",
                              ANDROID_LOG_ERROR));
 
@@ -138,29 +157,21 @@ TEST_F(StorageOperatorTest, QueriesCheckTheirShape) {
     EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8(""), &mismatch, 2, count));
     EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8("SELECT 1"), nullptr, 1, count));
     EXPECT_EQ(-5, StorageOperator::queryEntriesSimple(String8("SELECT 1"), &mismatch, 0, count));
+    EXPECT_EQ(-5, StorageOperator::deleteEntries(nullptr, "1"));
+    EXPECT_EQ(-5, StorageOperator::cleanObsoleteEntries("raw_foreground", 1, nullptr));
+    EXPECT_EQ(-5, StorageOperator::cleanAllEntries(nullptr));
+    EXPECT_EQ(6u, HealthCounters::get(Health::StorageEntryRefused));
 }
 
 TEST_F(StorageOperatorTest, UpdateReplacesTheRowOfItsKeyAndQuotesValues) {
-    std::string key = "software_version";
-    String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText(key.c_str());
     for (const char* value : {"A", "B", "it's C"}) {
-        Parcel row;
-        row.writeInt64(1000);
-        row.writeString8(String8(key.c_str()));
-        row.writeString8(String8(value));
-        EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, condition.string()));
+        EXPECT_EQ(0, updateAbout(1000, "software_version", value));
     }
     // A key whose value carries a quote is still matched exactly.
-    String8 odd = String8("key = ") + kelvo::KelvoUtils::quoteSqlText("o'key");
-    Parcel row;
-    row.writeInt64(1000);
-    row.writeString8(String8("o'key"));
-    row.writeString8(String8("v1"));
-    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, odd.string()));
-    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, row, odd.string()));
+    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
+    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
     StorageOperator::forceFlushEntries();
-    EXPECT_EQ((std::vector<std::string>{"o'key=v1", "software_version=it's C"}),
-              db().column("SELECT key || '=' || value FROM about_kelvo_daemon ORDER BY key"));
+    EXPECT_EQ((std::vector<std::string>{"o'key|v1", "software_version|it's C"}), aboutRows(db()));
 }
 
 TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
@@ -186,9 +197,6 @@ TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
     EXPECT_EQ(0, StorageOperator::cleanAllEntries("raw_foreground"));
     StorageOperator::forceFlushEntries();
     EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground"));
-    EXPECT_EQ(-5, StorageOperator::deleteEntries(nullptr, "1"));
-    EXPECT_EQ(-5, StorageOperator::cleanObsoleteEntries("raw_foreground", 1, nullptr));
-    EXPECT_EQ(-5, StorageOperator::cleanAllEntries(nullptr));
 }
 
 TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
@@ -238,12 +246,7 @@ TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
 }
 
 TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
-    Parcel old;
-    old.writeInt64(1000);
-    old.writeString8(String8("xml_version"));
-    old.writeString8(String8("old"));
-    String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText("xml_version");
-    ASSERT_EQ(0, StorageOperator::updateEntries(kAbout, old, condition.string()));
+    ASSERT_EQ(0, updateAbout(1000, "xml_version", "old"));
     StorageOperator::forceFlushEntries();
 
     // Another connection holds the database while the update runs, so the
@@ -255,16 +258,11 @@ TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
         std::this_thread::sleep_for(std::chrono::milliseconds(600));
         other->exec("COMMIT");
     });
-    Parcel fresh;
-    fresh.writeInt64(2000);
-    fresh.writeString8(String8("xml_version"));
-    fresh.writeString8(String8("new"));
-    EXPECT_EQ(0, StorageOperator::updateEntries(kAbout, fresh, condition.string()));
+    EXPECT_EQ(0, updateAbout(2000, "xml_version", "new"));
     release.join();
     kelvo::HandlerThread::setSyncTimeoutMs(0);
 
     // The queued delete ran before the queued row: exactly the new value.
     EXPECT_EQ(0, StorageOperator::forceFlushEntries());
-    EXPECT_EQ(std::vector<std::string>{"new"},
-              db().column("SELECT value FROM about_kelvo_daemon WHERE key = 'xml_version'"));
+    EXPECT_EQ(std::vector<std::string>{"xml_version|new"}, aboutRows(db()));
 }

@@ -26,8 +26,13 @@ std::vector<std::string> DirectDb::column(const std::string& sql) const {
     }
     int rc;
     while ((rc = sqlite3_step(stmt)) == SQLITE_ROW) {
-        const unsigned char* text = sqlite3_column_text(stmt, 0);
-        out.push_back(text != nullptr ? reinterpret_cast<const char*>(text) : "");
+        std::string row;
+        for (int i = 0; i < sqlite3_column_count(stmt); ++i) {
+            const unsigned char* text = sqlite3_column_text(stmt, i);
+            row += (i > 0 ? "|" : "") +
+                   std::string(text != nullptr ? reinterpret_cast<const char*>(text) : "");
+        }
+        out.push_back(row);
     }
     if (rc != SQLITE_DONE) {
         out.push_back(std::string("error: ") + sqlite3_errmsg(mDb));
@@ -50,3 +55,10 @@ int DirectDb::exec(const std::string& sql) const {
 
 } // namespace test
 } // namespace kelvo
+
+// Sanitizer builds scribble over freed memory, so that a statement used after
+// it was finalized fails at once, even inside the uninstrumented SQLite
+// library (the statement-cache test relies on it).
+extern "C" const char* __asan_default_options() {
+    return "max_free_fill_size=65536";
+}

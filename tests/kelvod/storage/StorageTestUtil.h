@@ -16,8 +16,8 @@ public:
     DirectDb& operator=(const DirectDb&) = delete;
     ~DirectDb();
     bool ok() const { return mDb != nullptr; }
-    // First column of every row of the query, as text ("" for NULL); an
-    // "error: ..." entry when the query fails.
+    // Every row of the query, its columns as text joined by '|' ("" for
+    // NULL); an "error: ..." entry when the query fails.
     std::vector<std::string> column(const std::string& sql) const;
     long long scalar(const std::string& sql) const;
     int exec(const std::string& sql) const;

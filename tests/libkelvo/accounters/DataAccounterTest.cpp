@@ -5,6 +5,7 @@
 
 #include <stdint.h>
 
+#include "HealthCounters.h"
 #include "common/TestEnv.h"
 #include "libkelvo/LibraryTestUtil.h"
 
@@ -19,22 +20,48 @@ protected:
     LogCapture mLog;
 };
 
-TEST_F(DataAccounterTest, ActionCodesOutsideTheTableAreRefused) {
+// Every refused action says why, is counted, and changes nothing.
+TEST_F(DataAccounterTest, RefusedActionsAreCountedAndChangeNothing) {
     auto listener = listenTo(kSole);
-    EXPECT_EQ(-1, Action(kSole, 8).i64(0).send());
-    EXPECT_TRUE(mLog.contains("[DataAccounter.cpp] handleAction# Unknown action: 8",
-                              ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, Action(kSole, -1).send());
-    EXPECT_TRUE(mLog.contains("Unknown action: -1", ANDROID_LOG_ERROR));
-    // A parcel that ends before the action code or before an action's fields.
+    ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
+    HealthCounters::resetForTest();
+    size_t refused = 0;
+    auto refuse = [&](const Action& action, const char* log) {
+        SCOPED_TRACE(log);
+        mLog.clear();
+        EXPECT_EQ(-1, action.send());
+        if (log[0] != '\0') {
+            EXPECT_TRUE(mLog.contains(log, ANDROID_LOG_ERROR));
+        }
+        ++refused;
+    };
+    refuse(Action(kSole, 8).i64(0), "[DataAccounter.cpp] handleAction# Unknown action: 8");
+    refuse(Action(kSole, -1), "Unknown action: -1");
+    // Parcels that end before an action's fields.
+    refuse(Action(kSole, ACTION_FOREGROUND).i64(10), "");
+    refuse(Action(kSole, ACTION_SCREEN_STATE), "");
+    refuse(Action(kSole, ACTION_ACTIVATE).i32(0).i64(10), "");
+    refuse(Action(kSole, ACTION_DEACTIVATE_ALL), "");
+    refuse(Action(kSole, ACTION_SET_VALUE).i32(0).i64(20), "Failed to get power value");
+    // Allocators that do not exist or cannot.
+    refuse(Action(kSole, ACTION_DEACTIVATE).i32(5).i64(10).str("a"), "Failed to find allocator: 5");
+    refuse(Action(kSole, ACTION_ACTIVATE).i32(-3).i64(10).str("a"), "Invalid allocator key: -3");
+    refuse(Action(kSole, ACTION_SET_VALUE).i32(-3).i64(10).i32(1), "Invalid allocator key: -3");
+    refuse(Action(kSole, ACTION_DEACTIVATE).i32(0).i64(30).str("b"), "Failed to remove element");
+    // Types without an accounter.
+    refuse(Action(12, ACTION_FOREGROUND).i64(0).str("a"),
+           "[KelvoLibAgent.cpp] findAccounter# Invalid accounter type: 12");
+    refuse(Action(-1, ACTION_FOREGROUND).i64(0).str("a"),
+           "[KelvoLibAgent.cpp] setDataAccounter# Failed to find accounter by type: -1");
+    refuse(Action(ACCOUNTER_CAMERA, ACTION_FOREGROUND).i64(0).str("a"),
+           "Unknown accounter type: 4");
     android::Parcel typeOnly;
     typeOnly.writeInt32(kSole);
     EXPECT_EQ(-1, setDataAccounter(typeOnly));
-    EXPECT_EQ(-1, Action(kSole, ACTION_FOREGROUND).i64(10).send());
-    EXPECT_EQ(-1, Action(kSole, ACTION_SCREEN_STATE).send());
-    EXPECT_EQ(-1, Action(kSole, ACTION_ACTIVATE).i32(0).i64(10).send());
-    EXPECT_EQ(-1, Action(kSole, ACTION_DEACTIVATE_ALL).send());
+    EXPECT_EQ(refused + 1, HealthCounters::get(Health::LibraryParcelRefused));
     EXPECT_TRUE(listener->mReplies.empty());
+    // The element is still there.
+    EXPECT_EQ(0, deactivate(kSole, 0, 40, "a"));
 }
 
 TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
@@ -69,22 +96,6 @@ TEST_F(DataAccounterTest, BalanceReasons) {
               listener->mReplies[0].bytes);
     EXPECT_EQ(elementReply(0, 100, 300, "a", screenOnBackground(200, 200)),
               listener->mReplies[1].bytes);
-}
-
-TEST_F(DataAccounterTest, DeactivateNeedsAKnownAllocator) {
-    auto listener = listenTo(kSole);
-    EXPECT_EQ(-1, deactivate(kSole, 5, 10, "a"));
-    EXPECT_TRUE(mLog.contains("Failed to find allocator: 5", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, activate(kSole, -3, 10, "a"));
-    EXPECT_TRUE(mLog.contains("Invalid allocator key: -3", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(-3).i64(10).i32(1).send());
-    // A SetValue whose value fields are missing changes nothing.
-    ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
-    EXPECT_EQ(-1, Action(kSole, ACTION_SET_VALUE).i32(0).i64(20).send());
-    EXPECT_TRUE(mLog.contains("Failed to get power value", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-1, deactivate(kSole, 0, 30, "b"));
-    EXPECT_TRUE(mLog.contains("Failed to remove element", ANDROID_LOG_ERROR));
-    EXPECT_TRUE(listener->mReplies.empty());
 }
 
 TEST_F(DataAccounterTest, DeactivateAllContinuesPastAFailure) {

@@ -29,26 +29,24 @@ TEST_F(AllocatorTest, SoleChargesTheWholeIntervalIn64Bits) {
     ASSERT_EQ(0, setPower(kSole, 0, 0, 600));
     ASSERT_EQ(0, activate(kSole, 0, 1000, "com.music"));
     ASSERT_EQ(0, deactivate(kSole, 0, 1000 + 3600000, "com.music"));
-    // An hour at power 600: 3600000 ms * 600 / 1000 = 2160000 (the 32-bit
-    // product would wrap).
-    ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[0].event);
-    EXPECT_EQ(0u, listener->mPosition[0]);
-    EXPECT_EQ(elementReply(0, 1000, 3601000, "com.music", screenOnBackground(3600000, 2160000)),
-              listener->mReplies[0].bytes);
-
     // About 35 days in one record: the duration stops at INT32_MAX ms.
     ASSERT_EQ(0, setPower(kSole, 1, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 1, 0, "com.nav"));
     ASSERT_EQ(0, deactivate(kSole, 1, 3000000000LL, "com.nav"));
-    EXPECT_EQ(
-            elementReply(1, 0, 3000000000LL, "com.nav", screenOnBackground(2147483647, 2147483647)),
-            listener->mReplies[1].bytes);
-
     // A time before the last accounted one adds nothing.
     ASSERT_EQ(0, activate(kSole, 1, 5000, "com.nav"));
     ASSERT_EQ(0, deactivate(kSole, 1, 4000, "com.nav"));
-    EXPECT_EQ(elementReply(1, 5000, 4000, "com.nav", Buckets()), listener->mReplies[2].bytes);
+    // An hour at power 600: 3600000 ms * 600 / 1000 = 2160000 (the 32-bit
+    // product would wrap).
+    EXPECT_EQ(
+        (std::vector<Bytes>{
+            elementReply(0, 1000, 3601000, "com.music", screenOnBackground(3600000, 2160000)),
+            elementReply(1, 0, 3000000000LL, "com.nav", screenOnBackground(INT32_MAX, INT32_MAX)),
+            elementReply(1, 5000, 4000, "com.nav", Buckets()),
+        }),
+        replyBytes(*listener));
+    EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[0].event);
+    EXPECT_EQ(0u, listener->mPosition[0]);
 }
 
 TEST_F(AllocatorTest, SoleReplacesItsElementAndFollowsThePower) {
@@ -88,11 +86,11 @@ TEST_F(AllocatorTest, BucketsFollowForegroundScreenAndCharger) {
     // foreground; 10000-15000 charging in the background. Energy = 2 * ms.
     Buckets expected;
     expected.set(BUCKET_FOREGROUND, 5000, 10000)
-            .set(BUCKET_BACKGROUND, 1000, 2000)
-            .set(BUCKET_SCREEN_ON, 3000, 6000)
-            .set(BUCKET_SCREEN_OFF, 3000, 6000)
-            .set(BUCKET_CHARGE_FOREGROUND, 4000, 8000)
-            .set(BUCKET_CHARGE_BACKGROUND, 5000, 10000);
+        .set(BUCKET_BACKGROUND, 1000, 2000)
+        .set(BUCKET_SCREEN_ON, 3000, 6000)
+        .set(BUCKET_SCREEN_OFF, 3000, 6000)
+        .set(BUCKET_CHARGE_FOREGROUND, 4000, 8000)
+        .set(BUCKET_CHARGE_BACKGROUND, 5000, 10000);
     ASSERT_EQ(1u, listener->mReplies.size());
     EXPECT_EQ(elementReply(0, 0, 15000, "com.a:service", expected), listener->mReplies[0].bytes);
 }
@@ -103,23 +101,19 @@ TEST_F(AllocatorTest, BalanceGapStaysUnaccounted) {
     ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
     ASSERT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1000).i64(1500).send());
     ASSERT_EQ(0, deactivate(kSole, 0, 2000, "a"));
-    ASSERT_EQ(2u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 1000, "a", screenOnBackground(1000, 1000)),
-              listener->mReplies[0].bytes);
-    // 1000-1500 belongs to no record.
-    EXPECT_EQ(elementReply(0, 1500, 2000, "a", screenOnBackground(500, 500)),
-              listener->mReplies[1].bytes);
-
     // Accounted up to 4000 already; a balance at 3500 does not move back.
     ASSERT_EQ(0, activate(kSole, 0, 3000, "a"));
     ASSERT_EQ(0, setPower(kSole, 0, 4000, 1000));
     ASSERT_EQ(0, balanceAt(kSole, 3500));
     ASSERT_EQ(0, deactivate(kSole, 0, 5000, "a"));
-    ASSERT_EQ(4u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 3000, 3500, "a", screenOnBackground(1000, 1000)),
-              listener->mReplies[2].bytes);
-    EXPECT_EQ(elementReply(0, 3500, 5000, "a", screenOnBackground(1000, 1000)),
-              listener->mReplies[3].bytes);
+    // 1000-1500 belongs to no record.
+    EXPECT_EQ((std::vector<Bytes>{
+                  elementReply(0, 0, 1000, "a", screenOnBackground(1000, 1000)),
+                  elementReply(0, 1500, 2000, "a", screenOnBackground(500, 500)),
+                  elementReply(0, 3000, 3500, "a", screenOnBackground(1000, 1000)),
+                  elementReply(0, 3500, 5000, "a", screenOnBackground(1000, 1000)),
+              }),
+              replyBytes(*listener));
 }
 
 TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
@@ -130,28 +124,24 @@ TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
     }
     // 10 ms at 1000: energy 10, each user 10 / 3 = 3, the component 10.
     ASSERT_EQ(0, balanceAt(kShared, 10));
-    ASSERT_EQ(4u, listener->mReplies.size());
-    for (int i = 0; i < 3; ++i) {
-        const char name[2] = {static_cast<char>('a' + i), '\0'};
-        EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[i].event);
-        EXPECT_EQ(elementReply(3, 0, 10, name, screenOnBackground(10, 3)),
-                  listener->mReplies[i].bytes);
-    }
-    EXPECT_EQ(LIBRARY_EVENT_COMPONENT, listener->mReplies[3].event);
-    EXPECT_EQ(componentReply(3, 0, 10, screenOnBackground(10, 10)), listener->mReplies[3].bytes);
-
     // b leaves at 16: 6 ms shared by three (2 each); then a and c share 4 ms.
     ASSERT_EQ(0, deactivate(kShared, 3, 16, "b"));
     ASSERT_EQ(0, Action(kShared, ACTION_DEACTIVATE_ALL).i64(20).send());
-    ASSERT_EQ(8u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(3, 10, 16, "b", screenOnBackground(6, 2)), listener->mReplies[4].bytes);
-    EXPECT_EQ(elementReply(3, 10, 20, "a", screenOnBackground(10, 4)), listener->mReplies[5].bytes);
-    EXPECT_EQ(elementReply(3, 10, 20, "c", screenOnBackground(10, 4)), listener->mReplies[6].bytes);
-    EXPECT_EQ(componentReply(3, 10, 20, screenOnBackground(10, 10)), listener->mReplies[7].bytes);
-
     // No element: a balance reports nothing, not even the component.
     ASSERT_EQ(0, balanceAt(kShared, 30));
-    EXPECT_EQ(8u, listener->mReplies.size());
+    EXPECT_EQ((std::vector<Bytes>{
+                  elementReply(3, 0, 10, "a", screenOnBackground(10, 3)),
+                  elementReply(3, 0, 10, "b", screenOnBackground(10, 3)),
+                  elementReply(3, 0, 10, "c", screenOnBackground(10, 3)),
+                  componentReply(3, 0, 10, screenOnBackground(10, 10)),
+                  elementReply(3, 10, 16, "b", screenOnBackground(6, 2)),
+                  elementReply(3, 10, 20, "a", screenOnBackground(10, 4)),
+                  elementReply(3, 10, 20, "c", screenOnBackground(10, 4)),
+                  componentReply(3, 10, 20, screenOnBackground(10, 10)),
+              }),
+              replyBytes(*listener));
+    EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[2].event);
+    EXPECT_EQ(LIBRARY_EVENT_COMPONENT, listener->mReplies[3].event);
 }
 
 TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
@@ -164,33 +154,31 @@ TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
     // 101 ms, energy 101: each element 101 / 4 = 25; the component's
     // foreground share 101 * 2 / 4 = 50, the background the other 51.
     ASSERT_EQ(0, balanceAt(kShared, 101));
-    Buckets foreground = Buckets().set(BUCKET_FOREGROUND, 101, 25).set(BUCKET_SCREEN_ON, 101, 25);
-    Buckets background = screenOnBackground(101, 25);
-    ASSERT_EQ(5u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 101, "com.fg", foreground), listener->mReplies[0].bytes);
-    EXPECT_EQ(elementReply(0, 0, 101, "com.fg:remote", foreground), listener->mReplies[1].bytes);
-    EXPECT_EQ(elementReply(0, 0, 101, "com.x", background), listener->mReplies[2].bytes);
-    EXPECT_EQ(elementReply(0, 0, 101, "com.y", background), listener->mReplies[3].bytes);
-    EXPECT_EQ(componentReply(0, 0, 101,
-                             Buckets()
-                                     .set(BUCKET_FOREGROUND, 50, 50)
-                                     .set(BUCKET_BACKGROUND, 51, 51)
-                                     .set(BUCKET_SCREEN_ON, 101, 101)),
-              listener->mReplies[4].bytes);
+    Buckets fg = Buckets().set(BUCKET_FOREGROUND, 101, 25).set(BUCKET_SCREEN_ON, 101, 25);
+    Buckets bg = screenOnBackground(101, 25);
+    Buckets component = Buckets()
+                            .set(BUCKET_FOREGROUND, 50, 50)
+                            .set(BUCKET_BACKGROUND, 51, 51)
+                            .set(BUCKET_SCREEN_ON, 101, 101);
+    EXPECT_EQ((std::vector<Bytes>{
+                  elementReply(0, 0, 101, "com.fg", fg),
+                  elementReply(0, 0, 101, "com.fg:remote", fg), elementReply(0, 0, 101, "com.x", bg),
+                  elementReply(0, 0, 101, "com.y", bg), componentReply(0, 0, 101, component)}),
+              replyBytes(*listener));
 
     // Charging: the same split in the charge buckets, no screen bucket.
     ASSERT_EQ(0, Action(kShared, ACTION_CHARGER_ONLINE).i64(101).flag(true).send());
     ASSERT_EQ(0, balanceAt(kShared, 202));
-    ASSERT_EQ(10u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 101, 202, "com.fg", Buckets().set(BUCKET_CHARGE_FOREGROUND, 101, 25)),
-              listener->mReplies[5].bytes);
-    EXPECT_EQ(elementReply(0, 101, 202, "com.y", Buckets().set(BUCKET_CHARGE_BACKGROUND, 101, 25)),
-              listener->mReplies[8].bytes);
-    EXPECT_EQ(componentReply(0, 101, 202,
-                             Buckets()
-                                     .set(BUCKET_CHARGE_FOREGROUND, 50, 50)
-                                     .set(BUCKET_CHARGE_BACKGROUND, 51, 51)),
-              listener->mReplies[9].bytes);
+    fg = Buckets().set(BUCKET_CHARGE_FOREGROUND, 101, 25);
+    bg = Buckets().set(BUCKET_CHARGE_BACKGROUND, 101, 25);
+    component =
+        Buckets().set(BUCKET_CHARGE_FOREGROUND, 50, 50).set(BUCKET_CHARGE_BACKGROUND, 51, 51);
+    EXPECT_EQ(
+        (std::vector<Bytes>{
+            elementReply(0, 101, 202, "com.fg", fg), elementReply(0, 101, 202, "com.fg:remote", fg),
+            elementReply(0, 101, 202, "com.x", bg), elementReply(0, 101, 202, "com.y", bg),
+            componentReply(0, 101, 202, component)}),
+        replyBytes(*listener, 5));
 }
 
 TEST_F(AllocatorTest, NothingIsForegroundWithoutAForeground) {

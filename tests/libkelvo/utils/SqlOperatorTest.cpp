@@ -13,10 +13,13 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
+#include "kelvod/storage/StorageTestUtil.h"
+#include "utils/SqlOperator.h"
 
 using android::Parcel;
 using android::String8;
@@ -63,46 +66,22 @@ int32_t createTable(const char* table, const Columns& columns) {
     return run(kelvo::SQL_CREATE_TABLE, &in);
 }
 
-// Another connection to the same file, as a second process would hold it.
-class Peer {
-public:
-    explicit Peer(const std::string& path) { sqlite3_open(path.c_str(), &mDb); }
-    ~Peer() { sqlite3_close(mDb); }
-    int exec(const char* sql) { return sqlite3_exec(mDb, sql, nullptr, nullptr, nullptr); }
-    // Every row of the query, its columns joined by '|' (NULL as "<null>").
-    Rows rows(const std::string& sql) {
-        Rows out;
-        sqlite3_stmt* stmt = nullptr;
-        EXPECT_EQ(SQLITE_OK, sqlite3_prepare_v2(mDb, sql.c_str(), -1, &stmt, nullptr)) << sql;
-        while (stmt != nullptr && sqlite3_step(stmt) == SQLITE_ROW) {
-            std::string row;
-            for (int i = 0; i < sqlite3_column_count(stmt); ++i) {
-                const unsigned char* text = sqlite3_column_text(stmt, i);
-                row += std::string(i > 0 ? "|" : "") +
-                       (text != nullptr ? reinterpret_cast<const char*>(text) : "<null>");
-            }
-            out.push_back(row);
-        }
-        sqlite3_finalize(stmt);
-        return out;
-    }
-
-private:
-    sqlite3* mDb = nullptr;
-};
-
 class SqlOperatorTest : public ::testing::Test {
 protected:
     void SetUp() override {
         mSavedDebug = kelvo::gLibLogDebugEnable.load();
         mPath = mRoot.path() + "/kelvo.db";
+        kelvo::SqlOperator::setBusyTimeoutMs(kBusyMs);
+        kelvo::HealthCounters::resetForTest();
         ASSERT_EQ(0, runPath(kelvo::SQL_OPEN_CONNECTION, mPath));
     }
     void TearDown() override {
         EXPECT_EQ(0, run(kelvo::SQL_CLOSE_CONNECTION));
+        kelvo::SqlOperator::setBusyTimeoutMs(0);
         kelvo::gLibLogDebugEnable = mSavedDebug;
     }
-    Rows query(const std::string& sql) { return Peer(mPath).rows(sql); }
+    static constexpr int kBusyMs = 400;
+    Rows query(const std::string& sql) { return kelvo::test::DirectDb(mPath).column(sql); }
 
     kelvo::test::TempRoot mRoot;
     std::string mPath;
@@ -166,8 +145,8 @@ TEST_F(SqlOperatorTest, InsertBindsEveryColumnKindInOrder) {
               lines[0].text);
     EXPECT_EQ(ANDROID_LOG_DEBUG, lines[0].priority);
     EXPECT_EQ(2u, log.count("Unknown data type: 9", ANDROID_LOG_ERROR));
-    EXPECT_EQ((Rows{"1|1000|first|<null>|-5|" + std::to_string(bytes),
-                    "2|2000|second|<null>|-6|" + std::to_string(bytes + 1)}),
+    EXPECT_EQ((Rows{"1|1000|first||-5|" + std::to_string(bytes),
+                    "2|2000|second||-6|" + std::to_string(bytes + 1)}),
               query("SELECT id, ts, name, x, level, bytes FROM t ORDER BY id"));
 }
 
@@ -246,6 +225,7 @@ TEST_F(SqlOperatorTest, StatementsWithASecondStatementAreRefused) {
     EXPECT_EQ(0u, reply.dataSize());
     EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
     EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
+    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
     EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
 
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
@@ -320,7 +300,7 @@ TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
 
 TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
-    Peer reader(mPath);
+    kelvo::test::DirectDb reader(mPath);
     LogCapture log;
     ASSERT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (1)"));
@@ -344,12 +324,12 @@ TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     EXPECT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
     EXPECT_EQ(0, run(kelvo::SQL_COMMIT_TRANSACTION));
     EXPECT_EQ(0, run(kelvo::SQL_VACUUM_DATABASE));
-    EXPECT_EQ((Rows{"2", "9"}), reader.rows("SELECT v FROM t ORDER BY v"));
+    EXPECT_EQ((Rows{"2", "9"}), reader.column("SELECT v FROM t ORDER BY v"));
 
     // A short lock of another writer is waited out.
     ASSERT_EQ(SQLITE_OK, reader.exec("BEGIN IMMEDIATE; DELETE FROM t;"));
     std::thread release([&reader] {
-        std::this_thread::sleep_for(std::chrono::milliseconds(300));
+        std::this_thread::sleep_for(std::chrono::milliseconds(kBusyMs / 8));
         reader.exec("COMMIT;");
     });
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4)"));
@@ -362,7 +342,7 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
     const std::string copy = mRoot.path() + "/copy.db";
     ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
-    EXPECT_EQ((Rows{"4", "5"}), Peer(copy).rows("SELECT v FROM t ORDER BY v"));
+    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
 
     LogCapture log;
     const std::string unreachable = mRoot.path() + "/missing/copy.db";
@@ -373,7 +353,7 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
 
     // The source stays locked past the busy time-out: the new file goes.
     const std::string blocked = mRoot.path() + "/blocked.db";
-    Peer locker(mPath);
+    kelvo::test::DirectDb locker(mPath);
     ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
     EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
     EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
@@ -384,4 +364,34 @@ TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
     mRoot.writeFile("/foreign.db", "somebody's file\n");
     EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
     EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
+}
+
+TEST_F(SqlOperatorTest, AFullStatementCacheKeepsTheStatementInUse) {
+    // Single-row inserts into distinct tables fill the cache exactly; then a
+    // parcel of several rows needs its savepoint statement besides the
+    // insert statement it holds. Going on past the cache empties it again.
+    const size_t full = kelvo::SqlOperator::kMaxCachedStatements;
+    auto insert = [](size_t table, int32_t rows) {
+        Parcel in;
+        writeHead(in, ("t" + std::to_string(table)).c_str(), {{"v", kelvo::COLUMN_INT}});
+        in.writeInt32(rows);
+        for (int32_t i = 0; i < rows; ++i) {
+            in.writeInt32(i);
+        }
+        return run(kelvo::SQL_INSERT_ENTRIES, &in);
+    };
+    ASSERT_EQ(0, run(kelvo::SQL_BEGIN_TRANSACTION));
+    for (size_t t = 0; t < full + 44; ++t) {
+        ASSERT_EQ(0, createTable(("t" + std::to_string(t)).c_str(), {{"v", kelvo::COLUMN_INT}}));
+        ASSERT_EQ(SQLITE_DONE, insert(t, 1)) << t;
+        if (t + 1 == full) {
+            ASSERT_EQ(SQLITE_DONE, insert(t, 3));
+        }
+    }
+    for (size_t t = 0; t < full + 44; ++t) {
+        ASSERT_EQ(SQLITE_DONE, insert(t, 2)) << t;
+    }
+    ASSERT_EQ(0, run(kelvo::SQL_COMMIT_TRANSACTION));
+    EXPECT_EQ(Rows{"6"}, query("SELECT count(*) FROM t" + std::to_string(full - 1)));
+    EXPECT_EQ(Rows{"3"}, query("SELECT count(*) FROM t" + std::to_string(full + 43)));
 }
