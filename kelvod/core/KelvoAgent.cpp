@@ -36,33 +36,38 @@ Factories& factories() {
 
 std::atomic<KelvoAgent::ExitHook> gExitHook{&exit};
 
+// Taken only to create the agent. Its constructor takes other locks (the
+// schema registry's, the storage thread's), so the lock is never needed once
+// the agent exists: neither later callers nor the error forwarding path,
+// which runs under whatever lock the failing code holds, take it.
 std::mutex gInstanceLock;
-android::sp<KelvoAgent>* gInstance = nullptr;
+// Set once and never destroyed.
+std::atomic<android::sp<KelvoAgent>*> gInstance{nullptr};
 
 void forwardError(const android::Parcel& data) {
-    android::sp<KelvoAgent> agent;
-    {
-        std::lock_guard<std::mutex> guard(gInstanceLock);
-        if (gInstance != nullptr) {
-            agent = *gInstance;
-        }
-    }
-    if (agent != nullptr) {
-        agent->logError(data);
+    android::sp<KelvoAgent>* instance = gInstance.load(std::memory_order_acquire);
+    if (instance != nullptr) {
+        (*instance)->logError(data);
     }
 }
 
 } // namespace
 
 android::sp<KelvoAgent> KelvoAgent::getInstance() {
+    android::sp<KelvoAgent>* instance = gInstance.load(std::memory_order_acquire);
+    if (instance != nullptr) {
+        return *instance;
+    }
     std::lock_guard<std::mutex> guard(gInstanceLock);
-    if (gInstance == nullptr) {
+    instance = gInstance.load(std::memory_order_relaxed);
+    if (instance == nullptr) {
         // Errors raised while the agent is built reach the system log only:
         // the sink is installed once the agent exists.
-        gInstance = new android::sp<KelvoAgent>(new KelvoAgent());
+        instance = new android::sp<KelvoAgent>(new KelvoAgent());
+        gInstance.store(instance, std::memory_order_release);
         ErrorLogger::setSink(forwardError);
     }
-    return *gInstance;
+    return *instance;
 }
 
 void KelvoAgent::setHandlerFactory(int32_t id, OperatorFactory factory) {
