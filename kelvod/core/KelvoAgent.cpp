@@ -41,8 +41,13 @@ Factories& factories() {
 // them.
 std::atomic<KelvoAgent::ExitHook> gExitHook{&_exit};
 
+// Taken only to create the agent. Its constructor takes other locks (the
+// schema registry's, the storage thread's), so the lock is never needed once
+// the agent exists: neither later callers nor the error forwarding path,
+// which runs under whatever lock the failing code holds, take it.
 std::mutex gInstanceLock;
-android::sp<KelvoAgent>* gInstance = nullptr;
+// Set once and never destroyed.
+std::atomic<android::sp<KelvoAgent>*> gInstance{nullptr};
 // Set on the thread that builds the agent, which holds gInstanceLock: an
 // error raised meanwhile would ask for the agent being built.
 thread_local bool tBuildingAgent = false;
@@ -51,32 +56,32 @@ void forwardError(const android::Parcel& data) {
     if (tBuildingAgent) {
         return;
     }
-    android::sp<KelvoAgent> agent;
-    {
-        std::lock_guard<std::mutex> guard(gInstanceLock);
-        if (gInstance != nullptr) {
-            agent = *gInstance;
-        }
-    }
-    if (agent != nullptr) {
-        agent->logError(data);
+    android::sp<KelvoAgent>* instance = gInstance.load(std::memory_order_acquire);
+    if (instance != nullptr) {
+        (*instance)->logError(data);
     }
 }
 
 } // namespace
 
 android::sp<KelvoAgent> KelvoAgent::getInstance() {
+    android::sp<KelvoAgent>* instance = gInstance.load(std::memory_order_acquire);
+    if (instance != nullptr) {
+        return *instance;
+    }
     std::lock_guard<std::mutex> guard(gInstanceLock);
-    if (gInstance == nullptr) {
+    instance = gInstance.load(std::memory_order_relaxed);
+    if (instance == nullptr) {
         // Errors raised while the agent is built reach the system log only:
         // the sink is installed once the agent exists, and a sink already in
         // place skips them.
         tBuildingAgent = true;
-        gInstance = new android::sp<KelvoAgent>(new KelvoAgent());
+        instance = new android::sp<KelvoAgent>(new KelvoAgent());
         tBuildingAgent = false;
+        gInstance.store(instance, std::memory_order_release);
         ErrorLogger::setSink(forwardError);
     }
-    return *gInstance;
+    return *instance;
 }
 
 void KelvoAgent::setHandlerFactory(int32_t id, OperatorFactory factory) {

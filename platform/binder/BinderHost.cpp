@@ -476,6 +476,10 @@ void BinderHost::rearm(int fd, uint64_t key) {
     struct epoll_event ev = {};
     ev.events = EPOLLIN | EPOLLRDHUP | EPOLLONESHOT;
     ev.data.u64 = key;
+    // Under the lock: the thread that takes the next event (and may close the
+    // descriptor) takes the lock once its wait returns, so all this thread
+    // did with the descriptor happens before.
+    std::lock_guard<std::mutex> guard(mLock);
     epoll_ctl(mEpoll, EPOLL_CTL_MOD, fd, &ev);
 }
 
@@ -552,6 +556,7 @@ void BinderHost::handleListener(const std::shared_ptr<Listener>& listener) {
     struct epoll_event ev = {};
     ev.events = EPOLLIN | EPOLLONESHOT;
     ev.data.u64 = listener->key;
+    std::lock_guard<std::mutex> guard(mLock);  // as in rearm
     epoll_ctl(mEpoll, EPOLL_CTL_MOD, listener->fd, &ev);
 }
 
