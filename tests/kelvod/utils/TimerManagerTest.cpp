@@ -114,29 +114,6 @@ TEST_F(TimerManagerTest, OneShotFiresOncePeriodicRepeatsAndADuplicateIsRefused) 
     }
 }
 
-TEST_F(TimerManagerTest, RemovalStopsDelivery) {
-    LogCapture log;
-    sp<TimerCallback> callback = makeCallback(4);
-    ASSERT_EQ(0, mManager->addTimer(0, 10, callback));
-    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(4) >= 2; }, 2000ms));
-
-    ASSERT_EQ(0, mManager->removeTimer(callback));
-    ASSERT_TRUE(mThread->drain());
-    size_t settled = mThread->timerCount(4);
-    std::this_thread::sleep_for(200ms);
-    ASSERT_TRUE(mThread->drain());
-    EXPECT_EQ(settled, mThread->timerCount(4));
-
-    // Gone from the manager: removing again is harmless, the rest refuse.
-    EXPECT_EQ(0, mManager->removeTimer(callback));
-    EXPECT_EQ(-4, mManager->rescheduleTimer(callback));
-    EXPECT_EQ(-4, mManager->getExpireTime(callback));
-
-    // The same callback can be added again afterwards.
-    ASSERT_EQ(0, mManager->addTimer(0, 0, callback));
-    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(4) > settled; }, 2000ms));
-}
-
 TEST_F(TimerManagerTest, ExpireTimeFollowsReschedulesAndBadTimesAreRefused) {
     LogCapture log;
     sp<TimerCallback> callback = makeCallback(5);
