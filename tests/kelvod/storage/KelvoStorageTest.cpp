@@ -30,13 +30,6 @@ const table_attribute kScreenState = {"1.0", 1, 2, kScreenColumns, "raw_screen_s
 const table_attribute kScreenStateV11 = {"1.1", 1, 2, kScreenColumns, "raw_screen_state"};
 const table_attribute kScreenStateV110 = {"1.10", 1, 2, kScreenColumns, "raw_screen_state"};
 
-const column_attribute kAboutColumns[] = {
-        {kelvo::COLUMN_TIME, "timestamp"},
-        {kelvo::COLUMN_TEXT, "key"},
-        {kelvo::COLUMN_TEXT, "value"},
-};
-const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
-
 const column_attribute kMixedColumns[] = {
         {kelvo::COLUMN_TEXT, "name"},
         {kelvo::COLUMN_LONG, "energy"},

@@ -9,8 +9,7 @@
 using android::Parcel;
 using android::String8;
 using namespace kelvo;
-using kelvo::test::DirectDb;
-using kelvo::test::LogCapture;
+using namespace kelvo::test;
 
 namespace {
 
@@ -28,14 +27,7 @@ const column_attribute kHourlyColumns[] = {
 };
 const table_attribute kHourly = {"1.0", 1, 4, kHourlyColumns, "hourly_test"};
 
-const column_attribute kAboutColumns[] = {
-        {kelvo::COLUMN_TIME, "timestamp"},
-        {kelvo::COLUMN_TEXT, "key"},
-        {kelvo::COLUMN_TEXT, "value"},
-};
-const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
-
-class StorageOperatorTest : public kelvo::test::AgentStorageTest {
+class StorageOperatorTest : public AgentStorageTest {
 protected:
     void addTables() override {
         StorageOperator::addSchema(kForeground);

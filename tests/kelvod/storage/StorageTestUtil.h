@@ -33,6 +33,14 @@ private:
     sqlite3* mDb = nullptr;
 };
 
+// The daemon's key-value table, as its system handler defines it.
+inline const column_attribute kAboutColumns[] = {
+        {COLUMN_TIME, "timestamp"},
+        {COLUMN_TEXT, "key"},
+        {COLUMN_TEXT, "value"},
+};
+inline const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
+
 // The process-wide agent's storage thread, started on a fresh root with the
 // tables addTables() registers; stopped after the test.
 class AgentStorageTest : public ::testing::Test {
