@@ -8,14 +8,14 @@
 
 #include "KelvoLibEntry.h"
 #include "common/TestEnv.h"
+#include "libkelvo/LibraryTestUtil.h"
 #include "utils/XmlParser.h"
 
 using android::Parcel;
 using android::String8;
 using kelvo::config_parameter;
 using kelvo::XmlParser;
-using kelvo::test::LogCapture;
-using kelvo::test::TempRoot;
+using namespace kelvo::test;
 
 namespace {
 
@@ -58,12 +58,6 @@ constexpr const char* kTestXml = R"(<?xml version="1.0"?>
   </element>
 </config>
 )";
-
-using Bytes = std::vector<uint8_t>;
-
-Bytes bytesOf(const Parcel& parcel) {
-    return Bytes(parcel.data(), parcel.data() + parcel.dataSize());
-}
 
 Bytes ints(std::initializer_list<int32_t> values) {
     Parcel parcel;
