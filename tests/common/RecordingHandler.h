@@ -11,27 +11,34 @@
 namespace kelvo {
 namespace test {
 
-// A handler thread that records the type, `what` and leading int64 of every
-// message it handles (0 when the body holds none).
+// A handler thread that records the type, `what`, leading int64 and the
+// int32 after it of every message it handles (0 for what the body lacks).
 class RecordingHandler : public HandlerThread {
 public:
     struct Got {
         int32_t type;
         int32_t what;
         int64_t time;
+        int32_t value;
     };
 
     explicit RecordingHandler(const char* name) : HandlerThread(name, 11) {}
 
     int32_t handleParcelMessage(const ParcelMessage& msg) override {
         std::lock_guard<std::mutex> guard(mLock);
-        mGot.push_back({msg.type, msg.what, msg.getParcel().readInt64()});
+        int64_t time = msg.getParcel().readInt64();
+        mGot.push_back({msg.type, msg.what, time, msg.getParcel().readInt32()});
         return 0;
     }
 
     std::vector<Got> got() {
         std::lock_guard<std::mutex> guard(mLock);
         return mGot;
+    }
+
+    void clear() {
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.clear();
     }
 
     size_t count(int32_t type, int32_t what) {

@@ -6,7 +6,6 @@
 #include <stdint.h>
 
 #include <atomic>
-#include <string>
 
 #include <binder/Parcel.h>
 

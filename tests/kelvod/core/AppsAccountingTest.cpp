@@ -1,17 +1,8 @@
-#include <gtest/gtest.h>
-#include <json/json.h>
 #include <stdlib.h>
 #include <time.h>
 
-#include <sstream>
-#include <string>
-#include <vector>
-
-#include "common/TestEnv.h"
 #include "core/AppsAccounting.h"
-#include "core/KelvoAgent.h"
 #include "kelvo/PowerLog.h"
-#include "kelvo/ZendrelHost.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/DataUploader.h"
 #include "utils/PackageProperty.h"
@@ -20,10 +11,7 @@ using android::Parcel;
 using android::String8;
 using kelvo::AppsAccounting;
 using kelvo::DataUploader;
-using kelvo::KelvoAgent;
-using kelvo::KelvoStorage;
 using kelvo::test::DirectDb;
-using kelvo::test::TempRoot;
 
 namespace {
 
@@ -62,46 +50,24 @@ void network(int64_t t, const char* name, int32_t code, int64_t fg, int64_t byte
     record(t, name, code, {}, {fg, 0, fg, 0, bytes, 0, bytes, 0}, {});
 }
 
-class AppsAccountingTest : public ::testing::Test {
+class AppsAccountingTest : public kelvo::test::AgentStorageTest {
 protected:
-    void SetUp() override {
+    void addTables() override {
         setenv("TZ", "UTC", 1);
         tzset();
-        mRoot.reset(new TempRoot());
-        mStorage = KelvoAgent::getInstance()->getStorage();
         AppsAccounting::getInstance()->addSchemaTable();
         DataUploader::getInstance()->addSchemaTable();
-        ASSERT_EQ(0, mStorage->startConnection());
     }
     void TearDown() override {
-        DataUploader::getInstance()->uploadEvent();
-        mStorage->flushAllEntries();
-        mStorage->closeConnection();
-        mRoot.reset();
+        AgentStorageTest::TearDown();
         unsetenv("TZ");
         tzset();
     }
-    std::vector<std::string> rows(const std::string& select) {
-        mStorage->flushAllEntries();
-        DirectDb db(mRoot->path() + KelvoStorage::kDatabasePath);
-        return db.column(select);
-    }
     Json::Value sentEvent() {
         DataUploader::getInstance()->uploadEvent();
-        std::istringstream in(mRoot->readFile(KELVO_ZENDREL_EVENTS_FILE));
-        Json::Value last;
-        std::string line;
-        while (std::getline(in, line)) {
-            std::istringstream one(line);
-            Json::CharReaderBuilder builder;
-            std::string errors;
-            Json::parseFromStream(builder, one, &last, &errors);
-        }
-        return last;
+        std::vector<Json::Value> sent = events();
+        return sent.empty() ? Json::Value() : sent.back();
     }
-
-    std::unique_ptr<TempRoot> mRoot;
-    android::sp<KelvoStorage> mStorage;
 };
 
 } // namespace
@@ -221,7 +187,7 @@ TEST_F(AppsAccountingTest, PackageStrategiesAreLoadedOnceAndAFailureLoggedOnce) 
     EXPECT_EQ(1u, log.count("Failed to query package strategy", ANDROID_LOG_ERROR));
     EXPECT_EQ(1u, log.count("raw_pelmora_strategy", ANDROID_LOG_ERROR));
 
-    DirectDb db(mRoot->path() + KelvoStorage::kDatabasePath);
+    DirectDb db(dbPath());
     ASSERT_EQ(SQLITE_OK, db.exec("CREATE TABLE raw_pelmora_strategy (name TEXT, type INTEGER); "
                                  "INSERT INTO raw_pelmora_strategy VALUES ('com.a', 3)"));
     property->clearPackageStrategy();

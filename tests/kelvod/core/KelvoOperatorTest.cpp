@@ -1,6 +1,5 @@
 #include <gtest/gtest.h>
 
-#include <sys/syscall.h>
 #include <unistd.h>
 
 #include <chrono>
@@ -326,7 +325,4 @@ TEST_F(KelvoOperatorTest, AccountingRoundsLogAndVoteOnce) {
     EXPECT_EQ(2u, log.count("Invalid routine", ANDROID_LOG_ERROR));
     EXPECT_EQ(-5, op->setElector(0x2, Parcel()));
     EXPECT_TRUE(log.contains("Empty candidates", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-5, op->sendCustomizedMessage(1, Parcel(), nullptr, true));
-    EXPECT_EQ(-1, op->handleLibraryEvent(2, Parcel()));
-    EXPECT_TRUE(log.contains("Unknown library event: 2", ANDROID_LOG_ERROR));
 }

@@ -1,7 +1,6 @@
 #include <gtest/gtest.h>
 
 #include <chrono>
-#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -12,10 +11,7 @@
 
 using android::Parcel;
 using android::sp;
-using kelvo::HandlerThread;
-using kelvo::Notifier;
-using kelvo::NotifierListener;
-using kelvo::ParcelMessage;
+using namespace kelvo;
 using kelvo::test::LogCapture;
 using kelvo::test::waitFor;
 

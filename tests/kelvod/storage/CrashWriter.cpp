@@ -5,7 +5,6 @@
 //   kelvo_crash_writer <root directory>
 
 #include <cstdio>
-#include <cstdlib>
 
 #include "kelvo/RootPath.h"
 #include "storage/KelvoStorage.h"

@@ -1,73 +1,32 @@
-#include <gtest/gtest.h>
-#include <json/json.h>
-
-#include <sstream>
-#include <string>
-#include <vector>
-
-#include "common/TestEnv.h"
-#include "core/KelvoAgent.h"
-#include "kelvo/HostProperties.h"
 #include "HealthCounters.h"
+#include "kelvo/HostProperties.h"
 #include "kelvo/ZendrelHost.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/DataUploader.h"
 
 using android::Parcel;
-using android::String8;
 using kelvo::DataUploader;
-using kelvo::KelvoAgent;
-using kelvo::KelvoStorage;
 using kelvo::ZendrelHost;
-using kelvo::test::DirectDb;
 using kelvo::test::LogCapture;
-using kelvo::test::TempRoot;
 
 namespace {
 
-class DataUploaderTest : public ::testing::Test {
+class DataUploaderTest : public kelvo::test::AgentStorageTest {
 protected:
-    void SetUp() override {
-        mRoot.reset(new TempRoot());
-        mStorage = KelvoAgent::getInstance()->getStorage();
-        mUploader = DataUploader::getInstance();
+    void addTables() override {
         mUploader->addSchemaTable();
-        ASSERT_EQ(0, mStorage->startConnection());
         ZendrelHost::clearFailures();
         mLiveBefore = ZendrelHost::liveObjects();
     }
     void TearDown() override {
-        mUploader->uploadEvent();
+        AgentStorageTest::TearDown();
         ZendrelHost::clearFailures();
-        mStorage->flushAllEntries();
-        mStorage->closeConnection();
-        mRoot.reset();
     }
-
-    std::vector<Json::Value> events() const {
-        std::vector<Json::Value> out;
-        std::istringstream lines(mRoot->readFile(KELVO_ZENDREL_EVENTS_FILE));
-        std::string line;
-        while (std::getline(lines, line)) {
-            Json::Value value;
-            Json::CharReaderBuilder builder;
-            std::string errors;
-            std::istringstream in(line);
-            EXPECT_TRUE(Json::parseFromStream(builder, in, &value, &errors)) << line;
-            out.push_back(value);
-        }
-        return out;
-    }
-
     std::vector<std::string> results() {
-        mStorage->flushAllEntries();
-        DirectDb db(mRoot->path() + KelvoStorage::kDatabasePath);
-        return db.column("SELECT eventid || ':' || result FROM debug_upload_result ORDER BY id");
+        return rows("SELECT eventid || ':' || result FROM debug_upload_result ORDER BY id");
     }
 
-    std::unique_ptr<TempRoot> mRoot;
-    android::sp<KelvoStorage> mStorage;
-    DataUploader* mUploader = nullptr;
+    DataUploader* mUploader = DataUploader::getInstance();
     int32_t mLiveBefore = 0;
 };
 

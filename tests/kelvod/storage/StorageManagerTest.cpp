@@ -1,20 +1,15 @@
 #include <binder/Parcel.h>
-#include <dirent.h>
 #include <gtest/gtest.h>
 #include <signal.h>
-#include <stdlib.h>
 #include <sys/resource.h>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <ziparchive/zip_archive.h>
 
 #include <algorithm>
-#include <fstream>
 #include <functional>
 #include <map>
 #include <random>
 #include <regex>
-#include <sstream>
 #include <string>
 #include <utility>
 #include <vector>
@@ -30,14 +25,7 @@
 using android::String8;
 using kelvo::RootPath;
 using kelvo::StorageManager;
-using kelvo::test::LogCapture;
-using kelvo::test::TempRoot;
-using kelvo::test::hostPathExists;
-using kelvo::test::listDir;
-using kelvo::test::makeHostDirs;
-using kelvo::test::readHostFile;
-using kelvo::test::readZip;
-using kelvo::test::writeHostFile;
+using namespace kelvo::test;
 
 namespace {
 
@@ -53,7 +41,6 @@ std::vector<std::string> copiesIn(const std::string& dir) {
     std::sort(contents.begin(), contents.end());
     return contents;
 }
-
 
 std::string copyName(int64_t time) {
     return "kelvo-" + std::to_string(time) + ".db";
@@ -485,13 +472,9 @@ TEST(StorageManagerNameTest, BackupNamesComeFromTheBaseNameOnly) {
         {"/tmp/my-root/data/log/kelvo/kelvo.db", 42, 0, "kelvo-42.db"},
         {"/tmp/my-root/backup/kelvo-42-0.zip", 7, 0, "kelvo-42-1.zip"},
         {"/a-b/c-d/kelvo-42-5.zip", 0, 0, "kelvo-42-6.zip"},
-        {"/tmp/my-root/notes.txt", 1, -5, ""},
         {"/tmp/my.db/notes", 1, -5, ""},
-        {"/tmp/my-root/.db", 1, -5, ""},
         {"/tmp/my-root/-3.zip", 1, -5, ""},
         {"/tmp/x/kelvo-42-x.zip", 1, -2, ""},
-        {"/tmp/x/kelvo-42-3.db", 1, -2, ""},
-        {"/tmp/x/kelvo-42-3.zipx", 1, -5, ""},
         {"/tmp/x/kelvo-42-2147483647.zip", 1, -2, ""},
     };
     for (const Case& c : cases) {

@@ -1,32 +1,15 @@
-#include <gtest/gtest.h>
-
 #include <chrono>
-#include <memory>
-#include <string>
 #include <thread>
-#include <vector>
 
 #include "HealthCounters.h"
-#include "KelvoLog.h"
-#include "common/TestEnv.h"
-#include "core/KelvoAgent.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/StorageOperator.h"
 #include "utils/KelvoUtils.h"
 
 using android::Parcel;
-using android::sp;
 using android::String8;
-using kelvo::Health;
-using kelvo::HealthCounters;
-using kelvo::KelvoAgent;
-using kelvo::KelvoStorage;
-using kelvo::StorageOperator;
-using kelvo::column_attribute;
-using kelvo::table_attribute;
-using kelvo::test::DirectDb;
-using kelvo::test::LogCapture;
-using kelvo::test::TempRoot;
+using namespace kelvo;
+using namespace kelvo::test;
 
 namespace {
 
@@ -44,34 +27,15 @@ const column_attribute kHourlyColumns[] = {
 };
 const table_attribute kHourly = {"1.0", 1, 4, kHourlyColumns, "hourly_test"};
 
-const column_attribute kAboutColumns[] = {
-        {kelvo::COLUMN_TIME, "timestamp"},
-        {kelvo::COLUMN_TEXT, "key"},
-        {kelvo::COLUMN_TEXT, "value"},
-};
-const table_attribute kAbout = {"1.0", 1, 3, kAboutColumns, "about_kelvo_daemon"};
-
-class StorageOperatorTest : public ::testing::Test {
+class StorageOperatorTest : public AgentStorageTest {
 protected:
-    void SetUp() override {
-        mRoot.reset(new TempRoot());
-        mStorage = KelvoAgent::getInstance()->getStorage();
-        ASSERT_NE(nullptr, mStorage.get());
+    void addTables() override {
         StorageOperator::addSchema(kForeground);
         StorageOperator::addSchema(kHourly);
         StorageOperator::addSchema(kAbout);
-        ASSERT_EQ(0, mStorage->startConnection());
         HealthCounters::resetForTest();
     }
-    void TearDown() override {
-        mStorage->flushAllEntries();
-        mStorage->closeConnection();
-        mRoot.reset();
-    }
-    DirectDb db() const { return DirectDb(mRoot->path() + KelvoStorage::kDatabasePath); }
-
-    std::unique_ptr<TempRoot> mRoot;
-    sp<KelvoStorage> mStorage;
+    DirectDb db() const { return DirectDb(dbPath()); }
 };
 
 void foregroundRow(Parcel* rows, int64_t time, const char* name) {
@@ -219,14 +183,7 @@ TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
               db().column("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
                           "hourly_test ORDER BY name"));
 
-    // An empty result inserts nothing; a result of the wrong shape neither.
-    Parcel none;
-    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
-                         String8("SELECT name, COUNT(*), SUM(timestamp) FROM raw_foreground "
-                                 "WHERE name = 'zzz' GROUP BY name"),
-                         &none, 3, count));
-    EXPECT_EQ(0, count);
-    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, none, 7200000));
+    // A result of the wrong shape inserts nothing.
     LogCapture log;
     Parcel wrong;
     ASSERT_EQ(0, StorageOperator::queryEntriesSimple(String8("SELECT name FROM raw_foreground"),
@@ -252,7 +209,7 @@ TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
     // Another connection holds the database while the update runs, so the
     // storage thread cannot answer before the (shortened) time-out.
     kelvo::HandlerThread::setSyncTimeoutMs(200);
-    std::unique_ptr<DirectDb> other(new DirectDb(mRoot->path() + KelvoStorage::kDatabasePath));
+    std::unique_ptr<DirectDb> other(new DirectDb(dbPath()));
     ASSERT_EQ(SQLITE_OK, other->exec("BEGIN EXCLUSIVE"));
     std::thread release([&] {
         std::this_thread::sleep_for(std::chrono::milliseconds(600));

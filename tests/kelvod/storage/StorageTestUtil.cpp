@@ -1,5 +1,11 @@
 #include "kelvod/storage/StorageTestUtil.h"
 
+#include <sstream>
+
+#include "core/KelvoAgent.h"
+#include "kelvo/ZendrelHost.h"
+#include "storage/DataUploader.h"
+
 namespace kelvo {
 namespace test {
 
@@ -51,6 +57,40 @@ long long DirectDb::scalar(const std::string& sql) const {
 
 int DirectDb::exec(const std::string& sql) const {
     return mDb == nullptr ? SQLITE_ERROR : sqlite3_exec(mDb, sql.c_str(), nullptr, nullptr, nullptr);
+}
+
+void AgentStorageTest::SetUp() {
+    mRoot.reset(new TempRoot());
+    mStorage = KelvoAgent::getInstance()->getStorage();
+    addTables();
+    ASSERT_EQ(0, mStorage->startConnection());
+}
+
+void AgentStorageTest::TearDown() {
+    DataUploader::getInstance()->uploadEvent();
+    mStorage->flushAllEntries();
+    mStorage->closeConnection();
+    mRoot.reset();
+}
+
+std::vector<std::string> AgentStorageTest::rows(const std::string& select) {
+    mStorage->flushAllEntries();
+    return DirectDb(dbPath()).column(select);
+}
+
+std::vector<Json::Value> AgentStorageTest::events() const {
+    std::vector<Json::Value> out;
+    std::istringstream lines(mRoot->readFile(KELVO_ZENDREL_EVENTS_FILE));
+    std::string line;
+    while (std::getline(lines, line)) {
+        Json::Value value;
+        Json::CharReaderBuilder builder;
+        std::string errors;
+        std::istringstream in(line);
+        EXPECT_TRUE(Json::parseFromStream(builder, in, &value, &errors)) << line;
+        out.push_back(value);
+    }
+    return out;
 }
 
 } // namespace test

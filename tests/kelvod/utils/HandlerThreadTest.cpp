@@ -3,7 +3,6 @@
 #include <atomic>
 #include <chrono>
 #include <climits>
-#include <mutex>
 #include <thread>
 #include <vector>
 
@@ -24,7 +23,7 @@ namespace {
 
 // Records what it receives (the body: one int64 value). Code 7 sleeps for
 // the value's milliseconds then replies; code 8 replies with the value
-// doubled; code 9 replies nothing; code 10 holds the thread until released.
+// doubled; code 10 holds the thread until released.
 class RecordingThread : public kelvo::test::RecordingHandler {
 public:
     explicit RecordingThread(const char* name = "RecordingThread") : RecordingHandler(name) {}
@@ -41,8 +40,6 @@ public:
             case 8:
                 msg.getReply()->writeInt32(value * 2);
                 return 80;
-            case 9:
-                return 90;
             case 10:
                 while (!mRelease.load()) {
                     std::this_thread::sleep_for(std::chrono::milliseconds(1));
@@ -88,26 +85,6 @@ TEST_F(HandlerThreadTest, DelayedMessageWaitsAndCanBeRemoved) {
     EXPECT_EQ(-4, t->removeMessage(removed));
     EXPECT_TRUE(log.contains("removeMessage# Invalid message id[" + std::to_string(late) +
                              "] in RecordingThread", ANDROID_LOG_ERROR));
-    t->requestThreadExit();
-}
-
-TEST_F(HandlerThreadTest, SynchronousSendReturnsStatusAndReply) {
-    sp<RecordingThread> t = new RecordingThread();
-    Parcel reply;
-    EXPECT_EQ(80, t->sendMessageSync(makeMessage(8, 21, &reply)));
-    EXPECT_EQ(0u, reply.dataPosition());
-    EXPECT_EQ(42, reply.readInt32());
-
-    // A handler that writes nothing leaves the caller's reply as it was.
-    Parcel untouched;
-    untouched.writeInt32(1234);
-    untouched.setDataPosition(4);
-    EXPECT_EQ(90, t->sendMessageSync(makeMessage(9, 0, &untouched)));
-    EXPECT_EQ(4u, untouched.dataSize());
-    EXPECT_EQ(4u, untouched.dataPosition());
-    untouched.setDataPosition(0);
-    EXPECT_EQ(1234, untouched.readInt32());
-
     t->requestThreadExit();
 }
 

@@ -1,14 +1,12 @@
 #include <gtest/gtest.h>
 
 #include <atomic>
-#include <chrono>
 #include <thread>
 #include <vector>
 
 #include "kelvod/binder/PlatformServicesFixture.h"
 #include "utils/PackageProperty.h"
 
-using android::Parcel;
 using android::String8;
 using kelvo::PackageProperty;
 using kelvo::PlatformState;
@@ -205,25 +203,4 @@ TEST_F(PackagePropertyTest, HangingPackageServiceDoesNotBlockCachedLookups) {
     asker.join();
     EXPECT_EQ("com.example.slow", byUid(slow));
     state().setDelayMs("package", 0);
-}
-
-TEST(PackagePropertyTypes, RemovesRecordedTypes) {
-    PackageProperty* property = PackageProperty::getInstance();
-    Parcel add;
-    for (const char* name : {"com.example.game", "com.example.video"}) {
-        add.writeInt64(0);
-        add.writeString8(String8(name));
-        add.writeInt64(7);
-    }
-    add.setDataPosition(0);
-    property->addPackageType(add);
-    EXPECT_EQ(7, property->getPackageType(String8("com.example.game")));
-
-    Parcel remove;
-    remove.writeString8(String8("com.example.game"));
-    remove.writeString8(String8("com.example.unknown"));
-    remove.setDataPosition(0);
-    property->removePackageType(remove);
-    EXPECT_EQ(0, property->getPackageType(String8("com.example.game")));
-    EXPECT_EQ(7, property->getPackageType(String8("com.example.video")));
 }

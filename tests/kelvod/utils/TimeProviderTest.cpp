@@ -2,16 +2,12 @@
 #include <stdlib.h>
 #include <time.h>
 
-#include <cstdint>
 #include <cstring>
 #include <string>
 
-#include "common/TestEnv.h"
-#include "kelvo/WallClock.h"
 #include "utils/TimeProvider.h"
 
 using kelvo::TimeProvider;
-using kelvo::test::LogCapture;
 
 namespace {
 
@@ -24,12 +20,6 @@ constexpr int64_t kInstant = 1700000000;
 
 std::string duration(TimeProvider provider) {
     return provider.toString(kelvo::TIME_FORMAT_DURATION, false);
-}
-
-int64_t nowMs(clockid_t clock) {
-    struct timespec ts = {};
-    clock_gettime(clock, &ts);
-    return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
 }
 
 // Switches the process time zone for one test and puts the old one back.
@@ -58,27 +48,6 @@ private:
     std::string mOldZone;
 };
 
-TEST(TimeProviderTest, CurrentTimeOfEachClockAndUnknownTypes) {
-    const char* offset = getenv("KELVO_CLOCK_OFFSET_MS");
-    std::string oldOffset = offset != nullptr ? offset : "";
-    unsetenv("KELVO_CLOCK_OFFSET_MS");
-    kelvo::WallClock::reloadOffset();
-
-    EXPECT_LE(std::llabs(TimeProvider::getCurrentTime(kelvo::TIME_TYPE_WALL) -
-                         nowMs(CLOCK_REALTIME)),
-              2000);
-    LogCapture log;
-    EXPECT_EQ(-3, TimeProvider::getCurrentTime(2));
-    EXPECT_EQ(-3, TimeProvider::getCurrentTime(-1));
-    EXPECT_EQ(2u,
-              log.count("[TimeProvider.cpp] getCurrentTime# Invalid time type", ANDROID_LOG_ERROR));
-
-    if (offset != nullptr) {
-        setenv("KELVO_CLOCK_OFFSET_MS", oldOffset.c_str(), 1);
-        kelvo::WallClock::reloadOffset();
-    }
-}
-
 TEST(TimeProviderTest, DurationsRoundMillisecondsAndFloorNegativeTimes) {
     struct Case {
         TimeProvider time;
@@ -99,17 +68,10 @@ TEST(TimeProviderTest, DurationsRoundMillisecondsAndFloorNegativeTimes) {
         EXPECT_EQ(c.text, duration(c.time));
     }
 
-    TimeProvider carried(1, 2500000000);
-    EXPECT_EQ(3, carried.getSeconds());
-    EXPECT_EQ(500000000, carried.getNanoseconds());
-    TimeProvider borrowed(5, -1);
-    EXPECT_EQ(4, borrowed.getSeconds());
     // The time in milliseconds is cut, not rounded.
-    EXPECT_EQ(4999, borrowed.getTimeMs());
-    TimeProvider negative(-1500);
-    EXPECT_EQ(-2, negative.getSeconds());
-    EXPECT_EQ(500000000, negative.getNanoseconds());
-    EXPECT_EQ(-1500, negative.getTimeMs());
+    EXPECT_EQ(4999, TimeProvider(5, -1).getTimeMs());
+    EXPECT_EQ(3500, TimeProvider(1, 2500000000).getTimeMs());
+    EXPECT_EQ(-1500, TimeProvider(-1500).getTimeMs());
     // Hours of negative times count back from the end of the day.
     EXPECT_EQ(22, TimeProvider::getHour(-kHourMs - 1, false));
 
@@ -119,36 +81,27 @@ TEST(TimeProviderTest, DurationsRoundMillisecondsAndFloorNegativeTimes) {
               32u);
 }
 
-TEST_F(TimeProviderZoneTest, DatesInUtcAndInTheLocalZone) {
-    useZone("CST-8");
-    TimeProvider east(kInstant * 1000);
-    EXPECT_EQ(28800, east.getLocalOffset());
-    EXPECT_EQ("2023-11-14 22:13:20", std::string(east.toString(kelvo::TIME_FORMAT_DATE, false)));
-    EXPECT_EQ("2023-11-15 06:13:20", std::string(east.toString(kelvo::TIME_FORMAT_DATE, true)));
-
-    useZone("EST5");
-    TimeProvider west(kInstant * 1000);
-    EXPECT_EQ("2023-11-14 17:13:20", std::string(west.toString(kelvo::TIME_FORMAT_DATE, true)));
-    // The offset is the one of construction time.
-    useZone("CST-8");
-    EXPECT_EQ(-18000, west.getLocalOffset());
-}
-
 TEST_F(TimeProviderZoneTest, HoursAndStartsOfDayAndHourFollowTheOffset) {
     struct Case {
         const char* zone;
         int32_t offset;
         int32_t hour;    // local hour of kInstant
         int32_t minutes; // local minutes past that hour
+        const char* date;
     } cases[] = {
-            {"CST-8", 28800, 6, 13},   {"EST5", -18000, 17, 13},
-            {"IST-5:30", 19800, 3, 43}, {"NST3:30", -12600, 18, 43},
-            {"<+14>-14", 50400, 12, 13}, {"<-12>12", -43200, 10, 13},
+            {"CST-8", 28800, 6, 13, "2023-11-15 06:13:20"},
+            {"EST5", -18000, 17, 13, "2023-11-14 17:13:20"},
+            {"IST-5:30", 19800, 3, 43, "2023-11-15 03:43:20"},
+            {"NST3:30", -12600, 18, 43, "2023-11-14 18:43:20"},
+            {"<+14>-14", 50400, 12, 13, "2023-11-15 12:13:20"},
+            {"<-12>12", -43200, 10, 13, "2023-11-14 10:13:20"},
     };
     for (const Case& c : cases) {
         useZone(c.zone);
         TimeProvider t(kInstant, 0);
         EXPECT_EQ(c.offset, t.getLocalOffset()) << c.zone;
+        EXPECT_STREQ(c.date, t.toString(kelvo::TIME_FORMAT_DATE, true));
+        EXPECT_STREQ("2023-11-14 22:13:20", t.toString(kelvo::TIME_FORMAT_DATE, false));
         EXPECT_EQ(c.hour, t.getHour(true)) << c.zone;
         EXPECT_EQ(c.hour, TimeProvider::getHour(kInstant * 1000, true)) << c.zone;
         EXPECT_EQ(kInstant - (c.minutes * 60 + 20), t.startOfHour()) << c.zone;
@@ -158,6 +111,10 @@ TEST_F(TimeProviderZoneTest, HoursAndStartsOfDayAndHourFollowTheOffset) {
         EXPECT_EQ(23, late.getHour(true)) << c.zone;
         EXPECT_EQ(t.startOfDay() - 86400, late.startOfDay()) << c.zone;
     }
+    // The offset is the one of construction time.
+    TimeProvider west(kInstant * 1000);
+    useZone("CST-8");
+    EXPECT_EQ(-43200, west.getLocalOffset());
 }
 
 } // namespace

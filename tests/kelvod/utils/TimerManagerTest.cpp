@@ -7,7 +7,6 @@
 #include <atomic>
 #include <chrono>
 #include <cstdlib>
-#include <mutex>
 #include <set>
 #include <string>
 #include <thread>
@@ -21,10 +20,7 @@
 #include "utils/TimerManager.h"
 
 using android::sp;
-using kelvo::HandlerThread;
-using kelvo::ParcelMessage;
-using kelvo::TimerCallback;
-using kelvo::TimerManager;
+using namespace kelvo;
 using kelvo::test::LogCapture;
 using kelvo::test::waitFor;
 using namespace std::chrono_literals;
@@ -114,29 +110,6 @@ TEST_F(TimerManagerTest, OneShotFiresOncePeriodicRepeatsAndADuplicateIsRefused) 
     }
 }
 
-TEST_F(TimerManagerTest, RemovalStopsDelivery) {
-    LogCapture log;
-    sp<TimerCallback> callback = makeCallback(4);
-    ASSERT_EQ(0, mManager->addTimer(0, 10, callback));
-    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(4) >= 2; }, 2000ms));
-
-    ASSERT_EQ(0, mManager->removeTimer(callback));
-    ASSERT_TRUE(mThread->drain());
-    size_t settled = mThread->timerCount(4);
-    std::this_thread::sleep_for(200ms);
-    ASSERT_TRUE(mThread->drain());
-    EXPECT_EQ(settled, mThread->timerCount(4));
-
-    // Gone from the manager: removing again is harmless, the rest refuse.
-    EXPECT_EQ(0, mManager->removeTimer(callback));
-    EXPECT_EQ(-4, mManager->rescheduleTimer(callback));
-    EXPECT_EQ(-4, mManager->getExpireTime(callback));
-
-    // The same callback can be added again afterwards.
-    ASSERT_EQ(0, mManager->addTimer(0, 0, callback));
-    EXPECT_TRUE(waitFor([&] { return mThread->timerCount(4) > settled; }, 2000ms));
-}
-
 TEST_F(TimerManagerTest, ExpireTimeFollowsReschedulesAndBadTimesAreRefused) {
     LogCapture log;
     sp<TimerCallback> callback = makeCallback(5);
@@ -170,50 +143,6 @@ TEST_F(TimerManagerTest, ExpireTimeFollowsReschedulesAndBadTimesAreRefused) {
     EXPECT_TRUE(waitFor([&] { return mThread->timerCount(5) >= 3; }, 2000ms));
     ASSERT_EQ(0, mManager->rescheduleTimer(callback));
     EXPECT_LE(mManager->getExpireTime(callback), 15);
-}
-
-TEST_F(TimerManagerTest, CallbackReadsOnlyTheDescriptorItIsRegisteredWith) {
-    LogCapture log;
-    sp<TimerCallback> callback = makeCallback(8);
-    sp<TimerCallback> stranger = makeCallback(9);
-    std::set<int> before = openTimerFds();
-    ASSERT_EQ(0, mManager->addTimer(60000, 0, callback));
-    std::set<int> after = openTimerFds();
-    std::vector<int> added;
-    for (int fd : after) {
-        if (before.count(fd) == 0) {
-            added.push_back(fd);
-        }
-    }
-    ASSERT_EQ(1u, added.size());
-    int timerFd = added[0];
-
-    // Woken although nothing expired (re-armed meanwhile): keep watching,
-    // post nothing.
-    EXPECT_EQ(1, callback->handleEvent(timerFd, android::Looper::EVENT_INPUT, nullptr));
-
-    // A descriptor the callback does not own, e.g. a number reused after its
-    // timer was removed: not read, dropped from the looper.
-    int pipeFds[2];
-    ASSERT_EQ(0, pipe2(pipeFds, O_NONBLOCK));
-    uint64_t eight = 8;
-    ASSERT_EQ(static_cast<ssize_t>(sizeof(eight)), write(pipeFds[1], &eight, sizeof(eight)));
-    EXPECT_EQ(0, callback->handleEvent(pipeFds[0], android::Looper::EVENT_INPUT, nullptr));
-    EXPECT_EQ(0, stranger->handleEvent(pipeFds[0], android::Looper::EVENT_INPUT, nullptr));
-    EXPECT_EQ(0, stranger->handleEvent(timerFd, android::Looper::EVENT_INPUT, nullptr));
-    int unread = 0;
-    ASSERT_EQ(0, ioctl(pipeFds[0], FIONREAD, &unread));
-    EXPECT_EQ(static_cast<int>(sizeof(eight)), unread);
-    close(pipeFds[0]);
-    close(pipeFds[1]);
-
-    EXPECT_EQ(0, callback->handleEvent(timerFd, android::Looper::EVENT_HANGUP, nullptr));
-    EXPECT_EQ(1u,
-              log.count("[TimerCallback.cpp] handleEvent# Unexpected events", ANDROID_LOG_ERROR));
-    EXPECT_FALSE(log.contains("Failed to read"));
-    ASSERT_TRUE(mThread->drain());
-    EXPECT_EQ(0u, mThread->timerCount(8));
-    EXPECT_EQ(0u, mThread->timerCount(9));
 }
 
 // Tells the looper to drop its descriptor after its first expiry, as a

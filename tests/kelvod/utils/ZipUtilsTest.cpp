@@ -2,12 +2,9 @@
 #include <stdio.h>
 #include <sys/stat.h>
 #include <unistd.h>
-#include <ziparchive/zip_archive.h>
 #include <ziparchive/zip_writer.h>
 
-#include <fstream>
 #include <map>
-#include <sstream>
 #include <string>
 #include <vector>
 
@@ -15,19 +12,11 @@
 #include "utils/ZipUtils.h"
 
 using kelvo::ZipUtils;
-using kelvo::test::LogCapture;
-using kelvo::test::TempRoot;
-using kelvo::test::hostPathExists;
-using kelvo::test::listDir;
-using kelvo::test::makeHostDirs;
-using kelvo::test::readHostFile;
-using kelvo::test::readZip;
-using kelvo::test::writeHostFile;
+using namespace kelvo::test;
 
 namespace {
 
 constexpr int64_t kNoLimit = 1 << 30;
-
 
 // A zip with entries named at will, as a hostile or broken one could be.
 void craftZip(const std::string& path,

@@ -15,7 +15,6 @@
 
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
-#include "LibKelvoLog.h"
 #include "SqlTypes.h"
 #include "common/TestEnv.h"
 #include "kelvod/storage/StorageTestUtil.h"
@@ -69,7 +68,6 @@ int32_t createTable(const char* table, const Columns& columns) {
 class SqlOperatorTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        mSavedDebug = kelvo::gLibLogDebugEnable.load();
         mPath = mRoot.path() + "/kelvo.db";
         kelvo::SqlOperator::setBusyTimeoutMs(kBusyMs);
         kelvo::HealthCounters::resetForTest();
@@ -78,14 +76,12 @@ protected:
     void TearDown() override {
         EXPECT_EQ(0, run(kelvo::SQL_CLOSE_CONNECTION));
         kelvo::SqlOperator::setBusyTimeoutMs(0);
-        kelvo::gLibLogDebugEnable = mSavedDebug;
     }
     static constexpr int kBusyMs = 400;
     Rows query(const std::string& sql) { return kelvo::test::DirectDb(mPath).column(sql); }
 
     kelvo::test::TempRoot mRoot;
     std::string mPath;
-    int32_t mSavedDebug = 0;
 };
 
 } // namespace
@@ -122,7 +118,6 @@ TEST_F(SqlOperatorTest, InsertBindsEveryColumnKindInOrder) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY,
                         "CREATE TABLE t(id INTEGER PRIMARY KEY, ts INTEGER, formatted_ts VARCHAR, "
                         "name VARCHAR, x INTEGER, level INTEGER, bytes INTEGER)"));
-    kelvo::gLibLogDebugEnable = 1;
     LogCapture log;
     Parcel in;
     // Kind 9 is unknown: nothing is read for it and it stays NULL.
@@ -138,12 +133,6 @@ TEST_F(SqlOperatorTest, InsertBindsEveryColumnKindInOrder) {
     }
     EXPECT_EQ(SQLITE_DONE, run(kelvo::SQL_INSERT_ENTRIES, &in));
 
-    std::vector<kelvo::test::LogLine> lines = log.linesWith("INSERT INTO");
-    ASSERT_EQ(1u, lines.size());
-    EXPECT_EQ("[SqlOperator.cpp] executeStatement# INSERT INTO t (ts, formatted_ts, name, x, "
-              "level, bytes) VALUES (?, ?, ?, ?, ?, ?);",
-              lines[0].text);
-    EXPECT_EQ(ANDROID_LOG_DEBUG, lines[0].priority);
     EXPECT_EQ(2u, log.count("Unknown data type: 9", ANDROID_LOG_ERROR));
     EXPECT_EQ((Rows{"1|1000|first||-5|" + std::to_string(bytes),
                     "2|2000|second||-6|" + std::to_string(bytes + 1)}),
