@@ -48,14 +48,8 @@ std::atomic<KelvoAgent::ExitHook> gExitHook{&_exit};
 std::mutex gInstanceLock;
 // Set once and never destroyed.
 std::atomic<android::sp<KelvoAgent>*> gInstance{nullptr};
-// Set on the thread that builds the agent, which holds gInstanceLock: an
-// error raised meanwhile would ask for the agent being built.
-thread_local bool tBuildingAgent = false;
 
 void forwardError(const android::Parcel& data) {
-    if (tBuildingAgent) {
-        return;
-    }
     android::sp<KelvoAgent>* instance = gInstance.load(std::memory_order_acquire);
     if (instance != nullptr) {
         (*instance)->logError(data);
@@ -73,11 +67,8 @@ android::sp<KelvoAgent> KelvoAgent::getInstance() {
     instance = gInstance.load(std::memory_order_relaxed);
     if (instance == nullptr) {
         // Errors raised while the agent is built reach the system log only:
-        // the sink is installed once the agent exists, and a sink already in
-        // place skips them.
-        tBuildingAgent = true;
+        // the sink is installed only once the agent exists.
         instance = new android::sp<KelvoAgent>(new KelvoAgent());
-        tBuildingAgent = false;
         gInstance.store(instance, std::memory_order_release);
         ErrorLogger::setSink(forwardError);
     }

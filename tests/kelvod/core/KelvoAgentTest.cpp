@@ -255,6 +255,8 @@ void runProcessWideAgent() {
     KelvoAgent::setHandlerFactory(0, makeHandler<0>);
     KelvoAgent::setHandlerFactory(2, makeHandler<2>);
     KelvoAgent::setRoutineFactory(kelvo::ROUTINE_HOURLY, makeRoutine<1>);
+    // Raised before the agent exists: the system log only, never stored later.
+    KLOGE("before the agent");
     sp<KelvoAgent> agent = KelvoAgent::getInstance();
     agent->initiate();
     bool ok = true;
@@ -295,6 +297,7 @@ void runProcessWideAgent() {
     agent->sendToHandler(2, 1, Parcel(), &reply, true);
     for (const std::string& e : events()) {
         check(e.find("Failed to store the error row") == std::string::npos, "forwarded: " + e);
+        check(e.find("before the agent") == std::string::npos, "stored: " + e);
     }
     _exit(ok ? 0 : 1);
 }
