@@ -362,7 +362,12 @@ int32_t StorageManager::checkHostFileSize(const std::string& dir, const std::str
     std::string path = FileUtils::join(dir, name);
     int64_t size = FileUtils::getFileSize(path.c_str());
     if (size < 0) {
-        KLOGE("Failed to get file stat: %s, error: %s", path.c_str(), strerror(errno));
+        // A database that does not exist yet (first start) is no fault.
+        if (errno == ENOENT) {
+            KLOGD("File does not exist yet: %s", path.c_str());
+        } else {
+            KLOGE("Failed to get file stat: %s, error: %s", path.c_str(), strerror(errno));
+        }
         size = 0;
     }
     KLOGD("File(%s/%s) size: %lld, threshold: %lld", dir.c_str(), name.c_str(),

@@ -36,4 +36,7 @@ rc=$?
 elapsed=$(( ($(date +%s%N) - start) / 1000000 ))
 echo "exit status $rc after ${elapsed} ms"
 [ $rc -eq 0 ] || { echo "FAIL: exit status $rc"; cat "$log"; exit 1; }
+# A first start on an empty root raises no error line.
+errors=$(grep '^kelvod E ' "$log" | grep -v 'batteryproperties\|registerListener' || true)
+[ -z "$errors" ] || { echo "FAIL: error lines on a first start:"; echo "$errors"; exit 1; }
 echo "PASS"
