@@ -675,18 +675,15 @@ TEST(ParcelObjectTest, ExceptionHeaders) {
     EXPECT_EQ(std::string("no such uid"), status.exceptionMessage().string());
 
     // A reply header is skipped; one longer than the data is malformed.
-    for (int32_t headerSize : {12, 1000}) {
-        Parcel header;
-        for (int32_t word : {static_cast<int32_t>(Status::EX_HAS_REPLY_HEADER), headerSize, -1,
-                             -1, 77}) {
-            header.writeInt32(word);
-        }
-        header.setDataPosition(0);
-        EXPECT_EQ(headerSize == 12 ? 0 : Status::EX_BAD_PARCELABLE, header.readExceptionCode());
-        if (headerSize == 12) {
-            EXPECT_EQ(77, header.readInt32());
-        }
+    const int32_t kHeader = Status::EX_HAS_REPLY_HEADER;
+    Parcel header;
+    for (int32_t word : {kHeader, 12, -1, -1, 77, kHeader, 1000, -1}) {
+        header.writeInt32(word);
     }
+    header.setDataPosition(0);
+    EXPECT_EQ(0, header.readExceptionCode());
+    EXPECT_EQ(77, header.readInt32());
+    EXPECT_EQ(Status::EX_BAD_PARCELABLE, header.readExceptionCode());
 
     // A transport failure is a status, never written.
     Parcel failed;

@@ -154,7 +154,7 @@ TEST_F(BinderTransactionTest, ObjectsInParcelsKeepTheirIdentity) {
     EXPECT_EQ(android::UNEXPECTED_NULL, mProxy->transact(kelvo::test::kCallBack, nullCall, &reply));
 }
 
-TEST_F(BinderTransactionTest, PoolThreadsServeCallsConcurrently) {
+TEST_F(BinderTransactionTest, TwoWayCallsAreServedAtOnceOneWayCallsInOrderOneAtATime) {
     // Each call waits inside until three are inside: a pool that served one
     // at a time would never get there.
     constexpr int kCalls = 3;
@@ -175,9 +175,7 @@ TEST_F(BinderTransactionTest, PoolThreadsServeCallsConcurrently) {
         t.join();
     }
     EXPECT_EQ(kCalls, reached.load());
-}
 
-TEST_F(BinderTransactionTest, OnewayCallsArriveInOrderOneAtATime) {
     constexpr int kCount = 200;
     for (int i = 0; i < kCount; ++i) {
         Parcel data;
