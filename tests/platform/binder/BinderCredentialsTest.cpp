@@ -90,21 +90,16 @@ protected:
     std::shared_ptr<kelvo::PlatformState> mState = std::make_shared<kelvo::PlatformState>();
 };
 
-TEST_F(BinderCredentialsTest, CallerIdentityIsTheKernelsNotTheCallersWord) {
+TEST_F(BinderCredentialsTest, TheKernelsCallerIdentityIsCheckedWithThePermissionService) {
     if (getuid() != 0) {
         GTEST_SKIP() << "needs root to call as another uid";
     }
-    // The service sees the child's real pid and uid.
+    // The service sees the child's real pid and uid, not the uid 0 it claims.
     EXPECT_EQ(0, callAsApp("test.who", kelvo::test::kWhoCalls, false, [](const Parcel& reply) {
         int32_t pid = reply.readInt32();
         return pid == getpid() && reply.readInt32() == static_cast<int32_t>(kAppUid) ? 0 : 13;
     }));
-}
-
-TEST_F(BinderCredentialsTest, PermissionIsAskedOfThePermissionServiceAndCached) {
-    if (getuid() != 0) {
-        GTEST_SKIP() << "needs root to call as another uid";
-    }
+    // Permissions are asked of the permission service, and cached.
     EXPECT_EQ(0, appAllowed(false));
     EXPECT_EQ(1, asked());
     mState->grant(kDump, kAppUid, true);

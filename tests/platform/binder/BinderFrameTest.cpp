@@ -130,26 +130,31 @@ protected:
         ASSERT_EQ(android::NO_ERROR, android::defaultServiceManager()->addService(
                                          String16("test.frames"), new kelvo::test::TestService()));
         mPath = kelvo::ServiceControl::socketDir() + "/test.frames";
+        mProxy = android::defaultServiceManager()->getService(String16("test.frames"));
+        ASSERT_NE(nullptr, mProxy);
     }
     void TearDown() override { kelvo::ServiceControl::stopService(String16("test.frames")); }
 
     // Connects and reads the server's hello.
-    std::unique_ptr<RawClient> open() {
+    std::unique_ptr<RawClient> open(Bytes* hello = nullptr) {
         auto client = std::make_unique<RawClient>(mPath);
         EXPECT_TRUE(client->connected());
-        Bytes hello = client->read(32);
-        EXPECT_EQ(32u, hello.size());
+        Bytes got = client->read(32);
+        EXPECT_EQ(32u, got.size());
+        if (hello != nullptr) {
+            *hello = got;
+        }
         return client;
     }
 
     kelvo::test::TempRoot mRoot;
     std::string mPath;
+    sp<android::IBinder> mProxy;
 };
 
 TEST_F(BinderFrameTest, HandWrittenFramesFollowTheWireFormat) {
-    auto client = std::make_unique<RawClient>(mPath);
-    ASSERT_TRUE(client->connected());
-    Bytes hello = client->read(32);
+    Bytes hello;
+    auto client = open(&hello);
     ASSERT_EQ(32u, hello.size());
     EXPECT_EQ(kMagic, field(hello, 0));
     EXPECT_EQ(3, hello[4]);  // kind: hello
@@ -175,10 +180,6 @@ TEST_F(BinderFrameTest, HandWrittenFramesFollowTheWireFormat) {
 }
 
 TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
-    sp<android::IBinder> proxy =
-        android::defaultServiceManager()->getService(String16("test.frames"));
-    ASSERT_NE(nullptr, proxy);
-
     Bytes slotData(16, 0);
     const uint32_t binderSlot = 0x4b424e44;
     memcpy(slotData.data(), &binderSlot, 4);
@@ -218,7 +219,7 @@ TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
         EXPECT_TRUE(client->closedByServer());
         // The service goes on for everybody else.
         int32_t answer = 0;
-        EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 1, &answer));
+        EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(mProxy, 1, &answer));
         EXPECT_EQ(2, answer);
     }
 
@@ -238,17 +239,14 @@ TEST_F(BinderFrameTest, MalformedFramesCloseOnlyTheirConnection) {
 }
 
 TEST_F(BinderFrameTest, StalledFrameIsDroppedAfterTheFrameTimeOut) {
-    sp<android::IBinder> proxy =
-        android::defaultServiceManager()->getService(String16("test.frames"));
-    ASSERT_NE(nullptr, proxy);
     auto client = open();
     Bytes half = frame(echoData(1), {});
     half.resize(20);
     ASSERT_TRUE(client->send(half));
     // Meanwhile others are served.
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 1));
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(mProxy, 1));
     EXPECT_TRUE(client->closedByServer(30000));
-    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(proxy, 2));
+    EXPECT_EQ(android::NO_ERROR, kelvo::test::echo(mProxy, 2));
 }
 
 } // namespace

@@ -37,6 +37,20 @@ enum : uint32_t {
     kSameObject,  // -> this very service
 };
 
+// Sends kEcho and returns the status; *out gets the answer.
+inline android::status_t echo(const android::sp<android::IBinder>& binder, int32_t n,
+                              int32_t* out = nullptr) {
+    android::Parcel data;
+    android::Parcel reply;
+    data.writeInt32(n);
+    data.writeString16(android::String16("ping"));
+    android::status_t err = binder->transact(kEcho, data, &reply);
+    if (err == android::NO_ERROR && out != nullptr) {
+        *out = reply.readInt32();
+    }
+    return err;
+}
+
 constexpr char16_t kTestDescriptor[] = u"kelvo.test.ITestService";
 
 class TestService : public android::BBinder {
@@ -103,19 +117,12 @@ protected:
             case kCallBack: {
                 android::sp<android::IBinder> other;
                 android::status_t err = data.readStrongBinder(&other);
-                if (err != NO_ERROR) {
-                    return err;
+                int32_t answer = 0;
+                if (err == NO_ERROR) {
+                    err = echo(other, data.readInt32(), &answer);
                 }
-                android::Parcel out;
-                android::Parcel in;
-                out.writeInt32(data.readInt32());
-                out.writeString16(android::String16("back"));
-                err = other->transact(kEcho, out, &in);
-                if (err != NO_ERROR) {
-                    return err;
-                }
-                reply->writeInt32(in.readInt32());
-                return NO_ERROR;
+                reply->writeInt32(answer);
+                return err;
             }
             case kWriteFd: {
                 int fd = data.readFileDescriptor();
@@ -163,20 +170,6 @@ private:
     std::thread::id mThread;
     android::wp<android::IBinder> mWho;
 };
-
-// Sends kEcho and returns the status; *out gets the answer.
-inline android::status_t echo(const android::sp<android::IBinder>& binder, int32_t n,
-                              int32_t* out = nullptr) {
-    android::Parcel data;
-    android::Parcel reply;
-    data.writeInt32(n);
-    data.writeString16(android::String16("ping"));
-    android::status_t err = binder->transact(kEcho, data, &reply);
-    if (err == android::NO_ERROR && out != nullptr) {
-        *out = reply.readInt32();
-    }
-    return err;
-}
 
 // Serves a TestService under name from a forked child until it is killed.
 inline pid_t forkService(const char* name) {
