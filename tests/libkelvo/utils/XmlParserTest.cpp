@@ -1,10 +1,6 @@
 #include <gtest/gtest.h>
 
-#include <fstream>
-#include <sstream>
-
 #include <binder/Parcel.h>
-#include <utils/String8.h>
 
 #include "KelvoLibEntry.h"
 #include "common/TestEnv.h"
@@ -12,7 +8,6 @@
 #include "utils/XmlParser.h"
 
 using android::Parcel;
-using android::String8;
 using kelvo::config_parameter;
 using kelvo::XmlParser;
 using namespace kelvo::test;
@@ -60,30 +55,11 @@ constexpr const char* kTestXml = R"(<?xml version="1.0"?>
 )";
 
 Bytes ints(std::initializer_list<int32_t> values) {
-    Parcel parcel;
+    Fields f;
     for (int32_t value : values) {
-        parcel.writeInt32(value);
+        f.i32(value);
     }
-    return bytesOf(parcel);
-}
-
-void simpleRequest(Parcel* request, int32_t component) {
-    request->writeInt32(component);
-}
-
-void groupedRequest(Parcel* request, int32_t component, int32_t parameter, bool keyed) {
-    request->writeInt32(component);
-    request->writeInt32(parameter);
-    request->writeBool(keyed);
-}
-
-std::string readSource(const std::string& relative) {
-    std::string here = __FILE__;
-    std::string root = here.substr(0, here.rfind("tests/libkelvo/utils/"));
-    std::ifstream in(root + relative);
-    std::stringstream content;
-    content << in.rdbuf();
-    return content.str();
+    return f.bytes();
 }
 
 class XmlParserTest : public ::testing::Test {
@@ -96,15 +72,11 @@ protected:
         return XmlParser::getInstance()->getXmlConfig(element, request, reply);
     }
     int32_t simple(int32_t element, int32_t component, Parcel* reply) {
-        Parcel request;
-        simpleRequest(&request, component);
-        return lookup(element, request, reply);
+        return lookup(element, Fields().i32(component).parcel(), reply);
     }
     int32_t grouped(int32_t element, int32_t component, int32_t parameter, bool keyed,
                     Parcel* reply) {
-        Parcel request;
-        groupedRequest(&request, component, parameter, keyed);
-        return lookup(element, request, reply);
+        return lookup(element, Fields().i32(component).i32(parameter).flag(keyed).parcel(), reply);
     }
     // The parsed answer of a grouped lookup; fails the test on a bad reply.
     std::vector<config_parameter> groups(int32_t element, int32_t component, int32_t parameter,
@@ -128,16 +100,12 @@ TEST_F(XmlParserTest, SimpleAndTextRepliesHoldOneEntryPerParameter) {
     EXPECT_EQ(0u, reply.dataPosition());
 
     // The daemon's entry answers the same way.
-    Parcel request;
-    simpleRequest(&request, 0);
-    ASSERT_EQ(0, kelvo::getXmlConfig(kelvo::CONFIG_COMPONENT_POLICY, request, &reply));
+    ASSERT_EQ(0, kelvo::getXmlConfig(kelvo::CONFIG_COMPONENT_POLICY, Fields().i32(0).parcel(),
+                                     &reply));
     EXPECT_EQ(ints({2}), bytesOf(reply));
 
     ASSERT_EQ(0, simple(1000, 0, &reply));
-    Parcel texts;
-    texts.writeString8(String8("v1.2"));
-    texts.writeString8(String8("second text"));
-    EXPECT_EQ(bytesOf(texts), bytesOf(reply));
+    EXPECT_EQ(Fields().str("v1.2").str("second text").bytes(), bytesOf(reply));
     EXPECT_EQ(0u, reply.dataPosition());
     // No parameter: an empty text list; a parameter without text: failure.
     EXPECT_EQ(0, simple(1000, 1, &reply));
@@ -226,14 +194,14 @@ TEST_F(XmlParserTest, RefusedLookupsLeaveAnEmptyReply) {
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(testing::Message() << c.element << " " << c.log);
-        Parcel request;
+        Fields request;
         for (int32_t value : c.request) {
-            request.writeInt32(value);
+            request.i32(value);
         }
         Parcel reply;
         mLog.clear();
-        EXPECT_EQ(c.ret, c.entry ? kelvo::getXmlConfig(c.element, request, &reply)
-                                 : lookup(c.element, request, &reply));
+        EXPECT_EQ(c.ret, c.entry ? kelvo::getXmlConfig(c.element, request.parcel(), &reply)
+                                 : lookup(c.element, request.parcel(), &reply));
         if (c.ret == 0) {
             EXPECT_EQ(0u, reply.dataSize());
         }
@@ -241,9 +209,7 @@ TEST_F(XmlParserTest, RefusedLookupsLeaveAnEmptyReply) {
             EXPECT_EQ(1u, mLog.count(c.log));
         }
     }
-    Parcel request;
-    simpleRequest(&request, 0);
-    EXPECT_EQ(-1, kelvo::getXmlConfig(1000, request, nullptr));
+    EXPECT_EQ(-1, kelvo::getXmlConfig(1000, Fields().i32(0).parcel(), nullptr));
 }
 
 TEST_F(XmlParserTest, IdsThatAreNotIntegersFailTheLookup) {
@@ -279,11 +245,9 @@ TEST_F(XmlParserTest, CutOrEmptyGroupedRepliesReadAsFailures) {
     }
     // Another mark than 1 ends a parameter's values, as the thresholds'
     // readers have it.
-    Parcel marked;
-    for (int32_t value : {4, 1, 60, 0, 5, 1, 30, -1, -1}) {
-        marked.writeInt32(value);
-    }
-    ASSERT_EQ(0, XmlParser::readGroupedReply(marked, false, &parameters));
+    Fields marked;
+    marked.i32(4).i32(1).i32(60).i32(0).i32(5).i32(1).i32(30).i32(-1).i32(-1);
+    ASSERT_EQ(0, XmlParser::readGroupedReply(marked.parcel(), false, &parameters));
     ASSERT_EQ(2u, parameters.size());
     EXPECT_EQ(60, parameters[0].values[0].value);
     EXPECT_EQ(5, parameters[1].id);
@@ -331,7 +295,9 @@ TEST_F(XmlParserTest, UnusableFirstFileGivesWayToTheLocatedOne) {
 // The sample answers every request the library and the daemon make, with
 // the shape each reader needs, and without one error line.
 TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
-    std::string sample = readSource("config/tv_kelvo_config.xml");
+    std::string here = __FILE__;
+    std::string sample = readHostFile(here.substr(0, here.rfind("tests/libkelvo/utils/")) +
+                                      "config/tv_kelvo_config.xml");
     ASSERT_FALSE(sample.empty());
     mRoot.writeFile(kDataPath, sample);
     struct Request {
