@@ -5,13 +5,10 @@
 #include <vector>
 
 #include "HealthCounters.h"
-#include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/KelvoStorage.h"
-#include "storage/SchemaTable.h"
-#include "utils/KelvoUtils.h"
 #include "utils/SqlOperator.h"
 
 using android::Parcel;
@@ -29,12 +26,6 @@ const column_attribute kScreenColumns[] = {
 const table_attribute kScreenState = {"1.0", 1, 2, kScreenColumns, "raw_screen_state"};
 const table_attribute kScreenStateV11 = {"1.1", 1, 2, kScreenColumns, "raw_screen_state"};
 const table_attribute kScreenStateV110 = {"1.10", 1, 2, kScreenColumns, "raw_screen_state"};
-
-const column_attribute kMixedColumns[] = {
-        {kelvo::COLUMN_TEXT, "name"},
-        {kelvo::COLUMN_LONG, "energy"},
-};
-const table_attribute kMixed = {"2.0", 1, 2, kMixedColumns, "hourly_component_test"};
 
 // The head of an insert parcel of one row: table name and columns.
 void writeHead(Parcel* p, const table_attribute& table) {
@@ -174,7 +165,11 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
     };
     const Step steps[] = {
         {&kScreenState, nullptr, "BUILD.A", true},
-        {&kScreenStateV11, nullptr, "BUILD.A", false},
+        // A rebuild drops tables, not indexes or SQLite's own tables.
+        {&kScreenStateV11,
+         "CREATE INDEX idx_state ON raw_screen_state(state); CREATE TABLE legacy(id INTEGER "
+         "PRIMARY KEY AUTOINCREMENT, v TEXT); INSERT INTO legacy(v) VALUES ('x')",
+         "BUILD.A", false},
         {&kScreenStateV110, nullptr, "BUILD.A", false}, // "1.1" is not "1.10"
         // One version row missing, though every present row matches.
         {&kScreenStateV110, "DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'",
@@ -199,7 +194,10 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
             ASSERT_EQ(SQLITE_OK, DirectDb(dbPath()).exec(step.sql));
         }
         kelvo::HostProperties::setForTest("ro.build.display.id", step.build);
+        // A rebuild (backup, zip, drop, create) outlasts a synchronous send.
+        kelvo::HandlerThread::setSyncTimeoutMs(1);
         start({step.screen, &kAbout});
+        kelvo::HandlerThread::setSyncTimeoutMs(0);
         rebuilds += step.kept ? 0 : 1;
         EXPECT_EQ(step.kept ? 1 : 0, countThroughStorage(mStorage.get()));
         // One zipped backup per rebuild.
@@ -208,34 +206,15 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
     EXPECT_TRUE(log.contains("schema mismatch, duplicate records", ANDROID_LOG_ERROR));
     EXPECT_TRUE(log.contains("Software version: BUILD.A, current is BUILD.B", ANDROID_LOG_INFO));
     // One version row for each table and one for the version table itself.
+    DirectDb db(dbPath());
     EXPECT_EQ((std::vector<std::string>{"about_kelvo_daemon|1.0", "raw_screen_state|1.10",
                                         "schema_version|1.0"}),
-              DirectDb(dbPath()).column("SELECT module, version FROM schema_version ORDER BY "
-                                        "module"));
+              db.column("SELECT module, version FROM schema_version ORDER BY module"));
+    EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
+                                                    "'legacy'"));
     struct stat st = {};
     ASSERT_EQ(0, stat(dbPath().c_str(), &st));
     EXPECT_EQ(0664u, st.st_mode & 0777);
-}
-
-TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
-    start({&kScreenState});
-    stop();
-    {
-        DirectDb db(dbPath());
-        ASSERT_EQ(SQLITE_OK, db.exec("CREATE INDEX idx_state ON raw_screen_state(state)"));
-        ASSERT_EQ(SQLITE_OK,
-                  db.exec("CREATE TABLE legacy(id INTEGER PRIMARY KEY AUTOINCREMENT, v TEXT)"));
-        ASSERT_EQ(SQLITE_OK, db.exec("INSERT INTO legacy(v) VALUES ('x')"));
-    }
-    // The rebuild (backup, zip, drop, create) outlasts a synchronous send.
-    kelvo::HandlerThread::setSyncTimeoutMs(1);
-    start({&kScreenStateV11});
-    kelvo::HandlerThread::setSyncTimeoutMs(0);
-    DirectDb db(dbPath());
-    EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
-                                                    "'legacy'"));
-    EXPECT_EQ(std::vector<std::string>{"1.1"},
-              db.column("SELECT version FROM schema_version WHERE module = 'raw_screen_state'"));
 }
 
 TEST_F(KelvoStorageTest, FlushPeriodComesFromItsPropertyAndRunsAfterAKeptStart) {

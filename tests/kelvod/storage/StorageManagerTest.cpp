@@ -241,35 +241,6 @@ TEST_F(StorageManagerTest, SizeLimitsDependOnUserType) {
     EXPECT_TRUE(mLog.contains("Invalid file type: 7", ANDROID_LOG_ERROR));
 }
 
-TEST_F(StorageManagerTest, FailedZipKeepsCopiesForTheNextZip) {
-    // Incompressible content, so that the zip must outgrow the file size
-    // limit set once the copy is written (root ignores file modes).
-    std::mt19937 random(42);
-    std::string payload(256 * 1024, '\0');
-    for (char& c : payload) {
-        c = static_cast<char>(random());
-    }
-    writeHostFile(mLive, payload);
-    struct rlimit saved = {};
-    ASSERT_EQ(0, getrlimit(RLIMIT_FSIZE, &saved));
-    sighandler_t oldHandler = signal(SIGXFSZ, SIG_IGN);
-    mCopier.mAfterCopy = [&saved] {
-        struct rlimit small = saved;
-        small.rlim_cur = 16384;
-        setrlimit(RLIMIT_FSIZE, &small);
-    };
-    int32_t ret = mManager.cleanDatabase(kFirstDay);
-    setrlimit(RLIMIT_FSIZE, &saved);
-    signal(SIGXFSZ, oldHandler);
-    mCopier.mAfterCopy = nullptr;
-
-    EXPECT_NE(0, ret);
-    EXPECT_TRUE(mLog.contains("Failed to zip file", ANDROID_LOG_ERROR));
-    EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
-    // The next clean zips it with its own copy, as with a moved database.
-    EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
-}
-
 TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     setUserType(3);
     StorageManager::setDailyUploadHook(recordUpload);
@@ -417,7 +388,37 @@ TEST_F(StorageManagerTest, RemoteDebugCaptureFollowsSessionAndUserType) {
     EXPECT_EQ(-3, mManager.remoteDebug(9, String8()));
 }
 
-TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
+// Copies left in the backup folder (a failed zip's, a database moved aside)
+// go into the next zip.
+TEST_F(StorageManagerTest, CopiesLeftInBackupGoIntoTheNextZip) {
+    // A failed zip keeps its copy. Incompressible content, so that the zip
+    // must outgrow the file size limit set once the copy is written (root
+    // ignores file modes).
+    std::mt19937 random(42);
+    std::string payload(256 * 1024, '\0');
+    for (char& c : payload) {
+        c = static_cast<char>(random());
+    }
+    writeHostFile(mLive, payload);
+    struct rlimit saved = {};
+    ASSERT_EQ(0, getrlimit(RLIMIT_FSIZE, &saved));
+    sighandler_t oldHandler = signal(SIGXFSZ, SIG_IGN);
+    mCopier.mAfterCopy = [&saved] {
+        struct rlimit small = saved;
+        small.rlim_cur = 16384;
+        setrlimit(RLIMIT_FSIZE, &small);
+    };
+    int32_t ret = mManager.cleanDatabase(kFirstDay);
+    setrlimit(RLIMIT_FSIZE, &saved);
+    signal(SIGXFSZ, oldHandler);
+    mCopier.mAfterCopy = nullptr;
+
+    EXPECT_NE(0, ret);
+    EXPECT_TRUE(mLog.contains("Failed to zip file", ANDROID_LOG_ERROR));
+    EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
+    EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
+
+    // A database moved aside takes its journal files along.
     const char* suffixes[] = {"-journal", "-wal", "-shm"};
     writeHostFile(mLive, "moved database");
     for (const char* suffix : suffixes) {
@@ -429,6 +430,8 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
     std::vector<std::string> copies = listDir(mBackup, "kelvo-[0-9]+\\.db");
     ASSERT_EQ(1u, copies.size());
     std::string moved = copies[0];
+    // The move zips the copies already there first.
+    EXPECT_EQ(payload, readZip(backupZips()[0])[copyName(kFirstDay)]);
     EXPECT_EQ("moved database", readHostFile(mBackup + "/" + moved));
     for (const char* suffix : suffixes) {
         EXPECT_EQ(std::string("old") + suffix, readHostFile(mBackup + "/" + moved + suffix));
@@ -436,10 +439,10 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
 
     // The next clean (a rebuild's or the day's) zips the set with its copy.
     writeHostFile(mLive, "rebuilt database");
-    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
+    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + kDayMs));
     std::map<std::string, std::string> entries = readZip(backupZips()[0]);
     EXPECT_EQ(5u, entries.size());
-    EXPECT_EQ("rebuilt database", entries[copyName(kFirstDay)]);
+    EXPECT_EQ("rebuilt database", entries[copyName(kFirstDay + kDayMs)]);
     EXPECT_EQ("moved database", entries[moved]);
     EXPECT_EQ("old-wal", entries[moved + "-wal"]);
     EXPECT_FALSE(hostPathExists(mBackup + "/" + moved + "-journal"));

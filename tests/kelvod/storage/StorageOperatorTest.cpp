@@ -107,8 +107,7 @@ TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
     insertForeground({{200, "buffered"}}, false);
     // The buffered old row survives a clean queued right after it.
     EXPECT_EQ(0, StorageOperator::cleanObsoleteEntries("raw_foreground", 500, "timestamp"));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
+    EXPECT_EQ(std::vector<std::string>{"buffered"}, rows("SELECT name FROM raw_foreground"));
 
     // A delete flushes first, so buffered rows are subject to it.
     insertForeground({{300, "more"}}, false);
@@ -116,8 +115,7 @@ TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
     EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
 
     EXPECT_EQ(0, StorageOperator::cleanAllEntries("raw_foreground"));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground"));
+    EXPECT_EQ(std::vector<std::string>{"0"}, rows("SELECT COUNT(*) FROM raw_foreground"));
 }
 
 // Query results come back in their shape and are copied into hourly tables.
@@ -139,10 +137,9 @@ TEST_F(StorageOperatorTest, QueriesCheckTheirShapeAndFillHourlyTables) {
                                  "GROUP BY name ORDER BY name"),
                          &sums, 3, count));
     EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, sums, 3600000));
-    StorageOperator::forceFlushEntries();
     EXPECT_EQ((std::vector<std::string>{"3600000 a 2 3000", "3600000 b 1 3000"}),
-              db().column("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
-                          "hourly_test ORDER BY name"));
+              rows("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
+                   "hourly_test ORDER BY name"));
 
     LogCapture log;
     Parcel mismatch;
@@ -172,8 +169,7 @@ TEST_F(StorageOperatorTest, QueriesCheckTheirShapeAndFillHourlyTables) {
     truncated.writeInt64(1);
     truncated.writeInt64(2);
     EXPECT_EQ(-9, StorageOperator::logSimpleQueryResult(kHourly, truncated, 7200000));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(2, db().scalar("SELECT COUNT(*) FROM hourly_test"));
+    EXPECT_EQ(std::vector<std::string>{"2"}, rows("SELECT COUNT(*) FROM hourly_test"));
 }
 
 // An update replaces the row of its key, even when its delete timed out.

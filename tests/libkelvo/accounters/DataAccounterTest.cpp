@@ -73,6 +73,8 @@ TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
               listener->mReplies[0].bytes);
 }
 
+// Reason 0 ends the records at one time and starts them again; reason 1 ends
+// them and starts them later, the time between belonging to no record.
 TEST_F(DataAccounterTest, BalanceReasons) {
     auto listener = listenTo(kSole);
     ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
@@ -81,16 +83,23 @@ TEST_F(DataAccounterTest, BalanceReasons) {
     EXPECT_TRUE(mLog.contains("Unknown balance reason: 2", ANDROID_LOG_ERROR));
     EXPECT_TRUE(listener->mReplies.empty());
 
-    // Reason 0: one time ends the records and starts them again.
     EXPECT_EQ(0, balanceAt(kSole, 100));
-    // Reason 1: an end and a later new start.
     EXPECT_EQ(0, Fields(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(300).i64(1000).send());
     EXPECT_EQ(-1, Fields(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1100).send());
-    ASSERT_EQ(2u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 100, "a", screenOnBackground(100, 100)),
-              listener->mReplies[0].bytes);
-    EXPECT_EQ(elementReply(0, 100, 300, "a", screenOnBackground(200, 200)),
-              listener->mReplies[1].bytes);
+    ASSERT_EQ(0, deactivate(kSole, 0, 2000, "a"));
+    // Accounted up to 4000 already; a balance at 3500 does not move back.
+    ASSERT_EQ(0, activate(kSole, 0, 3000, "a"));
+    ASSERT_EQ(0, setPower(kSole, 0, 4000, 1000));
+    ASSERT_EQ(0, balanceAt(kSole, 3500));
+    ASSERT_EQ(0, deactivate(kSole, 0, 5000, "a"));
+    EXPECT_EQ((std::vector<Bytes>{
+                  elementReply(0, 0, 100, "a", screenOnBackground(100, 100)),
+                  elementReply(0, 100, 300, "a", screenOnBackground(200, 200)),
+                  elementReply(0, 1000, 2000, "a", screenOnBackground(1000, 1000)),
+                  elementReply(0, 3000, 3500, "a", screenOnBackground(1000, 1000)),
+                  elementReply(0, 3500, 5000, "a", screenOnBackground(1000, 1000)),
+              }),
+              replyBytes(*listener));
 }
 
 // A refused record stops no balance, a failed removal no removal of all.

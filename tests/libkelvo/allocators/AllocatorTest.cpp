@@ -88,27 +88,6 @@ TEST_F(AllocatorTest, BucketsFollowForegroundScreenAndCharger) {
     EXPECT_EQ(elementReply(0, 0, 15000, "com.a:service", expected), listener->mReplies[0].bytes);
 }
 
-TEST_F(AllocatorTest, BalanceGapStaysUnaccounted) {
-    auto listener = listenTo(kSole);
-    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
-    ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
-    ASSERT_EQ(0, Fields(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1000).i64(1500).send());
-    ASSERT_EQ(0, deactivate(kSole, 0, 2000, "a"));
-    // Accounted up to 4000 already; a balance at 3500 does not move back.
-    ASSERT_EQ(0, activate(kSole, 0, 3000, "a"));
-    ASSERT_EQ(0, setPower(kSole, 0, 4000, 1000));
-    ASSERT_EQ(0, balanceAt(kSole, 3500));
-    ASSERT_EQ(0, deactivate(kSole, 0, 5000, "a"));
-    // 1000-1500 belongs to no record.
-    EXPECT_EQ((std::vector<Bytes>{
-                  elementReply(0, 0, 1000, "a", screenOnBackground(1000, 1000)),
-                  elementReply(0, 1500, 2000, "a", screenOnBackground(500, 500)),
-                  elementReply(0, 3000, 3500, "a", screenOnBackground(1000, 1000)),
-                  elementReply(0, 3500, 5000, "a", screenOnBackground(1000, 1000)),
-              }),
-              replyBytes(*listener));
-}
-
 TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
     auto listener = listenTo(kShared);
     ASSERT_EQ(0, setPower(kShared, 3, 0, 1000));

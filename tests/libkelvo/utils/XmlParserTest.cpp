@@ -253,7 +253,9 @@ TEST_F(XmlParserTest, CutOrEmptyGroupedRepliesReadAsFailures) {
     EXPECT_EQ(5, parameters[1].id);
 }
 
-TEST_F(XmlParserTest, WithoutAnyFileEveryLookupFails) {
+// Without a usable file every lookup fails; an unusable first file gives way
+// to the located one.
+TEST_F(XmlParserTest, LookupsNeedAUsableFile) {
     Parcel reply;
     for (int32_t element : {0, 1, 2, 3, 4, 1000}) {
         EXPECT_EQ(-1, simple(element, 0, &reply)) << element;
@@ -261,16 +263,13 @@ TEST_F(XmlParserTest, WithoutAnyFileEveryLookupFails) {
     }
     EXPECT_EQ(1u, mLog.count("[XmlParser.cpp] XmlParser# Failed to get configuration file"));
     EXPECT_TRUE(mLog.contains("Invalid root element", ANDROID_LOG_ERROR));
-}
 
-TEST_F(XmlParserTest, UnusableFirstFileGivesWayToTheLocatedOne) {
     mRoot.writeFile(kVendorPath,
                     "<c><element id=\"4\"><component id=\"0\">"
                     "<parameter>1</parameter></component></element></c>");
     for (const char* first : {"<c><element id=\"4\">", "<?xml version=\"1.0\"?><!-- none -->"}) {
         XmlParser::resetInstance();
         mRoot.writeFile(kDataPath, first);
-        Parcel reply;
         ASSERT_EQ(0, simple(4, 0, &reply)) << first;
         EXPECT_EQ(ints({1}), bytesOf(reply));
     }
@@ -280,7 +279,6 @@ TEST_F(XmlParserTest, UnusableFirstFileGivesWayToTheLocatedOne) {
     // A located file that is broken too leaves the parser without data.
     XmlParser::resetInstance();
     mRoot.writeFile(kVendorPath, "<c>");
-    Parcel reply;
     EXPECT_EQ(-1, simple(4, 0, &reply));
     EXPECT_EQ(1u, mLog.count("Failed to open xml file, running without configuration"));
 
@@ -312,7 +310,8 @@ TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
         {0, kelvo::PROFILE_CPU, -1, false, 3}, {0, kelvo::PROFILE_CAMERA, -1, true, 4},
         {0, kelvo::PROFILE_GPU, -1, true, 1}, {0, kelvo::PROFILE_MODEM, -1, true, 6},
         {0, kelvo::PROFILE_AUDIO, -1, true, 2}, {0, kelvo::PROFILE_DPM, -1, false, 33},
-        {1, 0, -1, false, 10}, {1000, 0, -2, false, 0},
+        {1, 0, -1, false, 10}, {1000, 0, -2, false, 0}, {3, 0, -2, false, 0},
+        {3, 1, -2, false, 0}, {4, 0, -2, false, 0},
     };
     for (int32_t p = 0; p <= 4; ++p) {
         requests.push_back({0, kelvo::PROFILE_WIFI, p, p == 1 || p == 2 || p == 4, 1});
@@ -324,9 +323,6 @@ TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
     for (int32_t component = 0; component < 6; ++component) {
         requests.push_back({2, component, -2, false, 0});
     }
-    requests.push_back({3, 0, -2, false, 0});
-    requests.push_back({3, 1, -2, false, 0});
-    requests.push_back({4, 0, -2, false, 0});
     for (const Request& r : requests) {
         SCOPED_TRACE(testing::Message() << r.element << "/" << r.component << "/" << r.parameter);
         Parcel reply;
