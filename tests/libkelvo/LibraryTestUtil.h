@@ -254,6 +254,16 @@ inline Bytes componentReply(int32_t prefix, int64_t start, int64_t end, const Bu
 inline Buckets screenOnBackground(int64_t usage, int64_t energy) {
     return Buckets().set(BUCKET_BACKGROUND, usage, energy).set(BUCKET_SCREEN_ON, usage, energy);
 }
+inline Buckets screenOnForeground(int64_t usage, int64_t energy) {
+    return Buckets().set(BUCKET_FOREGROUND, usage, energy).set(BUCKET_SCREEN_ON, usage, energy);
+}
+// Two states of one record, bucket by bucket.
+inline Buckets operator+(Buckets a, const Buckets& b) {
+    for (int32_t i = 0; i < BUCKET_COUNT; ++i) {
+        a.set(i, a.usage[i] + b.usage[i], a.energy[i] + b.energy[i]);
+    }
+    return a;
+}
 
 // The bytes of the listener's replies from index `from` on.
 inline std::vector<Bytes> replyBytes(const RecordingListener& listener, size_t from = 0) {

@@ -196,10 +196,13 @@ TEST_F(StorageManagerTest, ListingKeepsWholeNamesOfCopiesAndZipsOnly) {
     EXPECT_EQ("not ours", readHostFile(outside));
     EXPECT_EQ(12u, mLog.count("Error file(" + mBackup + "/", ANDROID_LOG_ERROR));
 
-    // A stray file is gone after the next daily clean too.
+    // A stray file is gone after the next daily clean too, and so is a zip
+    // whose age has no successor (it must not wrap round).
     writeHostFile(mBackup + "/notes.txt", "stray");
+    writeHostFile(mBackup + "/kelvo-12-2147483647.zip", "x");
     ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
     EXPECT_FALSE(hostPathExists(mBackup + "/notes.txt"));
+    EXPECT_EQ(std::vector<std::string>{"kelvo-12-4.zip"}, listDir(mBackup, "kelvo-12-.*"));
 
     // A missing directory lists as empty; a file in its place cannot be listed.
     EXPECT_EQ(0, StorageManager::getValidFileList("/data/none", &list));
@@ -271,7 +274,7 @@ TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     EXPECT_TRUE(mLog.contains("No need to upload database: 1", ANDROID_LOG_INFO));
 }
 
-TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
+TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDayBelowDataLog) {
     runDailyCleans(3);
     struct Case {
         const char* extra;
@@ -308,11 +311,9 @@ TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
     dir = collectDir("/data/log/failed");
     EXPECT_NE(0, mManager.samplingUpload(String8("/data/log/failed"), String8("day=0")));
     EXPECT_TRUE(hostPathExists(dir + "/903"));
-    EXPECT_EQ(-5, mManager.samplingUpload(String8(""), String8("day=0")));
-}
 
-TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
-    runDailyCleans(1);
+
+    // Collection folders lie below /data/log, outside the daemon's own.
     std::vector<std::string> backupBefore = listDir(mBackup);
     std::string outside = mTemp.path() + "/outside";
     makeHostDirs(outside);
@@ -320,7 +321,7 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
     ASSERT_EQ(0, symlink(outside.c_str(), RootPath::resolve("/data/log/escape").c_str()));
     makeHostDirs(RootPath::resolve("/data/elsewhere"));
 
-    for (const char* path : {"../evil.db", "data/log/x", "/data/log/../../evil",
+    for (const char* path : {"", "../evil.db", "data/log/x", "/data/log/../../evil",
                              "/data/log/../elsewhere", "/data/log/escape", "/data/elsewhere",
                              "/data/log", "/data/log/kelvo", "/data/log/kelvo/backup"}) {
         SCOPED_TRACE(path);
@@ -334,7 +335,7 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
     std::string victim = mTemp.path() + "/victim";
     writeHostFile(victim, "not ours");
     ASSERT_EQ(0, chmod(victim.c_str(), 0600));
-    std::string dir = collectDir("/data/log/linked");
+    dir = collectDir("/data/log/linked");
     ASSERT_EQ(0, link(victim.c_str(), (dir + "/903").c_str()));
     EXPECT_EQ(-14, mManager.samplingUpload(String8("/data/log/linked"), String8("day=0")));
     struct stat st = {};
@@ -452,29 +453,4 @@ TEST_F(StorageManagerTest, CopiesLeftInBackupGoIntoTheNextZip) {
     writeHostFile(mLive + "-wal", "stale");
     EXPECT_EQ(-2, mManager.moveDatabase());
     EXPECT_FALSE(hostPathExists(mLive + "-wal"));
-}
-
-TEST(StorageManagerNameTest, BackupNamesComeFromTheBaseNameOnly) {
-    LogCapture log;
-    struct Case {
-        const char* path;
-        int64_t time;
-        int32_t ret;
-        const char* name;
-    };
-    const Case cases[] = {
-        {"/a-b/c-d/kelvo-42-5.zip", 0, 0, "kelvo-42-6.zip"},
-        {"/tmp/my.db/notes", 1, -5, ""},
-        {"/tmp/my-root/-3.zip", 1, -5, ""},
-        {"/tmp/x/kelvo-42-x.zip", 1, -2, ""},
-        {"/tmp/x/kelvo-42-2147483647.zip", 1, -2, ""},
-    };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.path);
-        std::string name;
-        EXPECT_EQ(c.ret, StorageManager::makeBackupName(c.path, &name, c.time));
-        if (c.ret == 0) {
-            EXPECT_EQ(c.name, name);
-        }
-    }
 }

@@ -126,12 +126,9 @@ TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
     // 101 ms, energy 101: each element 101 / 4 = 25; the component's
     // foreground share 101 * 2 / 4 = 50, the background the other 51.
     ASSERT_EQ(0, balanceAt(kShared, 101));
-    Buckets fg = Buckets().set(BUCKET_FOREGROUND, 101, 25).set(BUCKET_SCREEN_ON, 101, 25);
+    Buckets fg = screenOnForeground(101, 25);
     Buckets bg = screenOnBackground(101, 25);
-    Buckets component = Buckets()
-                            .set(BUCKET_FOREGROUND, 50, 50)
-                            .set(BUCKET_BACKGROUND, 51, 51)
-                            .set(BUCKET_SCREEN_ON, 101, 101);
+    Buckets component = screenOnForeground(50, 50) + screenOnBackground(51, 51);
     EXPECT_EQ((std::vector<Bytes>{
                   elementReply(0, 0, 101, "com.fg", fg),
                   elementReply(0, 0, 101, "com.fg:remote", fg), elementReply(0, 0, 101, "com.x", bg),
@@ -163,14 +160,8 @@ TEST_F(AllocatorTest, NothingIsForegroundWithoutAForeground) {
     ASSERT_EQ(0, balanceAt(kShared, 300));
     // 0-100 and 200-300 without a foreground: all background. 100-200: com.a
     // in the foreground, half of the component's 100.
-    Buckets a = Buckets()
-                    .set(BUCKET_FOREGROUND, 100, 50)
-                    .set(BUCKET_BACKGROUND, 200, 100)
-                    .set(BUCKET_SCREEN_ON, 300, 150);
-    Buckets component = Buckets()
-                            .set(BUCKET_FOREGROUND, 50, 50)
-                            .set(BUCKET_BACKGROUND, 250, 250)
-                            .set(BUCKET_SCREEN_ON, 300, 300);
+    Buckets a = screenOnForeground(100, 50) + screenOnBackground(200, 100);
+    Buckets component = screenOnForeground(50, 50) + screenOnBackground(250, 250);
     EXPECT_EQ((std::vector<Bytes>{elementReply(0, 0, 300, "com.a", a),
                                   elementReply(0, 0, 300, "com.b", screenOnBackground(300, 150)),
                                   componentReply(0, 0, 300, component)}),
@@ -239,10 +230,7 @@ TEST_F(AllocatorTest, TrafficBatchesAreBoundedByCountAndData) {
 
     ASSERT_EQ(0, balanceAt(kTraffic, 5000));
     // Prefix 1 and the count, then the records.
-    Buckets a = Buckets()
-                    .set(BUCKET_FOREGROUND, 2000, 1000)
-                    .set(BUCKET_BACKGROUND, 1000, 500)
-                    .set(BUCKET_SCREEN_ON, 3000, 1500);
+    Buckets a = screenOnForeground(2000, 1000) + screenOnBackground(1000, 500);
     ASSERT_EQ(1u, listener->mReplies.size());
     Fields expected;
     trafficRecord(expected.i32(1).i32(3), 0, 5000, "com.a", a);
@@ -290,8 +278,7 @@ TEST_F(AllocatorTest, WeightSplitsByCpuTime) {
     EXPECT_EQ(LIBRARY_EVENT_COMPONENT, listener->mReplies[0].event);
     EXPECT_EQ(cpuComponent(1, 333), listener->mReplies[0].bytes);
     Fields applications;
-    cpuRecord(applications, 10010, "com.fg",
-              Buckets().set(BUCKET_FOREGROUND, 1, 333).set(BUCKET_SCREEN_ON, 1, 333));
+    cpuRecord(applications, 10010, "com.fg", screenOnForeground(1, 333));
     cpuRecord(applications, 10020, "com.bg", screenOnBackground(2, 667));
     EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[1].event);
     EXPECT_EQ(applications.bytes(), listener->mReplies[1].bytes);

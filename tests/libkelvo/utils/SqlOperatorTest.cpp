@@ -86,6 +86,7 @@ protected:
 
 } // namespace
 
+// Tables are created as defined; text that holds a second statement is refused.
 TEST_F(SqlOperatorTest, CreateTableWritesTheExactDefinition) {
     ASSERT_EQ(0, createTable("raw_screen_state", {{"id", kelvo::COLUMN_ID},
                                                   {"timestamp", kelvo::COLUMN_TIME},
@@ -112,6 +113,22 @@ TEST_F(SqlOperatorTest, CreateTableWritesTheExactDefinition) {
         EXPECT_EQ(-1, run(kelvo::SQL_CREATE_TABLE, &in)) << columns;
     }
     EXPECT_EQ(Rows{"2"}, query("SELECT count(*) FROM sqlite_master"));
+
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE x(v INTEGER)"));
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO x (v) VALUES (1), (2), (3);"));
+    log.clear();
+    kelvo::HealthCounters::resetForTest();
+    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, "SELECT 1; DROP TABLE x"));
+    Parcel reply;
+    EXPECT_EQ(-1, runSql(kelvo::SQL_SIMPLE_QUERY, "SELECT v FROM x; DROP TABLE x;", &reply));
+    EXPECT_EQ(0u, reply.dataSize());
+    EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
+    EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
+    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
+    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
+    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
+    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 2"));
+    EXPECT_EQ(Rows{"3"}, query("SELECT v FROM x"));
 }
 
 // Time columns also get the local second as text.
@@ -192,24 +209,6 @@ TEST_F(SqlOperatorTest, InsertTakesWholeParcelsUpToTheRowLimit) {
     EXPECT_EQ(Rows{std::to_string(3 + kelvo::kMaxInsertRows)}, query("SELECT count(*) FROM t"));
 }
 
-TEST_F(SqlOperatorTest, StatementsWithASecondStatementAreRefused) {
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE x(v INTEGER)"));
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO x (v) VALUES (1), (2), (3);"));
-    LogCapture log;
-    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, "SELECT 1; DROP TABLE x"));
-    Parcel reply;
-    EXPECT_EQ(-1, runSql(kelvo::SQL_SIMPLE_QUERY, "SELECT v FROM x; DROP TABLE x;", &reply));
-    EXPECT_EQ(0u, reply.dataSize());
-    EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
-    EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
-    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
-    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
-
-    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
-    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 2"));
-    EXPECT_EQ(Rows{"3"}, query("SELECT v FROM x"));
-}
-
 TEST_F(SqlOperatorTest, QueryReplyHasOneValuePerColumn) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY,
                         "CREATE TABLE q(i INTEGER, s VARCHAR, r REAL, b BLOB, tail INTEGER)"));
@@ -248,8 +247,36 @@ TEST_F(SqlOperatorTest, QueryReplyHasOneValuePerColumn) {
     EXPECT_EQ(5, partial.readInt64());
 }
 
-TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
+// A backup copy is whole or absent; the connection opens once and only on a
+// file.
+TEST_F(SqlOperatorTest, BackupCopyAndConnection) {
     LogCapture log;
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
+    const std::string copy = mRoot.path() + "/copy.db";
+    ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
+    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
+
+    const std::string unreachable = mRoot.path() + "/missing/copy.db";
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, unreachable));
+    EXPECT_NE(0, access(unreachable.c_str(), F_OK));
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, ""));
+    EXPECT_TRUE(log.contains("Invalid backup copy file name", ANDROID_LOG_ERROR));
+
+    // The source stays locked past the busy time-out: the new file goes.
+    const std::string blocked = mRoot.path() + "/blocked.db";
+    kelvo::test::DirectDb locker(mPath);
+    ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
+    EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
+    EXPECT_NE(0, access(blocked.c_str(), F_OK));
+    ASSERT_EQ(SQLITE_OK, locker.exec("COMMIT;"));
+
+    // A file that was there before is not the copy's to remove.
+    mRoot.writeFile("/foreign.db", "somebody's file\n");
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
+    EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
+
     EXPECT_EQ(-1, runPath(kelvo::SQL_OPEN_CONNECTION, mRoot.path() + "/other.db"));
     EXPECT_TRUE(log.contains("Database connection already opened", ANDROID_LOG_ERROR));
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE still_open(v INTEGER)"));
@@ -271,7 +298,7 @@ TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
     EXPECT_TRUE(log.contains("Error: file is not a database(" + mRoot.path() + "/garbage.db)"));
     // A failed open leaves no connection behind.
     ASSERT_EQ(0, runPath(kelvo::SQL_OPEN_CONNECTION, mPath));
-    EXPECT_EQ(Rows{"still_open"}, query("SELECT name FROM sqlite_master"));
+    EXPECT_EQ((Rows{"still_open", "t"}), query("SELECT name FROM sqlite_master ORDER BY name"));
     EXPECT_NE(0, access((mRoot.path() + "/other.db").c_str(), F_OK));
 }
 
@@ -312,35 +339,6 @@ TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4)"));
     release.join();
     EXPECT_EQ(Rows{"4"}, query("SELECT v FROM t"));
-}
-
-TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
-    const std::string copy = mRoot.path() + "/copy.db";
-    ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
-    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
-
-    LogCapture log;
-    const std::string unreachable = mRoot.path() + "/missing/copy.db";
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, unreachable));
-    EXPECT_NE(0, access(unreachable.c_str(), F_OK));
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, ""));
-    EXPECT_TRUE(log.contains("Invalid backup copy file name", ANDROID_LOG_ERROR));
-
-    // The source stays locked past the busy time-out: the new file goes.
-    const std::string blocked = mRoot.path() + "/blocked.db";
-    kelvo::test::DirectDb locker(mPath);
-    ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
-    EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
-    EXPECT_NE(0, access(blocked.c_str(), F_OK));
-    ASSERT_EQ(SQLITE_OK, locker.exec("COMMIT;"));
-
-    // A file that was there before is not the copy's to remove.
-    mRoot.writeFile("/foreign.db", "somebody's file\n");
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
-    EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
 }
 
 TEST_F(SqlOperatorTest, AFullStatementCacheKeepsTheStatementInUse) {
