@@ -42,8 +42,8 @@ TEST_F(KelvoLibAgentTest, AccountersAreCreatedOnceOnFirstUse) {
     EXPECT_EQ(1, created.load());
     // The same accounter kept its element.
     ASSERT_EQ(0, deactivate(ACCOUNTER_GPU, 0, 5, "a"));
-    ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 5, "a", screenOnBackground(5, 5)), listener->mReplies[0].bytes);
+    EXPECT_EQ(std::vector<Bytes>{elementReply(0, 0, 5, "a", screenOnBackground(5, 5))},
+              replyBytes(*listener));
 }
 
 TEST_F(KelvoLibAgentTest, OneListenerPerAccounterOfAKnownType) {
@@ -74,6 +74,9 @@ TEST_F(KelvoLibAgentTest, OneListenerPerAccounterOfAKnownType) {
     ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
     EXPECT_EQ(-1, deactivate(kSole, 0, 20, "a"));
     EXPECT_TRUE(mLog.contains("Invalid listener", ANDROID_LOG_ERROR));
+    // The element is gone all the same.
+    ASSERT_EQ(0, registerLibraryListener(kSole, second));
+    EXPECT_EQ(0, balanceAt(kSole, 30));
     EXPECT_EQ(1u, second->mReplies.size());
 }
 

@@ -67,10 +67,9 @@ TEST_F(DataAccounterTest, StateBeforeAnyAllocatorIsKept) {
     ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 0, 0, "com.game"));
     ASSERT_EQ(0, Fields(kSole, ACTION_DEACTIVATE).i32(0).i64(40).str("com.game").send());
-    ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 40, "com.game",
-                           Buckets().set(BUCKET_FOREGROUND, 40, 40).set(BUCKET_SCREEN_OFF, 40, 40)),
-              listener->mReplies[0].bytes);
+    Buckets offInFront = Buckets().set(BUCKET_FOREGROUND, 40, 40).set(BUCKET_SCREEN_OFF, 40, 40);
+    EXPECT_EQ(std::vector<Bytes>{elementReply(0, 0, 40, "com.game", offInFront)},
+              replyBytes(*listener));
 }
 
 // Reason 0 ends the records at one time and starts them again; reason 1 ends
@@ -144,19 +143,6 @@ TEST_F(DataAccounterTest, AKeyWithoutAllocatorStandsInNobodysWay) {
     Buckets off = Buckets().set(BUCKET_BACKGROUND, 40, 40).set(BUCKET_SCREEN_OFF, 40, 40);
     EXPECT_EQ(std::vector<Bytes>{elementReply(1, 0, 100, "a", screenOnBackground(60, 60) + off)},
               replyBytes(*listener));
-}
-
-TEST_F(DataAccounterTest, RecordsWithoutListenerAreDropped) {
-    ASSERT_EQ(0, setPower(kShared, 0, 0, 1000));
-    ASSERT_EQ(0, activate(kShared, 0, 0, "a"));
-    EXPECT_EQ(-1, balanceAt(kShared, 10));
-    EXPECT_EQ(-1, deactivate(kShared, 0, 20, "a"));
-    // The element and component record of the balance, then of the removal.
-    EXPECT_EQ(4u, mLog.count("Invalid listener", ANDROID_LOG_ERROR));
-    // The element is gone all the same.
-    auto listener = listenTo(kShared);
-    EXPECT_EQ(0, balanceAt(kShared, 30));
-    EXPECT_TRUE(listener->mReplies.empty());
 }
 
 } // namespace

@@ -186,12 +186,11 @@ TEST_F(AllocatorTest, EnergiesKeepTheirSignAndSensorsTheirScale) {
     ASSERT_EQ(0, setPower(kSensor, 1, 0, 50));
     ASSERT_EQ(0, activate(kSensor, 1, 0, "com.step|walk"));
     ASSERT_EQ(0, deactivate(kSensor, 1, 3600000, "com.step|walk"));
-    ASSERT_EQ(2u, sensorListener->mReplies.size());
-    EXPECT_EQ(elementReply(1, 0, 3600000, "com.step|walk", screenOnBackground(3600000, 18000)),
-              sensorListener->mReplies[0].bytes);
+    Buckets hour = screenOnBackground(3600000, 18000);
+    EXPECT_EQ((std::vector<Bytes>{elementReply(1, 0, 3600000, "com.step|walk", hour),
+                                  componentReply(1, 0, 3600000, hour)}),
+              replyBytes(*sensorListener));
     EXPECT_EQ(LIBRARY_EVENT_COMPONENT, sensorListener->mReplies[1].event);
-    EXPECT_EQ(componentReply(1, 0, 3600000, screenOnBackground(3600000, 18000)),
-              sensorListener->mReplies[1].bytes);
 }
 
 // A traffic record in a balance reply: int64 usage per bucket.

@@ -3,6 +3,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <string>
@@ -13,6 +14,7 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "ErrorLogger.h"
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "SqlTypes.h"
@@ -85,6 +87,32 @@ protected:
 };
 
 } // namespace
+
+// The entry refuses unknown actions and missing parcels; library errors stay
+// out of the daemon's error table.
+TEST_F(SqlOperatorTest, UnknownActionsAndMissingParcelsAreRefused) {
+    static std::atomic<int> stored{0};
+    stored = 0;
+    kelvo::ErrorLogger::setSink([](const Parcel&) { stored++; });
+    LogCapture log;
+    EXPECT_EQ(-1, run(10));
+    EXPECT_EQ(-1, run(-1));
+    EXPECT_EQ(1u, log.count("[KelvoLibAgent.cpp] doSqliteOperation# Unknown action: 10",
+                            ANDROID_LOG_ERROR));
+    EXPECT_TRUE(log.contains("Unknown action: -1", ANDROID_LOG_ERROR));
+    for (int32_t action :
+         {kelvo::SQL_OPEN_CONNECTION, kelvo::SQL_CREATE_TABLE, kelvo::SQL_INSERT_ENTRIES,
+          kelvo::SQL_EXECUTE_ENTRY, kelvo::SQL_SIMPLE_QUERY, kelvo::SQL_BACKUP_COPY}) {
+        EXPECT_EQ(-1, run(action)) << action;
+    }
+    Parcel query;
+    query.writeString8(String8("SELECT 1"));
+    EXPECT_EQ(-1, run(kelvo::SQL_SIMPLE_QUERY, &query));
+    EXPECT_EQ(7u, log.count("Invalid parameter", ANDROID_LOG_ERROR));
+    EXPECT_EQ(9u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
+    EXPECT_EQ(0, stored.load());
+    kelvo::ErrorLogger::setSink(nullptr);
+}
 
 // Tables are created as defined; text that holds a second statement is refused.
 TEST_F(SqlOperatorTest, CreateTableWritesTheExactDefinition) {
