@@ -25,15 +25,6 @@ protected:
     LogCapture mLog;
 };
 
-TEST_F(KelvoLibAgentTest, ListenersNeedAnAccounterType) {
-    for (int32_t type : {12, -1}) {
-        EXPECT_EQ(-1, registerLibraryListener(type, new RecordingListener()));
-        EXPECT_EQ(-1, unregisterLibraryListener(type));
-    }
-    EXPECT_EQ(-1, registerLibraryListener(kSole, nullptr));
-    EXPECT_TRUE(mLog.contains("[KelvoLibAgent.cpp] registerListener# Invalid parameter"));
-}
-
 TEST_F(KelvoLibAgentTest, AccountersAreCreatedOnceOnFirstUse) {
     std::atomic<int> created{0};
     KelvoLibAgent::getInstance()->setAccounterFactoryForTest(ACCOUNTER_GPU, [&created] {
@@ -51,18 +42,24 @@ TEST_F(KelvoLibAgentTest, AccountersAreCreatedOnceOnFirstUse) {
     EXPECT_EQ(1, created.load());
     // The same accounter kept its element.
     ASSERT_EQ(0, deactivate(ACCOUNTER_GPU, 0, 5, "a"));
-    ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 5, "a", screenOnBackground(5, 5)), listener->mReplies[0].bytes);
+    EXPECT_EQ(std::vector<Bytes>{elementReply(0, 0, 5, "a", screenOnBackground(5, 5))},
+              replyBytes(*listener));
 }
 
-TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
+TEST_F(KelvoLibAgentTest, OneListenerPerAccounterOfAKnownType) {
+    for (int32_t type : {12, -1}) {
+        EXPECT_EQ(-1, registerLibraryListener(type, new RecordingListener()));
+        EXPECT_EQ(-1, unregisterLibraryListener(type));
+    }
+    EXPECT_EQ(-1, registerLibraryListener(kSole, nullptr));
+    EXPECT_TRUE(mLog.contains("[KelvoLibAgent.cpp] registerListener# Invalid parameter"));
     sp<RecordingListener> first = listenTo(kSole);
     sp<RecordingListener> second = listenTo(kSole);
     sp<RecordingListener> other = listenTo(kShared);
     ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
     ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
     // The parcel is read from its start whatever its position.
-    Action removal(kSole, ACTION_DEACTIVATE);
+    Fields removal(kSole, ACTION_DEACTIVATE);
     removal.i32(0).i64(10).str("a");
     removal.parcel().setDataPosition(removal.parcel().dataSize());
     ASSERT_EQ(0, removal.send());
@@ -77,6 +74,9 @@ TEST_F(KelvoLibAgentTest, OneListenerPerAccounter) {
     ASSERT_EQ(0, activate(kSole, 0, 10, "a"));
     EXPECT_EQ(-1, deactivate(kSole, 0, 20, "a"));
     EXPECT_TRUE(mLog.contains("Invalid listener", ANDROID_LOG_ERROR));
+    // The element is gone all the same.
+    ASSERT_EQ(0, registerLibraryListener(kSole, second));
+    EXPECT_EQ(0, balanceAt(kSole, 30));
     EXPECT_EQ(1u, second->mReplies.size());
 }
 

@@ -188,50 +188,6 @@ private:
     int32_t mRefusedPrefix = 0;
 };
 
-// An action parcel: int32 type, int32 action, then the fields added.
-class Action {
-public:
-    Action(int32_t type, int32_t action) : mParcel(std::make_unique<android::Parcel>()) {
-        mParcel->writeInt32(type);
-        mParcel->writeInt32(action);
-    }
-    Action& i32(int32_t v) {
-        mParcel->writeInt32(v);
-        return *this;
-    }
-    Action& i64(int64_t v) {
-        mParcel->writeInt64(v);
-        return *this;
-    }
-    Action& str(const char* v) {
-        mParcel->writeString8(android::String8(v));
-        return *this;
-    }
-    Action& flag(bool v) {
-        mParcel->writeBool(v);
-        return *this;
-    }
-    int32_t send() const { return setDataAccounter(*mParcel); }
-    const android::Parcel& parcel() const { return *mParcel; }
-
-private:
-    std::unique_ptr<android::Parcel> mParcel; // parcels do not copy; actions move
-};
-
-// The actions of the keyed test accounters.
-inline int32_t setPower(int32_t type, int32_t key, int64_t time, int32_t power) {
-    return Action(type, ACTION_SET_VALUE).i32(key).i64(time).i32(power).send();
-}
-inline int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
-    return Action(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
-}
-inline int32_t deactivate(int32_t type, int32_t key, int64_t time, const char* name) {
-    return Action(type, ACTION_DEACTIVATE).i32(key).i64(time).str(name).send();
-}
-inline int32_t balanceAt(int32_t type, int64_t time) {
-    return Action(type, ACTION_BALANCE).i32(BALANCE_AT).i64(time).send();
-}
-
 // The six buckets of an expected record; usage in the unit of the record.
 struct Buckets {
     int64_t usage[BUCKET_COUNT] = {};
@@ -243,37 +199,70 @@ struct Buckets {
     }
 };
 
-// Expected replies of timed allocators (int32 usage per bucket).
-inline void writeBuckets(android::Parcel& p, const Buckets& b) {
-    for (int32_t i = 0; i < BUCKET_COUNT; ++i) {
-        p.writeInt32(static_cast<int32_t>(b.usage[i]));
-        p.writeInt64(b.energy[i]);
+// A parcel written field by field: an action (int32 type, int32 action, then
+// its fields) or an expected reply.
+class Fields {
+public:
+    Fields() : mParcel(std::make_unique<android::Parcel>()) {}
+    Fields(int32_t type, int32_t action) : Fields() { i32(type).i32(action); }
+    Fields& i32(int32_t v) { return put(mParcel->writeInt32(v)); }
+    Fields& i64(int64_t v) { return put(mParcel->writeInt64(v)); }
+    Fields& str(const char* v) { return put(mParcel->writeString8(android::String8(v))); }
+    Fields& flag(bool v) { return put(mParcel->writeBool(v)); }
+    // Usage and energy per bucket; usage is int32 in timed records, int64
+    // in traffic records.
+    Fields& buckets(const Buckets& b, bool wideUsage = false) {
+        for (int32_t i = 0; i < BUCKET_COUNT; ++i) {
+            wideUsage ? i64(b.usage[i]) : i32(static_cast<int32_t>(b.usage[i]));
+            i64(b.energy[i]);
+        }
+        return *this;
     }
+    int32_t send() const { return setDataAccounter(*mParcel); }
+    const android::Parcel& parcel() const { return *mParcel; }
+    Bytes bytes() const { return bytesOf(*mParcel); }
+
+private:
+    Fields& put(android::status_t) { return *this; }
+    std::unique_ptr<android::Parcel> mParcel; // parcels do not copy; builders move
+};
+
+// The actions of the keyed test accounters.
+inline int32_t setPower(int32_t type, int32_t key, int64_t time, int32_t power) {
+    return Fields(type, ACTION_SET_VALUE).i32(key).i64(time).i32(power).send();
+}
+inline int32_t activate(int32_t type, int32_t key, int64_t time, const char* name) {
+    return Fields(type, ACTION_ACTIVATE).i32(key).i64(time).str(name).send();
+}
+inline int32_t deactivate(int32_t type, int32_t key, int64_t time, const char* name) {
+    return Fields(type, ACTION_DEACTIVATE).i32(key).i64(time).str(name).send();
+}
+inline int32_t balanceAt(int32_t type, int64_t time) {
+    return Fields(type, ACTION_BALANCE).i32(BALANCE_AT).i64(time).send();
 }
 
+// Expected replies of timed allocators: an element's record names it.
 inline Bytes elementReply(int32_t prefix, int64_t start, int64_t end, const char* name,
                           const Buckets& b) {
-    android::Parcel p;
-    p.writeInt32(prefix);
-    p.writeInt64(start);
-    p.writeInt64(end);
-    p.writeString8(android::String8(name));
-    writeBuckets(p, b);
-    return bytesOf(p);
+    return Fields().i32(prefix).i64(start).i64(end).str(name).buckets(b).bytes();
 }
-
 inline Bytes componentReply(int32_t prefix, int64_t start, int64_t end, const Buckets& b) {
-    android::Parcel p;
-    p.writeInt32(prefix);
-    p.writeInt64(start);
-    p.writeInt64(end);
-    writeBuckets(p, b);
-    return bytesOf(p);
+    return Fields().i32(prefix).i64(start).i64(end).buckets(b).bytes();
 }
 
 // Discharging with the screen on, no foreground: background and screen_on.
 inline Buckets screenOnBackground(int64_t usage, int64_t energy) {
     return Buckets().set(BUCKET_BACKGROUND, usage, energy).set(BUCKET_SCREEN_ON, usage, energy);
+}
+inline Buckets screenOnForeground(int64_t usage, int64_t energy) {
+    return Buckets().set(BUCKET_FOREGROUND, usage, energy).set(BUCKET_SCREEN_ON, usage, energy);
+}
+// Two states of one record, bucket by bucket.
+inline Buckets operator+(Buckets a, const Buckets& b) {
+    for (int32_t i = 0; i < BUCKET_COUNT; ++i) {
+        a.set(i, a.usage[i] + b.usage[i], a.energy[i] + b.energy[i]);
+    }
+    return a;
 }
 
 // The bytes of the listener's replies from index `from` on.

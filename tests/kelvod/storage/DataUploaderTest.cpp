@@ -74,17 +74,6 @@ TEST_F(DataUploaderTest, NestedClassesArraysAndTextsArriveIntact) {
     EXPECT_EQ(mLiveBefore, ZendrelHost::liveObjects());
 }
 
-TEST_F(DataUploaderTest, NothingIsAddedToAnEventNobodyStarted) {
-    Parcel p;
-    DataUploader::formIntData(0, 1, p);
-    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, p, false));
-    Parcel empty;
-    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, empty, true));
-    EXPECT_EQ(0, mUploader->uploadEvent());
-    EXPECT_TRUE(events().empty());
-    EXPECT_TRUE(results().empty());
-}
-
 TEST_F(DataUploaderTest, BrokenParcelsDiscardTheEventAndNeverReadPastTheData) {
     Parcel good;
     DataUploader::formIntData(0, 1, good);
@@ -115,9 +104,17 @@ TEST_F(DataUploaderTest, BrokenParcelsDiscardTheEventAndNeverReadPastTheData) {
     unterminated.write("abcd", 4);
     EXPECT_EQ(-21, mUploader->setEventData(kelvo::EVENT_DAILY_USERS, unterminated, true));
 
+    // Nothing is added to an event nobody started, and no data starts none.
+    Parcel p;
+    DataUploader::formIntData(0, 1, p);
+    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, p, false));
+    Parcel empty;
+    EXPECT_EQ(0, mUploader->setEventData(kelvo::EVENT_DAILY_SYSTEM, empty, true));
+
     // The discarded event is gone with what it held: nothing is sent.
     EXPECT_EQ(0, mUploader->uploadEvent());
     EXPECT_TRUE(events().empty());
+    EXPECT_TRUE(results().empty());
     EXPECT_EQ(mLiveBefore, ZendrelHost::liveObjects());
 }
 

@@ -5,13 +5,10 @@
 #include <vector>
 
 #include "HealthCounters.h"
-#include "KelvoLog.h"
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/KelvoStorage.h"
-#include "storage/SchemaTable.h"
-#include "utils/KelvoUtils.h"
 #include "utils/SqlOperator.h"
 
 using android::Parcel;
@@ -29,12 +26,6 @@ const column_attribute kScreenColumns[] = {
 const table_attribute kScreenState = {"1.0", 1, 2, kScreenColumns, "raw_screen_state"};
 const table_attribute kScreenStateV11 = {"1.1", 1, 2, kScreenColumns, "raw_screen_state"};
 const table_attribute kScreenStateV110 = {"1.10", 1, 2, kScreenColumns, "raw_screen_state"};
-
-const column_attribute kMixedColumns[] = {
-        {kelvo::COLUMN_TEXT, "name"},
-        {kelvo::COLUMN_LONG, "energy"},
-};
-const table_attribute kMixed = {"2.0", 1, 2, kMixedColumns, "hourly_component_test"};
 
 // The head of an insert parcel of one row: table name and columns.
 void writeHead(Parcel* p, const table_attribute& table) {
@@ -128,7 +119,7 @@ protected:
 
 } // namespace
 
-TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlush) {
+TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlushThatCommits) {
     start({&kScreenState});
     for (int i = 0; i < 300; ++i) {
         insertScreenRow(mStorage.get(), 1000 + i, i % 2);
@@ -143,9 +134,26 @@ TEST_F(KelvoStorageTest, InsertsStayBufferedUntilTheLimitOrAFlush) {
     EXPECT_EQ(0, mStorage->flushAllEntries());
     EXPECT_EQ(302, countThroughStorage(mStorage.get()));
 
-    DirectDb db(dbPath());
-    EXPECT_EQ(1, db.scalar("SELECT COUNT(*) FROM raw_screen_state WHERE timestamp = 5000 AND "
-                           "state = 1"));
+    EXPECT_EQ(1, DirectDb(dbPath()).scalar("SELECT COUNT(*) FROM raw_screen_state WHERE "
+                                           "timestamp = 5000 AND state = 1"));
+
+    // A failed commit does not poison later flushes.
+    insertScreenRow(mStorage.get(), 7000, 1);
+    {
+        // Another connection reads inside a transaction through the whole
+        // flush: the insert gets its write lock, the commit never does.
+        DirectDb other(dbPath());
+        ASSERT_EQ(SQLITE_OK, other.exec("BEGIN"));
+        ASSERT_EQ(302, other.scalar("SELECT COUNT(*) FROM raw_screen_state"));
+        EXPECT_EQ(-17, mStorage->flushAllEntries());
+        other.exec("COMMIT");
+    }
+    EXPECT_EQ(1u, HealthCounters::get(Health::FlushRowsAbandoned));
+    insertScreenRow(mStorage.get(), 8000, 0);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    insertScreenRow(mStorage.get(), 9000, 0);
+    EXPECT_EQ(0, mStorage->flushAllEntries());
+    EXPECT_EQ(304, countThroughStorage(mStorage.get()));
 }
 
 TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
@@ -157,7 +165,11 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
     };
     const Step steps[] = {
         {&kScreenState, nullptr, "BUILD.A", true},
-        {&kScreenStateV11, nullptr, "BUILD.A", false},
+        // A rebuild drops tables, not indexes or SQLite's own tables.
+        {&kScreenStateV11,
+         "CREATE INDEX idx_state ON raw_screen_state(state); CREATE TABLE legacy(id INTEGER "
+         "PRIMARY KEY AUTOINCREMENT, v TEXT); INSERT INTO legacy(v) VALUES ('x')",
+         "BUILD.A", false},
         {&kScreenStateV110, nullptr, "BUILD.A", false}, // "1.1" is not "1.10"
         // One version row missing, though every present row matches.
         {&kScreenStateV110, "DELETE FROM schema_version WHERE module = 'about_kelvo_daemon'",
@@ -182,7 +194,10 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
             ASSERT_EQ(SQLITE_OK, DirectDb(dbPath()).exec(step.sql));
         }
         kelvo::HostProperties::setForTest("ro.build.display.id", step.build);
+        // A rebuild (backup, zip, drop, create) outlasts a synchronous send.
+        kelvo::HandlerThread::setSyncTimeoutMs(1);
         start({step.screen, &kAbout});
+        kelvo::HandlerThread::setSyncTimeoutMs(0);
         rebuilds += step.kept ? 0 : 1;
         EXPECT_EQ(step.kept ? 1 : 0, countThroughStorage(mStorage.get()));
         // One zipped backup per rebuild.
@@ -191,34 +206,15 @@ TEST_F(KelvoStorageTest, KeepsAMatchingDatabaseAndRebuildsOnAnyDifference) {
     EXPECT_TRUE(log.contains("schema mismatch, duplicate records", ANDROID_LOG_ERROR));
     EXPECT_TRUE(log.contains("Software version: BUILD.A, current is BUILD.B", ANDROID_LOG_INFO));
     // One version row for each table and one for the version table itself.
+    DirectDb db(dbPath());
     EXPECT_EQ((std::vector<std::string>{"about_kelvo_daemon|1.0", "raw_screen_state|1.10",
                                         "schema_version|1.0"}),
-              DirectDb(dbPath()).column("SELECT module, version FROM schema_version ORDER BY "
-                                        "module"));
+              db.column("SELECT module, version FROM schema_version ORDER BY module"));
+    EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
+                                                    "'legacy'"));
     struct stat st = {};
     ASSERT_EQ(0, stat(dbPath().c_str(), &st));
     EXPECT_EQ(0664u, st.st_mode & 0777);
-}
-
-TEST_F(KelvoStorageTest, RebuildDropsTablesButNotIndexesOrSqliteOwnTables) {
-    start({&kScreenState});
-    stop();
-    {
-        DirectDb db(dbPath());
-        ASSERT_EQ(SQLITE_OK, db.exec("CREATE INDEX idx_state ON raw_screen_state(state)"));
-        ASSERT_EQ(SQLITE_OK,
-                  db.exec("CREATE TABLE legacy(id INTEGER PRIMARY KEY AUTOINCREMENT, v TEXT)"));
-        ASSERT_EQ(SQLITE_OK, db.exec("INSERT INTO legacy(v) VALUES ('x')"));
-    }
-    // The rebuild (backup, zip, drop, create) outlasts a synchronous send.
-    kelvo::HandlerThread::setSyncTimeoutMs(1);
-    start({&kScreenStateV11});
-    kelvo::HandlerThread::setSyncTimeoutMs(0);
-    DirectDb db(dbPath());
-    EXPECT_EQ(std::vector<std::string>{}, db.column("SELECT name FROM sqlite_master WHERE name = "
-                                                    "'legacy'"));
-    EXPECT_EQ(std::vector<std::string>{"1.1"},
-              db.column("SELECT version FROM schema_version WHERE module = 'raw_screen_state'"));
 }
 
 TEST_F(KelvoStorageTest, FlushPeriodComesFromItsPropertyAndRunsAfterAKeptStart) {
@@ -257,27 +253,6 @@ TEST_F(KelvoStorageTest, RowsWithoutTablesWaitForThem) {
     EXPECT_EQ(0, mStorage->flushAllEntries());
     EXPECT_EQ(351, countThroughStorage(mStorage.get()));
     EXPECT_EQ(0u, HealthCounters::get(Health::FlushRowsAbandoned));
-}
-
-TEST_F(KelvoStorageTest, AFailedCommitDoesNotPoisonLaterFlushes) {
-    start({&kScreenState});
-    insertScreenRow(mStorage.get(), 1000, 1);
-    {
-        // Another connection reads inside a transaction through the whole
-        // flush: the insert gets its write lock, the commit never does.
-        DirectDb other(dbPath());
-        ASSERT_EQ(SQLITE_OK, other.exec("BEGIN"));
-        ASSERT_EQ(0, other.scalar("SELECT COUNT(*) FROM raw_screen_state"));
-        EXPECT_EQ(-17, mStorage->flushAllEntries());
-        other.exec("COMMIT");
-    }
-    EXPECT_EQ(1u, HealthCounters::get(Health::FlushRowsAbandoned));
-    insertScreenRow(mStorage.get(), 2000, 0);
-    EXPECT_EQ(0, mStorage->flushAllEntries());
-    insertScreenRow(mStorage.get(), 3000, 0);
-    EXPECT_EQ(0, mStorage->flushAllEntries());
-    DirectDb db(dbPath());
-    EXPECT_EQ(2, db.scalar("SELECT COUNT(*) FROM raw_screen_state WHERE timestamp >= 2000"));
 }
 
 TEST_F(KelvoStorageTest, UnknownRequestsAreRefused) {

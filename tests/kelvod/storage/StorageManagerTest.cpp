@@ -73,7 +73,8 @@ int32_t recordUpload(int64_t from, int64_t to) {
     return gUploadResult;
 }
 
-// Each test runs on a fresh root whose own path holds '-' ("my-root").
+// Each test runs on a fresh root whose own path holds '-' ("my-root"), so
+// that backup names come from the base name only.
 class StorageManagerTest : public ::testing::Test {
 protected:
     StorageManagerTest() : mManager(&mCopier) {}
@@ -195,10 +196,13 @@ TEST_F(StorageManagerTest, ListingKeepsWholeNamesOfCopiesAndZipsOnly) {
     EXPECT_EQ("not ours", readHostFile(outside));
     EXPECT_EQ(12u, mLog.count("Error file(" + mBackup + "/", ANDROID_LOG_ERROR));
 
-    // A stray file is gone after the next daily clean too.
+    // A stray file is gone after the next daily clean too, and so is a zip
+    // whose age has no successor (it must not wrap round).
     writeHostFile(mBackup + "/notes.txt", "stray");
+    writeHostFile(mBackup + "/kelvo-12-2147483647.zip", "x");
     ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
     EXPECT_FALSE(hostPathExists(mBackup + "/notes.txt"));
+    EXPECT_EQ(std::vector<std::string>{"kelvo-12-4.zip"}, listDir(mBackup, "kelvo-12-.*"));
 
     // A missing directory lists as empty; a file in its place cannot be listed.
     EXPECT_EQ(0, StorageManager::getValidFileList("/data/none", &list));
@@ -240,45 +244,6 @@ TEST_F(StorageManagerTest, SizeLimitsDependOnUserType) {
     EXPECT_TRUE(mLog.contains("Invalid file type: 7", ANDROID_LOG_ERROR));
 }
 
-TEST_F(StorageManagerTest, FailedZipKeepsCopiesForTheNextZip) {
-    // Incompressible content, so that the zip must outgrow the file size
-    // limit set once the copy is written (root ignores file modes).
-    std::mt19937 random(42);
-    std::string payload(256 * 1024, '\0');
-    for (char& c : payload) {
-        c = static_cast<char>(random());
-    }
-    writeHostFile(mLive, payload);
-    struct rlimit saved = {};
-    ASSERT_EQ(0, getrlimit(RLIMIT_FSIZE, &saved));
-    sighandler_t oldHandler = signal(SIGXFSZ, SIG_IGN);
-    mCopier.mAfterCopy = [&saved] {
-        struct rlimit small = saved;
-        small.rlim_cur = 16384;
-        setrlimit(RLIMIT_FSIZE, &small);
-    };
-    int32_t ret = mManager.cleanDatabase(kFirstDay);
-    setrlimit(RLIMIT_FSIZE, &saved);
-    signal(SIGXFSZ, oldHandler);
-    mCopier.mAfterCopy = nullptr;
-
-    EXPECT_NE(0, ret);
-    EXPECT_TRUE(mLog.contains("Failed to zip file", ANDROID_LOG_ERROR));
-    EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
-    EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
-
-    // The next daily clean zips it with its own copy.
-    writeHostFile(mLive, "next database");
-    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + kDayMs));
-    std::map<int, std::string> zips = backupZips();
-    ASSERT_EQ(1u, zips.size());
-    std::map<std::string, std::string> entries = readZip(zips[0]);
-    ASSERT_EQ(2u, entries.size());
-    EXPECT_EQ(payload, entries[copyName(kFirstDay)]);
-    EXPECT_EQ("next database", entries[copyName(kFirstDay + kDayMs)]);
-    EXPECT_EQ(1u, listDir(mBackup).size());
-}
-
 TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     setUserType(3);
     StorageManager::setDailyUploadHook(recordUpload);
@@ -309,7 +274,7 @@ TEST_F(StorageManagerTest, DomesticBetaUsersUploadTheDailyCopy) {
     EXPECT_TRUE(mLog.contains("No need to upload database: 1", ANDROID_LOG_INFO));
 }
 
-TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
+TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDayBelowDataLog) {
     runDailyCleans(3);
     struct Case {
         const char* extra;
@@ -346,11 +311,9 @@ TEST_F(StorageManagerTest, SamplingUploadTakesTheAskedDay) {
     dir = collectDir("/data/log/failed");
     EXPECT_NE(0, mManager.samplingUpload(String8("/data/log/failed"), String8("day=0")));
     EXPECT_TRUE(hostPathExists(dir + "/903"));
-    EXPECT_EQ(-5, mManager.samplingUpload(String8(""), String8("day=0")));
-}
 
-TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
-    runDailyCleans(1);
+
+    // Collection folders lie below /data/log, outside the daemon's own.
     std::vector<std::string> backupBefore = listDir(mBackup);
     std::string outside = mTemp.path() + "/outside";
     makeHostDirs(outside);
@@ -358,7 +321,7 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
     ASSERT_EQ(0, symlink(outside.c_str(), RootPath::resolve("/data/log/escape").c_str()));
     makeHostDirs(RootPath::resolve("/data/elsewhere"));
 
-    for (const char* path : {"../evil.db", "data/log/x", "/data/log/../../evil",
+    for (const char* path : {"", "../evil.db", "data/log/x", "/data/log/../../evil",
                              "/data/log/../elsewhere", "/data/log/escape", "/data/elsewhere",
                              "/data/log", "/data/log/kelvo", "/data/log/kelvo/backup"}) {
         SCOPED_TRACE(path);
@@ -372,7 +335,7 @@ TEST_F(StorageManagerTest, CollectionDirsMustLieBelowDataLog) {
     std::string victim = mTemp.path() + "/victim";
     writeHostFile(victim, "not ours");
     ASSERT_EQ(0, chmod(victim.c_str(), 0600));
-    std::string dir = collectDir("/data/log/linked");
+    dir = collectDir("/data/log/linked");
     ASSERT_EQ(0, link(victim.c_str(), (dir + "/903").c_str()));
     EXPECT_EQ(-14, mManager.samplingUpload(String8("/data/log/linked"), String8("day=0")));
     struct stat st = {};
@@ -426,7 +389,37 @@ TEST_F(StorageManagerTest, RemoteDebugCaptureFollowsSessionAndUserType) {
     EXPECT_EQ(-3, mManager.remoteDebug(9, String8()));
 }
 
-TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
+// Copies left in the backup folder (a failed zip's, a database moved aside)
+// go into the next zip.
+TEST_F(StorageManagerTest, CopiesLeftInBackupGoIntoTheNextZip) {
+    // A failed zip keeps its copy. Incompressible content, so that the zip
+    // must outgrow the file size limit set once the copy is written (root
+    // ignores file modes).
+    std::mt19937 random(42);
+    std::string payload(256 * 1024, '\0');
+    for (char& c : payload) {
+        c = static_cast<char>(random());
+    }
+    writeHostFile(mLive, payload);
+    struct rlimit saved = {};
+    ASSERT_EQ(0, getrlimit(RLIMIT_FSIZE, &saved));
+    sighandler_t oldHandler = signal(SIGXFSZ, SIG_IGN);
+    mCopier.mAfterCopy = [&saved] {
+        struct rlimit small = saved;
+        small.rlim_cur = 16384;
+        setrlimit(RLIMIT_FSIZE, &small);
+    };
+    int32_t ret = mManager.cleanDatabase(kFirstDay);
+    setrlimit(RLIMIT_FSIZE, &saved);
+    signal(SIGXFSZ, oldHandler);
+    mCopier.mAfterCopy = nullptr;
+
+    EXPECT_NE(0, ret);
+    EXPECT_TRUE(mLog.contains("Failed to zip file", ANDROID_LOG_ERROR));
+    EXPECT_EQ(std::vector<std::string>{copyName(kFirstDay)}, listDir(mBackup));
+    EXPECT_EQ(payload, readHostFile(mBackup + "/" + copyName(kFirstDay)));
+
+    // A database moved aside takes its journal files along.
     const char* suffixes[] = {"-journal", "-wal", "-shm"};
     writeHostFile(mLive, "moved database");
     for (const char* suffix : suffixes) {
@@ -438,6 +431,8 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
     std::vector<std::string> copies = listDir(mBackup, "kelvo-[0-9]+\\.db");
     ASSERT_EQ(1u, copies.size());
     std::string moved = copies[0];
+    // The move zips the copies already there first.
+    EXPECT_EQ(payload, readZip(backupZips()[0])[copyName(kFirstDay)]);
     EXPECT_EQ("moved database", readHostFile(mBackup + "/" + moved));
     for (const char* suffix : suffixes) {
         EXPECT_EQ(std::string("old") + suffix, readHostFile(mBackup + "/" + moved + suffix));
@@ -445,10 +440,10 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
 
     // The next clean (a rebuild's or the day's) zips the set with its copy.
     writeHostFile(mLive, "rebuilt database");
-    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay));
+    ASSERT_EQ(0, mManager.cleanDatabase(kFirstDay + kDayMs));
     std::map<std::string, std::string> entries = readZip(backupZips()[0]);
     EXPECT_EQ(5u, entries.size());
-    EXPECT_EQ("rebuilt database", entries[copyName(kFirstDay)]);
+    EXPECT_EQ("rebuilt database", entries[copyName(kFirstDay + kDayMs)]);
     EXPECT_EQ("moved database", entries[moved]);
     EXPECT_EQ("old-wal", entries[moved + "-wal"]);
     EXPECT_FALSE(hostPathExists(mBackup + "/" + moved + "-journal"));
@@ -458,31 +453,4 @@ TEST_F(StorageManagerTest, MoveDatabaseTakesItsJournalFilesAlong) {
     writeHostFile(mLive + "-wal", "stale");
     EXPECT_EQ(-2, mManager.moveDatabase());
     EXPECT_FALSE(hostPathExists(mLive + "-wal"));
-}
-
-TEST(StorageManagerNameTest, BackupNamesComeFromTheBaseNameOnly) {
-    LogCapture log;
-    struct Case {
-        const char* path;
-        int64_t time;
-        int32_t ret;
-        const char* name;
-    };
-    const Case cases[] = {
-        {"/tmp/my-root/data/log/kelvo/kelvo.db", 42, 0, "kelvo-42.db"},
-        {"/tmp/my-root/backup/kelvo-42-0.zip", 7, 0, "kelvo-42-1.zip"},
-        {"/a-b/c-d/kelvo-42-5.zip", 0, 0, "kelvo-42-6.zip"},
-        {"/tmp/my.db/notes", 1, -5, ""},
-        {"/tmp/my-root/-3.zip", 1, -5, ""},
-        {"/tmp/x/kelvo-42-x.zip", 1, -2, ""},
-        {"/tmp/x/kelvo-42-2147483647.zip", 1, -2, ""},
-    };
-    for (const Case& c : cases) {
-        SCOPED_TRACE(c.path);
-        std::string name;
-        EXPECT_EQ(c.ret, StorageManager::makeBackupName(c.path, &name, c.time));
-        if (c.ret == 0) {
-            EXPECT_EQ(c.name, name);
-        }
-    }
 }

@@ -43,6 +43,18 @@ void foregroundRow(Parcel* rows, int64_t time, const char* name) {
     rows->writeString8(String8(name));
 }
 
+// Buffers raw_foreground rows, then writes them when asked to.
+void insertForeground(std::initializer_list<std::pair<int64_t, const char*>> rows, bool flush) {
+    Parcel p;
+    for (const auto& row : rows) {
+        foregroundRow(&p, row.first, row.second);
+    }
+    StorageOperator::insertEntries(kForeground, p, static_cast<int32_t>(rows.size()), false);
+    if (flush) {
+        StorageOperator::forceFlushEntries();
+    }
+}
+
 // One about_kelvo_daemon row, replacing the row of its key.
 int32_t updateAbout(int64_t time, const char* key, const char* value) {
     Parcel row;
@@ -51,10 +63,6 @@ int32_t updateAbout(int64_t time, const char* key, const char* value) {
     row.writeString8(String8(value));
     String8 condition = String8("key = ") + kelvo::KelvoUtils::quoteSqlText(key);
     return StorageOperator::updateEntries(kAbout, row, condition.string());
-}
-
-std::vector<std::string> aboutRows(const DirectDb& db) {
-    return db.column("SELECT key, value FROM about_kelvo_daemon ORDER BY key");
 }
 
 } // namespace
@@ -84,33 +92,50 @@ TEST_F(StorageOperatorTest, InsertsBatchesWithinTheLimit) {
     prefixed.readInt32();
     EXPECT_EQ(0, StorageOperator::insertEntries(kForeground, prefixed, 1, true));
 
-    EXPECT_EQ(0, StorageOperator::forceFlushEntries());
-    EXPECT_EQ(5000, db().scalar("SELECT COUNT(*) FROM raw_foreground WHERE name = "
-                                "'com.example.many'"));
+    EXPECT_EQ((std::vector<std::string>{"com.example.after|1", "com.example.many|5000"}),
+              rows("SELECT name, COUNT(*) FROM raw_foreground GROUP BY name ORDER BY name"));
     EXPECT_EQ(std::vector<std::string>{"7"},
-              db().column("SELECT timestamp FROM raw_foreground WHERE name = "
-                          "'com.example.after'"));
-    EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground WHERE timestamp = 1000 AND "
-                             "name = 'com.example.a'"));
+              rows("SELECT timestamp FROM raw_foreground WHERE name = 'com.example.after'"));
 }
 
-TEST_F(StorageOperatorTest, QueriesCheckTheirShape) {
-    Parcel rows;
-    foregroundRow(&rows, 1000, "a");
-    foregroundRow(&rows, 2000, "b");
-    StorageOperator::insertEntries(kForeground, rows, 2, false);
-    StorageOperator::forceFlushEntries();
+TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
+    insertForeground({{100, "old"}}, true);
+    insertForeground({{200, "buffered"}}, false);
+    // The buffered old row survives a clean queued right after it.
+    EXPECT_EQ(0, StorageOperator::cleanObsoleteEntries("raw_foreground", 500, "timestamp"));
+    EXPECT_EQ(std::vector<std::string>{"buffered"}, rows("SELECT name FROM raw_foreground"));
 
+    // A delete flushes first, so buffered rows are subject to it.
+    insertForeground({{300, "more"}}, false);
+    EXPECT_EQ(0, StorageOperator::deleteEntries("raw_foreground", "timestamp >= 300"));
+    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
+
+    EXPECT_EQ(0, StorageOperator::cleanAllEntries("raw_foreground"));
+    EXPECT_EQ(std::vector<std::string>{"0"}, rows("SELECT COUNT(*) FROM raw_foreground"));
+}
+
+// Query results come back in their shape and are copied into hourly tables.
+TEST_F(StorageOperatorTest, QueriesCheckTheirShapeAndFillHourlyTables) {
+    insertForeground({{1000, "a"}, {2000, "a"}, {3000, "b"}}, true);
     Parcel reply;
     int32_t count = -1;
     ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
                          String8("SELECT timestamp, name FROM raw_foreground ORDER BY timestamp"),
                          &reply, 2, count));
-    ASSERT_EQ(2, count);
+    ASSERT_EQ(3, count);
     EXPECT_EQ(1000, reply.readInt64());
     EXPECT_STREQ("a", reply.readString8().string());
     EXPECT_EQ(2000, reply.readInt64());
-    EXPECT_STREQ("b", reply.readString8().string());
+
+    Parcel sums;
+    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
+                         String8("SELECT name, COUNT(*), SUM(timestamp) FROM raw_foreground "
+                                 "GROUP BY name ORDER BY name"),
+                         &sums, 3, count));
+    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, sums, 3600000));
+    EXPECT_EQ((std::vector<std::string>{"3600000 a 2 3000", "3600000 b 1 3000"}),
+              rows("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
+                   "hourly_test ORDER BY name"));
 
     LogCapture log;
     Parcel mismatch;
@@ -125,66 +150,8 @@ TEST_F(StorageOperatorTest, QueriesCheckTheirShape) {
     EXPECT_EQ(-5, StorageOperator::cleanObsoleteEntries("raw_foreground", 1, nullptr));
     EXPECT_EQ(-5, StorageOperator::cleanAllEntries(nullptr));
     EXPECT_EQ(6u, HealthCounters::get(Health::StorageEntryRefused));
-}
-
-TEST_F(StorageOperatorTest, UpdateReplacesTheRowOfItsKeyAndQuotesValues) {
-    for (const char* value : {"A", "B", "it's C"}) {
-        EXPECT_EQ(0, updateAbout(1000, "software_version", value));
-    }
-    // A key whose value carries a quote is still matched exactly.
-    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
-    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ((std::vector<std::string>{"o'key|v1", "software_version|it's C"}), aboutRows(db()));
-}
-
-TEST_F(StorageOperatorTest, DeletesAndCleansOnlyWhatIsOnDisk) {
-    Parcel old;
-    foregroundRow(&old, 100, "old");
-    StorageOperator::insertEntries(kForeground, old, 1, false);
-    StorageOperator::forceFlushEntries();
-    Parcel buffered;
-    foregroundRow(&buffered, 200, "buffered");
-    StorageOperator::insertEntries(kForeground, buffered, 1, false);
-    // The buffered old row survives a clean queued right after it.
-    EXPECT_EQ(0, StorageOperator::cleanObsoleteEntries("raw_foreground", 500, "timestamp"));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
-
-    // A delete flushes first, so buffered rows are subject to it.
-    Parcel more;
-    foregroundRow(&more, 300, "more");
-    StorageOperator::insertEntries(kForeground, more, 1, false);
-    EXPECT_EQ(0, StorageOperator::deleteEntries("raw_foreground", "timestamp >= 300"));
-    EXPECT_EQ(std::vector<std::string>{"buffered"}, db().column("SELECT name FROM raw_foreground"));
-
-    EXPECT_EQ(0, StorageOperator::cleanAllEntries("raw_foreground"));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(0, db().scalar("SELECT COUNT(*) FROM raw_foreground"));
-}
-
-TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
-    Parcel rows;
-    foregroundRow(&rows, 1000, "a");
-    foregroundRow(&rows, 2000, "a");
-    foregroundRow(&rows, 3000, "b");
-    StorageOperator::insertEntries(kForeground, rows, 3, false);
-    StorageOperator::forceFlushEntries();
-
-    Parcel reply;
-    int32_t count = 0;
-    ASSERT_EQ(0, StorageOperator::queryEntriesSimple(
-                         String8("SELECT name, COUNT(*), SUM(timestamp) FROM raw_foreground "
-                                 "GROUP BY name ORDER BY name"),
-                         &reply, 3, count));
-    EXPECT_EQ(0, StorageOperator::logSimpleQueryResult(kHourly, reply, 3600000));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ((std::vector<std::string>{"3600000 a 2 3000", "3600000 b 1 3000"}),
-              db().column("SELECT timestamp || ' ' || name || ' ' || count || ' ' || energy FROM "
-                          "hourly_test ORDER BY name"));
 
     // A result of the wrong shape inserts nothing.
-    LogCapture log;
     Parcel wrong;
     ASSERT_EQ(0, StorageOperator::queryEntriesSimple(String8("SELECT name FROM raw_foreground"),
                                                      &wrong, 1, count));
@@ -198,11 +165,17 @@ TEST_F(StorageOperatorTest, QueryResultsAreCopiedIntoAnHourlyTable) {
     truncated.writeInt64(1);
     truncated.writeInt64(2);
     EXPECT_EQ(-9, StorageOperator::logSimpleQueryResult(kHourly, truncated, 7200000));
-    StorageOperator::forceFlushEntries();
-    EXPECT_EQ(2, db().scalar("SELECT COUNT(*) FROM hourly_test"));
+    EXPECT_EQ(std::vector<std::string>{"2"}, rows("SELECT COUNT(*) FROM hourly_test"));
 }
 
-TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
+// An update replaces the row of its key, even when its delete timed out.
+TEST_F(StorageOperatorTest, UpdateReplacesTheRowOfItsKeyAndQuotesValues) {
+    for (const char* value : {"A", "B", "it's C"}) {
+        EXPECT_EQ(0, updateAbout(1000, "software_version", value));
+    }
+    // A key whose value carries a quote is still matched exactly.
+    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
+    EXPECT_EQ(0, updateAbout(1000, "o'key", "v1"));
     ASSERT_EQ(0, updateAbout(1000, "xml_version", "old"));
     StorageOperator::forceFlushEntries();
 
@@ -221,5 +194,6 @@ TEST_F(StorageOperatorTest, AnUpdateWhoseDeleteTimedOutStillStoresItsRow) {
 
     // The queued delete ran before the queued row: exactly the new value.
     EXPECT_EQ(0, StorageOperator::forceFlushEntries());
-    EXPECT_EQ(std::vector<std::string>{"xml_version|new"}, aboutRows(db()));
+    EXPECT_EQ((std::vector<std::string>{"o'key|v1", "software_version|it's C", "xml_version|new"}),
+              db().column("SELECT key, value FROM about_kelvo_daemon ORDER BY key"));
 }

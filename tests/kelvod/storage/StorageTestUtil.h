@@ -27,7 +27,6 @@ public:
     std::vector<std::string> column(const std::string& sql) const;
     long long scalar(const std::string& sql) const;
     int exec(const std::string& sql) const;
-    sqlite3* handle() const { return mDb; }
 
 private:
     sqlite3* mDb = nullptr;

@@ -6,14 +6,9 @@
 
 #include <stdint.h>
 
-#include <binder/Parcel.h>
-#include <utils/String8.h>
-
 #include "common/TestEnv.h"
 #include "libkelvo/LibraryTestUtil.h"
 
-using android::Parcel;
-using android::String8;
 using namespace kelvo;
 using namespace kelvo::test;
 
@@ -24,7 +19,7 @@ protected:
     LibraryFixture mLibrary;
 };
 
-TEST_F(AllocatorTest, SoleChargesTheWholeIntervalIn64Bits) {
+TEST_F(AllocatorTest, SoleChargesItsOneElementIn64Bits) {
     auto listener = listenTo(kSole);
     ASSERT_EQ(0, setPower(kSole, 0, 0, 600));
     ASSERT_EQ(0, activate(kSole, 0, 1000, "com.music"));
@@ -47,27 +42,25 @@ TEST_F(AllocatorTest, SoleChargesTheWholeIntervalIn64Bits) {
         replyBytes(*listener));
     EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[0].event);
     EXPECT_EQ(0u, listener->mPosition[0]);
-}
 
-TEST_F(AllocatorTest, SoleReplacesItsElementAndFollowsThePower) {
-    auto listener = listenTo(kSole);
-    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
-    ASSERT_EQ(0, activate(kSole, 0, 0, "A"));
+    // Key 2: B replaces A; the power changes inside the record.
+    ASSERT_EQ(0, setPower(kSole, 2, 0, 1000));
+    ASSERT_EQ(0, activate(kSole, 2, 0, "A"));
     // B takes over: A's record is dropped, no reply.
-    ASSERT_EQ(0, activate(kSole, 0, 1000, "B"));
-    EXPECT_TRUE(listener->mReplies.empty());
+    ASSERT_EQ(0, activate(kSole, 2, 1000, "B"));
+    EXPECT_EQ(3u, listener->mReplies.size());
     LogCapture log;
-    EXPECT_EQ(-1, deactivate(kSole, 0, 1500, "A"));
+    EXPECT_EQ(-1, deactivate(kSole, 2, 1500, "A"));
     EXPECT_TRUE(log.contains("Element name A is not matched with name B", ANDROID_LOG_ERROR));
     // Power 3000 from 2000 on: 1000 ms at 1000 and 1000 ms at 3000.
-    ASSERT_EQ(0, setPower(kSole, 0, 2000, 3000));
-    ASSERT_EQ(0, deactivate(kSole, 0, 3000, "B"));
-    ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 1000, 3000, "B", screenOnBackground(2000, 4000)),
-              listener->mReplies[0].bytes);
+    ASSERT_EQ(0, setPower(kSole, 2, 2000, 3000));
+    ASSERT_EQ(0, deactivate(kSole, 2, 3000, "B"));
+    ASSERT_EQ(4u, listener->mReplies.size());
+    EXPECT_EQ(elementReply(2, 1000, 3000, "B", screenOnBackground(2000, 4000)),
+              listener->mReplies[3].bytes);
     // Nothing active any more: refused without a log line.
     log.clear();
-    EXPECT_EQ(-1, deactivate(kSole, 0, 4000, "B"));
+    EXPECT_EQ(-1, deactivate(kSole, 2, 4000, "B"));
     EXPECT_FALSE(log.contains("is not matched"));
 }
 
@@ -76,10 +69,10 @@ TEST_F(AllocatorTest, BucketsFollowForegroundScreenAndCharger) {
     ASSERT_EQ(0, setPower(kSole, 0, 0, 2000));
     ASSERT_EQ(0, activate(kSole, 0, 0, "com.a:service"));
     // Each change closes the interval before it under the old state.
-    ASSERT_EQ(0, Action(kSole, ACTION_FOREGROUND).i64(1000).str("com.a").send());
-    ASSERT_EQ(0, Action(kSole, ACTION_SCREEN_STATE).i64(3000).flag(false).send());
-    ASSERT_EQ(0, Action(kSole, ACTION_CHARGER_ONLINE).i64(6000).flag(true).send());
-    ASSERT_EQ(0, Action(kSole, ACTION_FOREGROUND).i64(10000).str("com.b").send());
+    ASSERT_EQ(0, Fields(kSole, ACTION_FOREGROUND).i64(1000).str("com.a").send());
+    ASSERT_EQ(0, Fields(kSole, ACTION_SCREEN_STATE).i64(3000).flag(false).send());
+    ASSERT_EQ(0, Fields(kSole, ACTION_CHARGER_ONLINE).i64(6000).flag(true).send());
+    ASSERT_EQ(0, Fields(kSole, ACTION_FOREGROUND).i64(10000).str("com.b").send());
     ASSERT_EQ(0, deactivate(kSole, 0, 15000, "com.a:service"));
     // 0-1000 background, screen on; 1000-3000 foreground, screen on;
     // 3000-6000 foreground, screen off; 6000-10000 charging in the
@@ -95,27 +88,6 @@ TEST_F(AllocatorTest, BucketsFollowForegroundScreenAndCharger) {
     EXPECT_EQ(elementReply(0, 0, 15000, "com.a:service", expected), listener->mReplies[0].bytes);
 }
 
-TEST_F(AllocatorTest, BalanceGapStaysUnaccounted) {
-    auto listener = listenTo(kSole);
-    ASSERT_EQ(0, setPower(kSole, 0, 0, 1000));
-    ASSERT_EQ(0, activate(kSole, 0, 0, "a"));
-    ASSERT_EQ(0, Action(kSole, ACTION_BALANCE).i32(BALANCE_SPAN).i64(1000).i64(1500).send());
-    ASSERT_EQ(0, deactivate(kSole, 0, 2000, "a"));
-    // Accounted up to 4000 already; a balance at 3500 does not move back.
-    ASSERT_EQ(0, activate(kSole, 0, 3000, "a"));
-    ASSERT_EQ(0, setPower(kSole, 0, 4000, 1000));
-    ASSERT_EQ(0, balanceAt(kSole, 3500));
-    ASSERT_EQ(0, deactivate(kSole, 0, 5000, "a"));
-    // 1000-1500 belongs to no record.
-    EXPECT_EQ((std::vector<Bytes>{
-                  elementReply(0, 0, 1000, "a", screenOnBackground(1000, 1000)),
-                  elementReply(0, 1500, 2000, "a", screenOnBackground(500, 500)),
-                  elementReply(0, 3000, 3500, "a", screenOnBackground(1000, 1000)),
-                  elementReply(0, 3500, 5000, "a", screenOnBackground(1000, 1000)),
-              }),
-              replyBytes(*listener));
-}
-
 TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
     auto listener = listenTo(kShared);
     ASSERT_EQ(0, setPower(kShared, 3, 0, 1000));
@@ -126,7 +98,7 @@ TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
     ASSERT_EQ(0, balanceAt(kShared, 10));
     // b leaves at 16: 6 ms shared by three (2 each); then a and c share 4 ms.
     ASSERT_EQ(0, deactivate(kShared, 3, 16, "b"));
-    ASSERT_EQ(0, Action(kShared, ACTION_DEACTIVATE_ALL).i64(20).send());
+    ASSERT_EQ(0, Fields(kShared, ACTION_DEACTIVATE_ALL).i64(20).send());
     // No element: a balance reports nothing, not even the component.
     ASSERT_EQ(0, balanceAt(kShared, 30));
     EXPECT_EQ((std::vector<Bytes>{
@@ -147,19 +119,16 @@ TEST_F(AllocatorTest, SharedSplitsEnergyEvenly) {
 TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
     auto listener = listenTo(kShared);
     ASSERT_EQ(0, setPower(kShared, 0, 0, 1000));
-    ASSERT_EQ(0, Action(kShared, ACTION_FOREGROUND).i64(0).str("com.fg").send());
+    ASSERT_EQ(0, Fields(kShared, ACTION_FOREGROUND).i64(0).str("com.fg").send());
     for (const char* name : {"com.y", "com.fg:remote", "com.x", "com.fg"}) {
         ASSERT_EQ(0, activate(kShared, 0, 0, name));
     }
     // 101 ms, energy 101: each element 101 / 4 = 25; the component's
     // foreground share 101 * 2 / 4 = 50, the background the other 51.
     ASSERT_EQ(0, balanceAt(kShared, 101));
-    Buckets fg = Buckets().set(BUCKET_FOREGROUND, 101, 25).set(BUCKET_SCREEN_ON, 101, 25);
+    Buckets fg = screenOnForeground(101, 25);
     Buckets bg = screenOnBackground(101, 25);
-    Buckets component = Buckets()
-                            .set(BUCKET_FOREGROUND, 50, 50)
-                            .set(BUCKET_BACKGROUND, 51, 51)
-                            .set(BUCKET_SCREEN_ON, 101, 101);
+    Buckets component = screenOnForeground(50, 50) + screenOnBackground(51, 51);
     EXPECT_EQ((std::vector<Bytes>{
                   elementReply(0, 0, 101, "com.fg", fg),
                   elementReply(0, 0, 101, "com.fg:remote", fg), elementReply(0, 0, 101, "com.x", bg),
@@ -167,7 +136,7 @@ TEST_F(AllocatorTest, SharedForegroundAmongTwoOfFour) {
               replyBytes(*listener));
 
     // Charging: the same split in the charge buckets, no screen bucket.
-    ASSERT_EQ(0, Action(kShared, ACTION_CHARGER_ONLINE).i64(101).flag(true).send());
+    ASSERT_EQ(0, Fields(kShared, ACTION_CHARGER_ONLINE).i64(101).flag(true).send());
     ASSERT_EQ(0, balanceAt(kShared, 202));
     fg = Buckets().set(BUCKET_CHARGE_FOREGROUND, 101, 25);
     bg = Buckets().set(BUCKET_CHARGE_BACKGROUND, 101, 25);
@@ -186,26 +155,17 @@ TEST_F(AllocatorTest, NothingIsForegroundWithoutAForeground) {
     ASSERT_EQ(0, setPower(kShared, 0, 0, 1000));
     ASSERT_EQ(0, activate(kShared, 0, 0, "com.a"));
     ASSERT_EQ(0, activate(kShared, 0, 0, "com.b"));
-    ASSERT_EQ(0, Action(kShared, ACTION_FOREGROUND).i64(100).str("com.a").send());
-    ASSERT_EQ(0, Action(kShared, ACTION_FOREGROUND).i64(200).str("").send());
+    ASSERT_EQ(0, Fields(kShared, ACTION_FOREGROUND).i64(100).str("com.a").send());
+    ASSERT_EQ(0, Fields(kShared, ACTION_FOREGROUND).i64(200).str("").send());
     ASSERT_EQ(0, balanceAt(kShared, 300));
     // 0-100 and 200-300 without a foreground: all background. 100-200: com.a
     // in the foreground, half of the component's 100.
-    ASSERT_EQ(3u, listener->mReplies.size());
-    EXPECT_EQ(elementReply(0, 0, 300, "com.a",
-                           Buckets()
-                                   .set(BUCKET_FOREGROUND, 100, 50)
-                                   .set(BUCKET_BACKGROUND, 200, 100)
-                                   .set(BUCKET_SCREEN_ON, 300, 150)),
-              listener->mReplies[0].bytes);
-    EXPECT_EQ(elementReply(0, 0, 300, "com.b", screenOnBackground(300, 150)),
-              listener->mReplies[1].bytes);
-    EXPECT_EQ(componentReply(0, 0, 300,
-                             Buckets()
-                                     .set(BUCKET_FOREGROUND, 50, 50)
-                                     .set(BUCKET_BACKGROUND, 250, 250)
-                                     .set(BUCKET_SCREEN_ON, 300, 300)),
-              listener->mReplies[2].bytes);
+    Buckets a = screenOnForeground(100, 50) + screenOnBackground(200, 100);
+    Buckets component = screenOnForeground(50, 50) + screenOnBackground(250, 250);
+    EXPECT_EQ((std::vector<Bytes>{elementReply(0, 0, 300, "com.a", a),
+                                  elementReply(0, 0, 300, "com.b", screenOnBackground(300, 150)),
+                                  componentReply(0, 0, 300, component)}),
+              replyBytes(*listener));
 }
 
 TEST_F(AllocatorTest, EnergiesKeepTheirSignAndSensorsTheirScale) {
@@ -226,23 +186,16 @@ TEST_F(AllocatorTest, EnergiesKeepTheirSignAndSensorsTheirScale) {
     ASSERT_EQ(0, setPower(kSensor, 1, 0, 50));
     ASSERT_EQ(0, activate(kSensor, 1, 0, "com.step|walk"));
     ASSERT_EQ(0, deactivate(kSensor, 1, 3600000, "com.step|walk"));
-    ASSERT_EQ(2u, sensorListener->mReplies.size());
-    EXPECT_EQ(elementReply(1, 0, 3600000, "com.step|walk", screenOnBackground(3600000, 18000)),
-              sensorListener->mReplies[0].bytes);
+    Buckets hour = screenOnBackground(3600000, 18000);
+    EXPECT_EQ((std::vector<Bytes>{elementReply(1, 0, 3600000, "com.step|walk", hour),
+                                  componentReply(1, 0, 3600000, hour)}),
+              replyBytes(*sensorListener));
     EXPECT_EQ(LIBRARY_EVENT_COMPONENT, sensorListener->mReplies[1].event);
-    EXPECT_EQ(componentReply(1, 0, 3600000, screenOnBackground(3600000, 18000)),
-              sensorListener->mReplies[1].bytes);
 }
 
-// A traffic record in a balance reply: int64 bytes per bucket.
-void writeTrafficRecord(Parcel& p, int64_t start, int64_t end, const char* name, const Buckets& b) {
-    p.writeInt64(start);
-    p.writeInt64(end);
-    p.writeString8(String8(name));
-    for (int32_t i = 0; i < BUCKET_COUNT; ++i) {
-        p.writeInt64(b.usage[i]);
-        p.writeInt64(b.energy[i]);
-    }
+// A traffic record in a balance reply: int64 usage per bucket.
+Fields& trafficRecord(Fields& f, int64_t start, int64_t end, const char* name, const Buckets& b) {
+    return f.i64(start).i64(end).str(name).buckets(b, true);
 }
 
 struct TrafficEntry {
@@ -251,8 +204,8 @@ struct TrafficEntry {
     int64_t bytes;
 };
 
-Action trafficBatch(int32_t count, std::initializer_list<TrafficEntry> entries) {
-    Action action(kTraffic, ACTION_SET_VALUE);
+Fields trafficBatch(int32_t count, std::initializer_list<TrafficEntry> entries) {
+    Fields action(kTraffic, ACTION_SET_VALUE);
     action.i32(1).i32(500).i64(1000).i32(count);
     for (const TrafficEntry& entry : entries) {
         action.str(entry.name).i32(entry.foreground).i64(entry.bytes);
@@ -274,76 +227,60 @@ TEST_F(AllocatorTest, TrafficBatchesAreBoundedByCountAndData) {
     EXPECT_EQ(-1, trafficBatch(3, {{"com.c", 0, 600}, {"com.c", 0, 400}}).send());
     EXPECT_TRUE(log.contains("Traffic data ends after 2 of 3 entries", ANDROID_LOG_ERROR));
 
-    ASSERT_EQ(0, Action(kTraffic, ACTION_BALANCE).i32(BALANCE_AT).i64(5000).send());
-    Parcel expected;
-    expected.writeInt32(1);
-    expected.writeInt32(3);
-    writeTrafficRecord(expected, 0, 5000, "com.a",
-                       Buckets()
-                               .set(BUCKET_FOREGROUND, 2000, 1000)
-                               .set(BUCKET_BACKGROUND, 1000, 500)
-                               .set(BUCKET_SCREEN_ON, 3000, 1500));
-    writeTrafficRecord(expected, 0, 5000, "com.b", screenOnBackground(4000, 2000));
-    writeTrafficRecord(expected, 0, 5000, "com.c", screenOnBackground(1000, 500));
+    ASSERT_EQ(0, balanceAt(kTraffic, 5000));
+    // Prefix 1 and the count, then the records.
+    Buckets a = screenOnForeground(2000, 1000) + screenOnBackground(1000, 500);
     ASSERT_EQ(1u, listener->mReplies.size());
-    EXPECT_EQ(bytesOf(expected), listener->mReplies[0].bytes);
+    Fields expected;
+    trafficRecord(expected.i32(1).i32(3), 0, 5000, "com.a", a);
+    trafficRecord(expected, 0, 5000, "com.b", screenOnBackground(4000, 2000));
+    trafficRecord(expected, 0, 5000, "com.c", screenOnBackground(1000, 500));
+    EXPECT_EQ(expected.bytes(), listener->mReplies[0].bytes);
 
     // Charging: the flag picks the charge bucket; records start at the
     // previous balance.
-    ASSERT_EQ(0, Action(kTraffic, ACTION_CHARGER_ONLINE).i64(5000).flag(true).send());
+    ASSERT_EQ(0, Fields(kTraffic, ACTION_CHARGER_ONLINE).i64(5000).flag(true).send());
     ASSERT_EQ(0, trafficBatch(1, {{"com.a", 1, 10}}).send());
-    ASSERT_EQ(0, Action(kTraffic, ACTION_BALANCE).i32(BALANCE_AT).i64(9000).send());
-    Parcel charging;
-    charging.writeInt32(1);
-    charging.writeInt32(1);
-    writeTrafficRecord(charging, 5000, 9000, "com.a",
-                       Buckets().set(BUCKET_CHARGE_FOREGROUND, 10, 5));
+    ASSERT_EQ(0, balanceAt(kTraffic, 9000));
     ASSERT_EQ(2u, listener->mReplies.size());
-    EXPECT_EQ(bytesOf(charging), listener->mReplies[1].bytes);
+    Fields charging;
+    trafficRecord(charging.i32(1).i32(1), 5000, 9000, "com.a",
+                  Buckets().set(BUCKET_CHARGE_FOREGROUND, 10, 5));
+    EXPECT_EQ(charging.bytes(), listener->mReplies[1].bytes);
 }
 
-Action cpuBatch(int64_t totalApplicationUsage) {
+Fields cpuBatch(int64_t totalApplicationUsage) {
     // The component: 0-1000, usage 800, energy 1000.
-    Action action(kWeight, ACTION_SET_VALUE);
+    Fields action(kWeight, ACTION_SET_VALUE);
     action.i64(0).i64(1000).i32(800).i64(1000).i64(totalApplicationUsage);
     return action;
 }
 
+// The component record of cpuBatch with its foreground share.
 Bytes cpuComponent(int32_t foregroundUsage, int64_t foregroundEnergy) {
-    Parcel p;
-    p.writeInt64(0);
-    p.writeInt64(1000);
-    p.writeInt32(foregroundUsage);
-    p.writeInt64(foregroundEnergy);
-    p.writeInt32(800);
-    p.writeInt64(1000);
-    p.writeBool(true);
-    p.writeBool(false);
-    return bytesOf(p);
+    Fields f;
+    f.i64(0).i64(1000).i32(foregroundUsage).i64(foregroundEnergy).i32(800).i64(1000);
+    return f.flag(true).flag(false).bytes();
 }
 
-void writeCpuRecord(Parcel& p, int32_t uid, const char* name, const Buckets& b) {
-    p.writeInt32(uid);
-    p.writeInt64(0);
-    p.writeInt64(1000);
-    p.writeString8(String8(name));
-    writeBuckets(p, b);
+// An application record of cpuBatch.
+Fields& cpuRecord(Fields& f, int32_t uid, const char* name, const Buckets& b) {
+    return f.i32(uid).i64(0).i64(1000).str(name).buckets(b);
 }
 
 TEST_F(AllocatorTest, WeightSplitsByCpuTime) {
     auto listener = listenTo(kWeight);
-    ASSERT_EQ(0, Action(kWeight, ACTION_FOREGROUND).i64(0).str("com.fg").send());
+    ASSERT_EQ(0, Fields(kWeight, ACTION_FOREGROUND).i64(0).str("com.fg").send());
     // 1/3 and 2/3 of 1000: 333 and 667 (rounded).
     ASSERT_EQ(0, cpuBatch(3).i32(10010).str("com.fg").i32(1).i32(10020).str("com.bg").i32(2).send());
     ASSERT_EQ(2u, listener->mReplies.size());
     EXPECT_EQ(LIBRARY_EVENT_COMPONENT, listener->mReplies[0].event);
     EXPECT_EQ(cpuComponent(1, 333), listener->mReplies[0].bytes);
-    Parcel applications;
-    writeCpuRecord(applications, 10010, "com.fg",
-                   Buckets().set(BUCKET_FOREGROUND, 1, 333).set(BUCKET_SCREEN_ON, 1, 333));
-    writeCpuRecord(applications, 10020, "com.bg", screenOnBackground(2, 667));
+    Fields applications;
+    cpuRecord(applications, 10010, "com.fg", screenOnForeground(1, 333));
+    cpuRecord(applications, 10020, "com.bg", screenOnBackground(2, 667));
     EXPECT_EQ(LIBRARY_EVENT_APPLICATION, listener->mReplies[1].event);
-    EXPECT_EQ(bytesOf(applications), listener->mReplies[1].bytes);
+    EXPECT_EQ(applications.bytes(), listener->mReplies[1].bytes);
 
     // Applications without a total usage cannot be split: nothing is sent.
     LogCapture log;
@@ -361,10 +298,10 @@ TEST_F(AllocatorTest, WeightSplitsByCpuTime) {
     // the call fails.
     EXPECT_EQ(-1, cpuBatch(4).i32(10020).str("com.bg").i32(1).i32(10030).send());
     ASSERT_EQ(6u, listener->mReplies.size());
-    Parcel first;
-    writeCpuRecord(first, 10020, "com.bg", screenOnBackground(1, 250));
+    Fields first;
     EXPECT_EQ(cpuComponent(0, 0), listener->mReplies[4].bytes);
-    EXPECT_EQ(bytesOf(first), listener->mReplies[5].bytes);
+    EXPECT_EQ(cpuRecord(first, 10020, "com.bg", screenOnBackground(1, 250)).bytes(),
+              listener->mReplies[5].bytes);
 }
 
 } // namespace

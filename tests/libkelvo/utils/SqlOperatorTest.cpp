@@ -3,6 +3,7 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <atomic>
 #include <chrono>
 #include <cstdlib>
 #include <string>
@@ -13,6 +14,7 @@
 #include <binder/Parcel.h>
 #include <utils/String8.h>
 
+#include "ErrorLogger.h"
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "SqlTypes.h"
@@ -86,6 +88,33 @@ protected:
 
 } // namespace
 
+// The entry refuses unknown actions and missing parcels; library errors stay
+// out of the daemon's error table.
+TEST_F(SqlOperatorTest, UnknownActionsAndMissingParcelsAreRefused) {
+    static std::atomic<int> stored{0};
+    stored = 0;
+    kelvo::ErrorLogger::setSink([](const Parcel&) { stored++; });
+    LogCapture log;
+    EXPECT_EQ(-1, run(10));
+    EXPECT_EQ(-1, run(-1));
+    EXPECT_EQ(1u, log.count("[KelvoLibAgent.cpp] doSqliteOperation# Unknown action: 10",
+                            ANDROID_LOG_ERROR));
+    EXPECT_TRUE(log.contains("Unknown action: -1", ANDROID_LOG_ERROR));
+    for (int32_t action :
+         {kelvo::SQL_OPEN_CONNECTION, kelvo::SQL_CREATE_TABLE, kelvo::SQL_INSERT_ENTRIES,
+          kelvo::SQL_EXECUTE_ENTRY, kelvo::SQL_SIMPLE_QUERY, kelvo::SQL_BACKUP_COPY}) {
+        EXPECT_EQ(-1, run(action)) << action;
+    }
+    Parcel query;
+    query.writeString8(String8("SELECT 1"));
+    EXPECT_EQ(-1, run(kelvo::SQL_SIMPLE_QUERY, &query));
+    EXPECT_EQ(7u, log.count("Invalid parameter", ANDROID_LOG_ERROR));
+    EXPECT_EQ(9u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
+    EXPECT_EQ(0, stored.load());
+    kelvo::ErrorLogger::setSink(nullptr);
+}
+
+// Tables are created as defined; text that holds a second statement is refused.
 TEST_F(SqlOperatorTest, CreateTableWritesTheExactDefinition) {
     ASSERT_EQ(0, createTable("raw_screen_state", {{"id", kelvo::COLUMN_ID},
                                                   {"timestamp", kelvo::COLUMN_TIME},
@@ -112,31 +141,59 @@ TEST_F(SqlOperatorTest, CreateTableWritesTheExactDefinition) {
         EXPECT_EQ(-1, run(kelvo::SQL_CREATE_TABLE, &in)) << columns;
     }
     EXPECT_EQ(Rows{"2"}, query("SELECT count(*) FROM sqlite_master"));
+
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE x(v INTEGER)"));
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO x (v) VALUES (1), (2), (3);"));
+    log.clear();
+    kelvo::HealthCounters::resetForTest();
+    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, "SELECT 1; DROP TABLE x"));
+    Parcel reply;
+    EXPECT_EQ(-1, runSql(kelvo::SQL_SIMPLE_QUERY, "SELECT v FROM x; DROP TABLE x;", &reply));
+    EXPECT_EQ(0u, reply.dataSize());
+    EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
+    EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
+    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
+    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
+    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
+    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 2"));
+    EXPECT_EQ(Rows{"3"}, query("SELECT v FROM x"));
 }
 
+// Time columns also get the local second as text.
 TEST_F(SqlOperatorTest, InsertBindsEveryColumnKindInOrder) {
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY,
-                        "CREATE TABLE t(id INTEGER PRIMARY KEY, ts INTEGER, formatted_ts VARCHAR, "
-                        "name VARCHAR, x INTEGER, level INTEGER, bytes INTEGER)"));
+    const char* saved = getenv("TZ");
+    const std::string savedZone = saved != nullptr ? saved : "";
+    setenv("TZ", "JST-9", 1); // UTC + 9 h all year
+    tzset();
+    ASSERT_EQ(0, createTable("t", {{"id", kelvo::COLUMN_ID}, {"ts", kelvo::COLUMN_TIME},
+                                   {"name", kelvo::COLUMN_TEXT}, {"x", kelvo::COLUMN_INT},
+                                   {"level", kelvo::COLUMN_INT}, {"bytes", kelvo::COLUMN_LONG}}));
     LogCapture log;
     Parcel in;
     // Kind 9 is unknown: nothing is read for it and it stays NULL.
     writeHead(in, "t", {{"ts", kelvo::COLUMN_TIME}, {"name", kelvo::COLUMN_TEXT}, {"x", 9},
                         {"level", kelvo::COLUMN_INT}, {"bytes", kelvo::COLUMN_LONG}});
-    in.writeInt32(2);
+    const std::vector<int64_t> times = {1500, -1500, 999, INT64_MAX};
+    in.writeInt32(static_cast<int32_t>(times.size()));
     const int64_t bytes = (1LL << 40) + 3;
-    for (int32_t i = 0; i < 2; ++i) {
-        in.writeInt64(1000 * (i + 1));
-        in.writeString8(String8(i == 0 ? "first" : "second"));
+    for (int32_t i = 0; i < 4; ++i) {
+        in.writeInt64(times[i]);
+        in.writeString8(String8(i == 0 ? "first" : "next"));
         in.writeInt32(-5 - i);
         in.writeInt64(bytes + i);
     }
     EXPECT_EQ(SQLITE_DONE, run(kelvo::SQL_INSERT_ENTRIES, &in));
+    Rows rows = query("SELECT id, ts, formatted_ts, name, x, level, bytes FROM t ORDER BY id");
+    saved != nullptr ? setenv("TZ", savedZone.c_str(), 1) : unsetenv("TZ");
+    tzset();
 
-    EXPECT_EQ(2u, log.count("Unknown data type: 9", ANDROID_LOG_ERROR));
-    EXPECT_EQ((Rows{"1|1000|first||-5|" + std::to_string(bytes),
-                    "2|2000|second||-6|" + std::to_string(bytes + 1)}),
-              query("SELECT id, ts, name, x, level, bytes FROM t ORDER BY id"));
+    EXPECT_EQ(4u, log.count("Unknown data type: 9", ANDROID_LOG_ERROR));
+    // Seconds are taken toward zero; a year too long for the text gives "".
+    EXPECT_EQ((Rows{"1|1500|1970-01-01 09:00:01|first||-5|" + std::to_string(bytes),
+                    "2|-1500|1970-01-01 08:59:59|next||-6|" + std::to_string(bytes + 1),
+                    "3|999|1970-01-01 09:00:00|next||-7|" + std::to_string(bytes + 2),
+                    "4|" + std::to_string(INT64_MAX) + "||next||-8|" + std::to_string(bytes + 3)}),
+              rows);
 }
 
 TEST_F(SqlOperatorTest, InsertTakesWholeParcelsUpToTheRowLimit) {
@@ -180,48 +237,6 @@ TEST_F(SqlOperatorTest, InsertTakesWholeParcelsUpToTheRowLimit) {
     EXPECT_EQ(Rows{std::to_string(3 + kelvo::kMaxInsertRows)}, query("SELECT count(*) FROM t"));
 }
 
-TEST_F(SqlOperatorTest, TimeColumnsCarryTheLocalSecond) {
-    const char* saved = getenv("TZ");
-    const std::string savedZone = saved != nullptr ? saved : "";
-    setenv("TZ", "JST-9", 1); // UTC + 9 h all year
-    tzset();
-    ASSERT_EQ(0, createTable("t", {{"id", kelvo::COLUMN_ID}, {"ts", kelvo::COLUMN_TIME}}));
-    Parcel in;
-    writeHead(in, "t", {{"ts", kelvo::COLUMN_TIME}});
-    const std::vector<int64_t> times = {1500, -1500, 999, INT64_MAX};
-    in.writeInt32(static_cast<int32_t>(times.size()));
-    for (int64_t time : times) {
-        in.writeInt64(time);
-    }
-    EXPECT_EQ(SQLITE_DONE, run(kelvo::SQL_INSERT_ENTRIES, &in));
-    Rows rows = query("SELECT ts, formatted_ts FROM t ORDER BY id");
-    saved != nullptr ? setenv("TZ", savedZone.c_str(), 1) : unsetenv("TZ");
-    tzset();
-
-    // Seconds are taken toward zero; a year too long for the text gives "".
-    EXPECT_EQ((Rows{"1500|1970-01-01 09:00:01", "-1500|1970-01-01 08:59:59",
-                    "999|1970-01-01 09:00:00", std::to_string(INT64_MAX) + "|"}),
-              rows);
-}
-
-TEST_F(SqlOperatorTest, StatementsWithASecondStatementAreRefused) {
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE x(v INTEGER)"));
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO x (v) VALUES (1), (2), (3);"));
-    LogCapture log;
-    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, "SELECT 1; DROP TABLE x"));
-    Parcel reply;
-    EXPECT_EQ(-1, runSql(kelvo::SQL_SIMPLE_QUERY, "SELECT v FROM x; DROP TABLE x;", &reply));
-    EXPECT_EQ(0u, reply.dataSize());
-    EXPECT_EQ(-1, createTable("y(a INTEGER); DROP TABLE x; --", {{"b", kelvo::COLUMN_INT}}));
-    EXPECT_EQ(3u, log.count("Statement may have injection issue", ANDROID_LOG_ERROR));
-    EXPECT_EQ(3u, kelvo::HealthCounters::get(kelvo::Health::LibraryParcelRefused));
-    EXPECT_EQ(-1, runSql(kelvo::SQL_EXECUTE_ENTRY, ""));
-
-    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 1;"));
-    EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "DELETE FROM x WHERE v = 2"));
-    EXPECT_EQ(Rows{"3"}, query("SELECT v FROM x"));
-}
-
 TEST_F(SqlOperatorTest, QueryReplyHasOneValuePerColumn) {
     ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY,
                         "CREATE TABLE q(i INTEGER, s VARCHAR, r REAL, b BLOB, tail INTEGER)"));
@@ -260,8 +275,36 @@ TEST_F(SqlOperatorTest, QueryReplyHasOneValuePerColumn) {
     EXPECT_EQ(5, partial.readInt64());
 }
 
-TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
+// A backup copy is whole or absent; the connection opens once and only on a
+// file.
+TEST_F(SqlOperatorTest, BackupCopyAndConnection) {
     LogCapture log;
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
+    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
+    const std::string copy = mRoot.path() + "/copy.db";
+    ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
+    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
+
+    const std::string unreachable = mRoot.path() + "/missing/copy.db";
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, unreachable));
+    EXPECT_NE(0, access(unreachable.c_str(), F_OK));
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, ""));
+    EXPECT_TRUE(log.contains("Invalid backup copy file name", ANDROID_LOG_ERROR));
+
+    // The source stays locked past the busy time-out: the new file goes.
+    const std::string blocked = mRoot.path() + "/blocked.db";
+    kelvo::test::DirectDb locker(mPath);
+    ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
+    EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
+    EXPECT_NE(0, access(blocked.c_str(), F_OK));
+    ASSERT_EQ(SQLITE_OK, locker.exec("COMMIT;"));
+
+    // A file that was there before is not the copy's to remove.
+    mRoot.writeFile("/foreign.db", "somebody's file\n");
+    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
+    EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
+
     EXPECT_EQ(-1, runPath(kelvo::SQL_OPEN_CONNECTION, mRoot.path() + "/other.db"));
     EXPECT_TRUE(log.contains("Database connection already opened", ANDROID_LOG_ERROR));
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE still_open(v INTEGER)"));
@@ -283,7 +326,7 @@ TEST_F(SqlOperatorTest, ConnectionOpensOnceAndOnlyOnAFile) {
     EXPECT_TRUE(log.contains("Error: file is not a database(" + mRoot.path() + "/garbage.db)"));
     // A failed open leaves no connection behind.
     ASSERT_EQ(0, runPath(kelvo::SQL_OPEN_CONNECTION, mPath));
-    EXPECT_EQ(Rows{"still_open"}, query("SELECT name FROM sqlite_master"));
+    EXPECT_EQ((Rows{"still_open", "t"}), query("SELECT name FROM sqlite_master ORDER BY name"));
     EXPECT_NE(0, access((mRoot.path() + "/other.db").c_str(), F_OK));
 }
 
@@ -324,35 +367,6 @@ TEST_F(SqlOperatorTest, TransactionsRecoverFromABusyCommit) {
     EXPECT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4)"));
     release.join();
     EXPECT_EQ(Rows{"4"}, query("SELECT v FROM t"));
-}
-
-TEST_F(SqlOperatorTest, BackupCopyIsWholeOrAbsent) {
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "CREATE TABLE t(v INTEGER)"));
-    ASSERT_EQ(0, runSql(kelvo::SQL_EXECUTE_ENTRY, "INSERT INTO t (v) VALUES (4), (5)"));
-    const std::string copy = mRoot.path() + "/copy.db";
-    ASSERT_EQ(0, runPath(kelvo::SQL_BACKUP_COPY, copy));
-    EXPECT_EQ((Rows{"4", "5"}), kelvo::test::DirectDb(copy).column("SELECT v FROM t ORDER BY v"));
-
-    LogCapture log;
-    const std::string unreachable = mRoot.path() + "/missing/copy.db";
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, unreachable));
-    EXPECT_NE(0, access(unreachable.c_str(), F_OK));
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, ""));
-    EXPECT_TRUE(log.contains("Invalid backup copy file name", ANDROID_LOG_ERROR));
-
-    // The source stays locked past the busy time-out: the new file goes.
-    const std::string blocked = mRoot.path() + "/blocked.db";
-    kelvo::test::DirectDb locker(mPath);
-    ASSERT_EQ(SQLITE_OK, locker.exec("BEGIN EXCLUSIVE;"));
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, blocked));
-    EXPECT_TRUE(log.contains("Backup copy error: ", ANDROID_LOG_ERROR));
-    EXPECT_NE(0, access(blocked.c_str(), F_OK));
-    ASSERT_EQ(SQLITE_OK, locker.exec("COMMIT;"));
-
-    // A file that was there before is not the copy's to remove.
-    mRoot.writeFile("/foreign.db", "somebody's file\n");
-    EXPECT_EQ(-1, runPath(kelvo::SQL_BACKUP_COPY, mRoot.path() + "/foreign.db"));
-    EXPECT_EQ("somebody's file\n", mRoot.readFile("/foreign.db"));
 }
 
 TEST_F(SqlOperatorTest, AFullStatementCacheKeepsTheStatementInUse) {
