@@ -2,7 +2,6 @@
 
 #include <android-base/stringprintf.h>
 #include <binder/Parcel.h>
-#include <cutils/properties.h>
 #include <dirent.h>
 #include <fcntl.h>
 #include <stdlib.h>
@@ -36,7 +35,6 @@ std::atomic<int64_t> StorageManager::sPathWaitMs{StorageManager::kDefaultPathWai
 
 namespace {
 
-constexpr const char* kUserTypeProperty = "ro.logsystem.usertype";
 constexpr const char* kDbExtension = ".db";
 constexpr const char* kZipExtension = ".zip";
 constexpr const char* kNamePrefix = "kelvo-";
@@ -215,7 +213,8 @@ void StorageManager::setPathWaitMs(int64_t ms) {
 }
 
 int32_t StorageManager::getUserType() {
-    return property_get_int32(kUserTypeProperty, -1);
+    // Read once before main, with the log switches.
+    return gLogUserType.load(std::memory_order_relaxed);
 }
 
 bool StorageManager::isBetaUser(int32_t userType) {

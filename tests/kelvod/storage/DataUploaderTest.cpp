@@ -1,5 +1,5 @@
 #include "HealthCounters.h"
-#include "kelvo/HostProperties.h"
+#include "KelvoLog.h"
 #include "kelvo/ZendrelHost.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "storage/DataUploader.h"
@@ -161,10 +161,11 @@ TEST_F(DataUploaderTest, LibraryFailuresAreRecordedAndNotReportedAsSuccess) {
 }
 
 TEST_F(DataUploaderTest, DailyDatabaseCopyIsAnnouncedWithItsDay) {
-    kelvo::HostProperties::setForTest("ro.logsystem.usertype", "3");
     // The file manager's daily work on a beta device.
+    kelvo::gLogUserType.store(3);
     mStorage->cleanDatabase(2 * 86400000LL);
     mStorage->flushAllEntries();
+    kelvo::gLogUserType.store(-1);
     std::vector<Json::Value> sent = events();
     ASSERT_EQ(1u, sent.size());
     EXPECT_EQ(903999001u, sent[0]["event"].asUInt());

@@ -101,11 +101,11 @@ protected:
     void TearDown() override {
         StorageManager::setPathWaitMs(StorageManager::kDefaultPathWaitMs);
         StorageManager::setDailyUploadHook(nullptr);
+        kelvo::gLogUserType.store(-1);
     }
 
-    void setUserType(int type) {
-        kelvo::HostProperties::setForTest("ro.logsystem.usertype", std::to_string(type).c_str());
-    }
+    // The user type is read once at start-up.
+    void setUserType(int type) { kelvo::gLogUserType.store(type); }
 
     // Backup zips by age; a test fails when two share an age.
     std::map<int, std::string> backupZips() {
