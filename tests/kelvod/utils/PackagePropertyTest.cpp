@@ -17,11 +17,7 @@ namespace {
 constexpr uint32_t kPackagesForUid = 34;
 
 std::vector<String8> names(std::initializer_list<const char*> list) {
-    std::vector<String8> out;
-    for (const char* name : list) {
-        out.push_back(String8(name));
-    }
-    return out;
+    return std::vector<String8>(list.begin(), list.end());
 }
 
 std::string combined(std::initializer_list<const char*> list) {
