@@ -53,6 +53,7 @@ struct Registered {
 
 TEST(NotifierTest, FansOutToEveryListenerOfTheTypeInOrder) {
     Notifier* notifier = Notifier::getInstance();
+    drain(notifier); // nothing sent by an earlier test arrives here
     sp<ListeningThread> a = new ListeningThread("ListenerA");
     sp<ListeningThread> b = new ListeningThread("ListenerB");
     NotifierListener la(a);
