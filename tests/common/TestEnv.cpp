@@ -3,7 +3,6 @@
 #include <stdlib.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
 #include <dirent.h>
 
 #include <algorithm>
@@ -44,9 +43,7 @@ void makeHostDirs(const std::string& dir) {
 
 void writeHostFile(const std::string& path, const std::string& content) {
     size_t slash = path.find_last_of('/');
-    if (slash != std::string::npos && slash > 0) {
-        makeHostDirs(path.substr(0, slash));
-    }
+    if (slash != std::string::npos && slash > 0) makeHostDirs(path.substr(0, slash));
     std::ofstream out(path, std::ios::binary | std::ios::trunc);
     out << content;
 }
@@ -69,9 +66,7 @@ std::vector<std::string> listDir(const std::string& dir, const std::string& patt
     if (DIR* d = opendir(dir.c_str())) {
         while (struct dirent* ent = readdir(d)) {
             std::string name = ent->d_name;
-            if (name != "." && name != ".." && std::regex_match(name, re)) {
-                names.push_back(name);
-            }
+            if (name != "." && name != ".." && std::regex_match(name, re)) names.push_back(name);
         }
         closedir(d);
     }
@@ -147,21 +142,14 @@ std::vector<LogLine> LogCapture::lines() const {
 std::vector<LogLine> LogCapture::linesWith(const std::string& text) const {
     std::vector<LogLine> out;
     for (const LogLine& line : lines()) {
-        if (line.text.find(text) != std::string::npos) {
-            out.push_back(line);
-        }
+        if (line.text.find(text) != std::string::npos) out.push_back(line);
     }
     return out;
 }
 
 size_t LogCapture::count(const std::string& text, int priority) const {
     size_t n = 0;
-    for (const LogLine& line : lines()) {
-        if ((priority == 0 || line.priority == priority) &&
-            line.text.find(text) != std::string::npos) {
-            ++n;
-        }
-    }
+    for (const LogLine& line : linesWith(text)) n += priority == 0 || line.priority == priority;
     return n;
 }
 
@@ -189,18 +177,14 @@ std::map<std::string, std::string> readZip(const std::string& path) {
             EndIteration(cookie);
         }
     }
-    if (handle != nullptr) {
-        CloseArchive(handle);
-    }
+    if (handle != nullptr) CloseArchive(handle);
     return entries;
 }
 
 bool waitFor(const std::function<bool()>& condition, std::chrono::milliseconds timeout) {
     auto deadline = std::chrono::steady_clock::now() + timeout;
     while (std::chrono::steady_clock::now() < deadline) {
-        if (condition()) {
-            return true;
-        }
+        if (condition()) return true;
         std::this_thread::sleep_for(std::chrono::milliseconds(2));
     }
     return condition();

@@ -143,25 +143,28 @@ TEST_F(PlatformClientsTest, ProcessTableIsFetchedOncePer101Ms) {
     EXPECT_TRUE(out.empty());
     EXPECT_EQ(0, am->getPackagesForPid(99001, 7003, out));
     EXPECT_EQ(1u, out.size());
-}
 
-TEST_F(PlatformClientsTest, MissingActivityServiceEmptiesTheTable) {
-    ActivityManager* am = ActivityManager::getInstance();
-    state().setProcesses({{7101, 10310, "com.example.a", {"com.example.a"}}});
-    std::vector<String8> out;
-    ASSERT_EQ(0, am->getPackagesForPid(10310, 7101, out));
+    // A missing activity service empties the table.
     ASSERT_EQ(android::NO_ERROR, mServices->stop("activity"));
     ASSERT_TRUE(waitFor([am] { return !am->isConnected(); }, kLong));
     out.clear();
-    EXPECT_EQ(-2, am->getPackagesForPid(10310, 7101, out));
+    EXPECT_EQ(-2, am->getPackagesForPid(10302, 7003, out));
     EXPECT_TRUE(out.empty());
 }
 
-TEST_F(PlatformClientsTest, BatteryChangeSendsLevelBeforeCharger) {
+TEST_F(PlatformClientsTest, BatteryRegistrationIsRetriedAndSendsLevelBeforeCharger) {
     collector();
     BatteryManager* battery = BatteryManager::getInstance();
     ASSERT_EQ(0, battery->initialize());
     ASSERT_TRUE(waitFor([battery] { return battery->isRegistered(); }, kLong));
+    ASSERT_EQ(android::NO_ERROR, mServices->stop("batteryproperties"));
+    ASSERT_TRUE(waitFor([battery] { return !battery->isRegistered(); }, kLong));
+    // Long enough for the first retries to fail.
+    std::this_thread::sleep_for(std::chrono::milliseconds(800));
+    EXPECT_FALSE(battery->isRegistered());
+    ASSERT_EQ(android::NO_ERROR, mServices->start("batteryproperties"));
+    ASSERT_TRUE(waitFor([battery] { return battery->isRegistered(); }, kLong));
+
     PlatformState::Battery props = state().battery();
     props.level = 38;
     props.acOnline = false;
@@ -190,53 +193,6 @@ TEST_F(PlatformClientsTest, BatteryChangeSendsLevelBeforeCharger) {
     state().setBattery(props);
 }
 
-TEST_F(PlatformClientsTest, BatteryRegistrationIsRetriedUntilTheRegistrarReturns) {
-    collector();
-    BatteryManager* battery = BatteryManager::getInstance();
-    ASSERT_EQ(0, battery->initialize());
-    ASSERT_EQ(android::NO_ERROR, mServices->stop("batteryproperties"));
-    ASSERT_TRUE(waitFor([battery] { return !battery->isRegistered(); }, kLong));
-    // Long enough for the first retries to fail.
-    std::this_thread::sleep_for(std::chrono::milliseconds(800));
-    EXPECT_FALSE(battery->isRegistered());
-    ASSERT_EQ(android::NO_ERROR, mServices->start("batteryproperties"));
-    ASSERT_TRUE(waitFor([battery] { return battery->isRegistered(); }, kLong));
-
-    PlatformState::Battery props = state().battery();
-    props.level = 12;
-    state().setBattery(props);
-    ASSERT_TRUE(waitFor(
-        [] {
-            for (const Received& got : collector()->got()) {
-                if (got.what == kelvo::NOTIFICATION_BATTERY_LEVEL_CHANGED && got.value == 12)
-                    return true;
-            }
-            return false;
-        },
-        kLong));
-}
-
-TEST_F(PlatformClientsTest, TraceIsWrittenBelowTheRoot) {
-    EXPECT_EQ(-5, kelvo::SysinfoManager::getInstance()->dumpSystrace(nullptr));
-    mRoot.writeFile("/data/kelvo/trace/.keep", "");
-    ASSERT_EQ(0, kelvo::SysinfoManager::getInstance()->dumpSystrace("/data/kelvo/trace/t1.txt"));
-    EXPECT_NE("", mRoot.readFile("/data/kelvo/trace/t1.txt"));
-    ASSERT_EQ(1u, state().traces().size());
-    // A path that would leave the root is refused.
-    EXPECT_EQ(-8, kelvo::SysinfoManager::getInstance()->dumpSystrace("/data/../../escape.txt"));
-}
-
-TEST_F(PlatformClientsTest, WakelocksAndResetNote) {
-    kelvo::WakelockManager* pm = kelvo::WakelockManager::getInstance();
-    state().setWakelocks({"wl1 10010 3 1200", "wl2 1000 1 40"});
-    std::vector<String16> out;
-    ASSERT_EQ(0, pm->getPartialWakelocks(out));
-    ASSERT_EQ(2u, out.size());
-    EXPECT_EQ(String16("wl2 1000 1 40"), out[1]);
-    ASSERT_EQ(0, pm->noteResetBatteryStats());
-    EXPECT_TRUE(waitFor([this] { return state().resetCount() == 1; }, kLong));
-}
-
 namespace {
 
 // A "pmservice" that claims more records than its reply holds.
@@ -260,14 +216,30 @@ private:
 
 } // namespace
 
-TEST_F(PlatformClientsTest, CountLargerThanTheReplyIsRefused) {
+TEST_F(PlatformClientsTest, WakelocksResetNoteTracesAndACountLargerThanTheReply) {
     kelvo::WakelockManager* pm = kelvo::WakelockManager::getInstance();
+    state().setWakelocks({"wl1 10010 3 1200", "wl2 1000 1 40"});
+    std::vector<String16> out;
+    ASSERT_EQ(0, pm->getPartialWakelocks(out));
+    ASSERT_EQ(2u, out.size());
+    EXPECT_EQ(String16("wl2 1000 1 40"), out[1]);
+    ASSERT_EQ(0, pm->noteResetBatteryStats());
+    EXPECT_TRUE(waitFor([this] { return state().resetCount() == 1; }, kLong));
+    // Traces are written below the root.
+    EXPECT_EQ(-5, kelvo::SysinfoManager::getInstance()->dumpSystrace(nullptr));
+    mRoot.writeFile("/data/kelvo/trace/.keep", "");
+    ASSERT_EQ(0, kelvo::SysinfoManager::getInstance()->dumpSystrace("/data/kelvo/trace/t1.txt"));
+    EXPECT_NE("", mRoot.readFile("/data/kelvo/trace/t1.txt"));
+    ASSERT_EQ(1u, state().traces().size());
+    // A path that would leave the root is refused.
+    EXPECT_EQ(-8, kelvo::SysinfoManager::getInstance()->dumpSystrace("/data/../../escape.txt"));
+    // A service that claims more records than its reply holds is refused.
     ASSERT_EQ(android::NO_ERROR, mServices->stop("pmservice"));
     ASSERT_TRUE(waitFor([pm] { return !pm->isConnected(); }, kLong));
     sp<LyingPmService> liar = new LyingPmService();
     ASSERT_EQ(android::NO_ERROR,
               android::defaultServiceManager()->addService(String16("pmservice"), liar));
-    std::vector<String16> out;
+    out.clear();
     EXPECT_EQ(-12, pm->getPartialWakelocks(out));
     EXPECT_TRUE(out.empty());
     ASSERT_EQ(android::NO_ERROR, kelvo::ServiceControl::stopService(String16("pmservice")));

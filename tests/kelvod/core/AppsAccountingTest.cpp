@@ -22,7 +22,8 @@ constexpr int64_t kHour = 3600000;
 // One record: time, name, code, then the 32-bit fields (shared sub-key)
 // and 64-bit fields in the order of the code's kind.
 void record(int64_t t, const char* name, int32_t code, std::initializer_list<int32_t> lead,
-            std::initializer_list<int64_t> energies, std::initializer_list<int32_t> values) {
+            std::initializer_list<int64_t> energies, std::initializer_list<int32_t> values,
+            int32_t expected = 0) {
     Parcel p;
     p.writeInt64(t);
     p.writeString8(String8(name));
@@ -30,7 +31,7 @@ void record(int64_t t, const char* name, int32_t code, std::initializer_list<int
     for (int32_t v : lead) p.writeInt32(v);
     for (int64_t e : energies) p.writeInt64(e);
     for (int32_t v : values) p.writeInt32(v);
-    EXPECT_EQ(0, AppsAccounting::getInstance()->addAppsData(p));
+    EXPECT_EQ(expected, AppsAccounting::getInstance()->addAppsData(p));
 }
 
 void common(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bg, int64_t on,
@@ -40,10 +41,6 @@ void common(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bg, i
 
 void shared(int64_t t, const char* name, int32_t code, int32_t key, int64_t fg, int32_t v1) {
     record(t, name, code, {key}, {fg, 0, fg, 0}, {v1, 0, v1, 0});
-}
-
-void display(int64_t t, const char* name, int64_t energy, int64_t duration) {
-    record(t, name, kelvo::APPS_DISPLAY, {}, {energy, duration}, {});
 }
 
 void network(int64_t t, const char* name, int32_t code, int64_t fg, int64_t bytes) {
@@ -84,22 +81,11 @@ TEST_F(AppsAccountingTest, RecordsMergePerHourApplicationAndComponent) {
     // Shared: the largest per-kind sum, not the total.
     shared(kTen, "com.d", kelvo::APPS_BLUETOOTH, 1, 3, 5);
     shared(kTen, "com.d", kelvo::APPS_BLUETOOTH, 2, 4, 9);
-    display(kTen, "com.e", 70, 700);
+    record(kTen, "com.e", kelvo::APPS_DISPLAY, {}, {70, 700}, {});
     network(kTen, "com.f", kelvo::APPS_WIFI, 8, 4096);
-    // Unknown codes are refused.
-    Parcel bad;
-    bad.writeInt64(kTen);
-    bad.writeString8(String8("com.x"));
-    bad.writeInt32(-1);
-    EXPECT_EQ(-5, AppsAccounting::getInstance()->addAppsData(bad));
-    // A record shorter than its kind adds nothing.
-    Parcel shortRecord;
-    shortRecord.writeInt64(kTen);
-    shortRecord.writeString8(String8("com.short"));
-    shortRecord.writeInt32(kelvo::APPS_CPU);
-    shortRecord.writeInt64(99);
-    EXPECT_EQ(-5, AppsAccounting::getInstance()->addAppsData(shortRecord));
-
+    // Unknown codes are refused; a record shorter than its kind adds nothing.
+    record(kTen, "com.x", -1, {}, {}, {}, -5);
+    record(kTen, "com.short", kelvo::APPS_CPU, {}, {99}, {}, -5);
     ASSERT_EQ(0, AppsAccounting::getInstance()->balanceAccount());
     EXPECT_EQ((std::vector<std::string>{
                       "1796554800000 com.a 5 11 7 15 3 110 70 150 30",
@@ -120,14 +106,19 @@ TEST_F(AppsAccountingTest, RecordsMergePerHourApplicationAndComponent) {
               rows("SELECT COUNT(*) FROM hourly_applications_accounting"));
 }
 
-TEST_F(AppsAccountingTest, ALargeBalanceIsWrittenInChunks) {
+TEST_F(AppsAccountingTest, ALargeBalanceIsWrittenInChunksAndNamesWithoutFieldsAreLogged) {
     for (int i = 0; i < 6000; ++i) {
         std::string name = "com.app" + std::to_string(i);
         common(kTen, name.c_str(), kelvo::APPS_CPU, 1, 1, 1, 1, 1, 1, 1, 1);
     }
+    // Energy but no durations: listed first among the day's names, no fields.
+    common(kTen, "com.silent", kelvo::APPS_CPU, 9, 0, 9, 0, 0, 0, 0, 0);
     ASSERT_EQ(0, AppsAccounting::getInstance()->balanceAccount());
-    EXPECT_EQ(std::vector<std::string>{"6000"},
+    EXPECT_EQ(std::vector<std::string>{"6001"},
               rows("SELECT COUNT(*) FROM hourly_applications_accounting"));
+    mStorage->flushAllEntries();
+    ASSERT_EQ(0, AppsAccounting::getInstance()->uploadDailyAppsAccounting(kTen + kHour, 1.0f));
+    EXPECT_NE(std::string::npos, mRoot->readFile(KELVO_POWER_LOG_FILE).find("\tapps\tcom.silent#"));
 }
 
 TEST_F(AppsAccountingTest, UploadsTheTopApplicationsInEnergyOrder) {
@@ -166,15 +157,6 @@ TEST_F(AppsAccountingTest, UploadsTheTopApplicationsInEnergyOrder) {
     EXPECT_EQ("it's.quoted", e["params"]["15"]["params"]["15"]["params"]["0"].asString());
     std::string power = mRoot->readFile(KELVO_POWER_LOG_FILE);
     EXPECT_NE(std::string::npos, power.find("\t215\t\tapps\tmodem_idle#com.app12#com.app11#"));
-}
-
-TEST_F(AppsAccountingTest, DayNamesReachThePowerLogEvenWithoutFields) {
-    // Energy but no durations: listed among the top names, no upload fields.
-    common(kTen, "com.silent", kelvo::APPS_CPU, 9, 0, 9, 0, 0, 0, 0, 0);
-    AppsAccounting::getInstance()->balanceAccount();
-    mStorage->flushAllEntries();
-    ASSERT_EQ(0, AppsAccounting::getInstance()->uploadDailyAppsAccounting(kTen + kHour, 1.0f));
-    EXPECT_NE(std::string::npos, mRoot->readFile(KELVO_POWER_LOG_FILE).find("\tapps\tcom.silent#"));
 }
 
 TEST_F(AppsAccountingTest, PackageStrategiesAreLoadedOnceAndAFailureLoggedOnce) {

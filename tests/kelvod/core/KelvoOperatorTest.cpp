@@ -175,6 +175,16 @@ struct TimeBody : Parcel {
     explicit TimeBody(int64_t t) { writeInt64(t); }
 };
 
+// A buffered log entry of the test's log: declared length, magic, data.
+int32_t sendBuffered(int32_t length, int32_t magic, const std::string& data) {
+    std::string entry(8, '\0');
+    memcpy(&entry[0], &length, 4);
+    memcpy(&entry[4], &magic, 4);
+    entry += data;
+    return kelvo::BufferedLogServer::getInstance()->sendLogMessage(
+            String8("kelvo_test"), reinterpret_cast<const uint8_t*>(entry.data()), entry.size());
+}
+
 } // namespace
 
 TEST_F(KelvoOperatorTest, MessagesReachTheirOperations) {
@@ -209,6 +219,20 @@ TEST_F(KelvoOperatorTest, MessagesReachTheirOperations) {
     EXPECT_EQ("hourlyTick:3600000", calls().back());
     EXPECT_EQ(-1, op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION, 23)));
     EXPECT_TRUE(log.contains("Unknown message type: 23", ANDROID_LOG_ERROR));
+
+    // Accounting rounds log, then vote to the hourly routine, absent here:
+    // one attempt per round.
+    op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION,
+                                      kelvo::NOTIFICATION_APPLICATIONS_ACCOUNTING,
+                                      TimeBody(7200000)));
+    EXPECT_EQ("logApps:7200000", calls().back());
+    EXPECT_EQ(1u, log.count("Invalid routine", ANDROID_LOG_ERROR));
+    op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION,
+                                      kelvo::NOTIFICATION_COMPONENT_ACCOUNTING,
+                                      TimeBody(7200000)));
+    EXPECT_EQ(2u, log.count("Invalid routine", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-5, op->setElector(0x2, Parcel()));
+    EXPECT_TRUE(log.contains("Empty candidates", ANDROID_LOG_ERROR));
 }
 
 TEST_F(KelvoOperatorTest, StateChangesFeedTheOperatorsAccounter) {
@@ -235,7 +259,6 @@ TEST_F(KelvoOperatorTest, StateChangesFeedTheOperatorsAccounter) {
                                         "charger:300:1", "balance:1:400:450", "balance:0:500",
                                         "balance:0:600", "deactivateAll:700", "component:77"}),
               calls());
-
 }
 
 TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
@@ -250,21 +273,11 @@ TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
                                                      TimeBody(42));
     EXPECT_TRUE(waitFor([] { return countCalls("hourlyTick:42") == 1; }));
 
-    uint8_t entry[8 + 3];
-    int32_t length = 3;
-    int32_t magic = 5;
-    memcpy(entry, &length, 4);
-    memcpy(entry + 4, &magic, 4);
-    memcpy(entry + 8, "abc", 3);
-    EXPECT_EQ(0, kelvo::BufferedLogServer::getInstance()->sendLogMessage(String8("kelvo_test"),
-                                                                         entry, sizeof(entry)));
+    EXPECT_EQ(0, sendBuffered(3, 5, "abc"));
     EXPECT_TRUE(waitFor([] { return countCalls("buffered:kelvo_test:5:abc") == 1; }));
     // A length beyond what arrived is refused, nothing posted.
     uint64_t refused = kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused);
-    length = 64;
-    memcpy(entry, &length, 4);
-    kelvo::BufferedLogServer::getInstance()->sendLogMessage(String8("kelvo_test"), entry,
-                                                            sizeof(entry));
+    sendBuffered(64, 5, "abc");
     EXPECT_EQ(refused + 1, kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused));
 
     // The library record after the unknown one was never registered.
@@ -281,8 +294,7 @@ TEST_F(KelvoOperatorTest, ListenerRecordsRegisterUntilAnUnknownOne) {
     op->release();
     kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
                                                      TimeBody(43));
-    EXPECT_EQ(-4, kelvo::BufferedLogServer::getInstance()->sendLogMessage(
-                          String8("kelvo_test"), entry, sizeof(entry)));
+    EXPECT_EQ(-4, sendBuffered(64, 5, "abc"));
     EXPECT_EQ(refused + 2, kelvo::HealthCounters::get(kelvo::Health::BufferedEntryRefused));
     std::this_thread::sleep_for(std::chrono::milliseconds(100));
     settle();
@@ -304,25 +316,5 @@ TEST_F(KelvoOperatorTest, RegistrationsDoNotKeepAnOperatorAlive) {
     // What it registered is gone or harmless.
     kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
                                                      TimeBody(44));
-    uint8_t entry[8] = {0, 0, 0, 0, 6, 0, 0, 0};
-    EXPECT_EQ(-4, kelvo::BufferedLogServer::getInstance()->sendLogMessage(
-                          String8("kelvo_test"), entry, sizeof(entry)));
-}
-
-TEST_F(KelvoOperatorTest, AccountingRoundsLogAndVoteOnce) {
-    sp<TestOperator> op = make(-1, {});
-    op->initialize();
-    LogCapture log;
-    op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION,
-                                      kelvo::NOTIFICATION_APPLICATIONS_ACCOUNTING,
-                                      TimeBody(7200000)));
-    EXPECT_EQ((std::vector<std::string>{"logApps:7200000"}), calls());
-    // The vote goes to the hourly routine, absent here: one attempt per round.
-    EXPECT_EQ(1u, log.count("Invalid routine", ANDROID_LOG_ERROR));
-    op->sendMessageSync(ParcelMessage(kelvo::MESSAGE_NOTIFICATION,
-                                      kelvo::NOTIFICATION_COMPONENT_ACCOUNTING,
-                                      TimeBody(7200000)));
-    EXPECT_EQ(2u, log.count("Invalid routine", ANDROID_LOG_ERROR));
-    EXPECT_EQ(-5, op->setElector(0x2, Parcel()));
-    EXPECT_TRUE(log.contains("Empty candidates", ANDROID_LOG_ERROR));
+    EXPECT_EQ(-4, sendBuffered(0, 6, ""));
 }

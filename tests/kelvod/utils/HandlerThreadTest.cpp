@@ -67,7 +67,7 @@ protected:
 
 } // namespace
 
-TEST_F(HandlerThreadTest, DelayedMessageWaitsAndCanBeRemoved) {
+TEST_F(HandlerThreadTest, RemovedMessagesAreNeverHandledNorWaitedFor) {
     sp<RecordingThread> t = new RecordingThread();
     int32_t late = t->sendMessageDelayed(ms2ns(300), makeMessage(1, 1));
     int32_t removed = t->sendMessageDelayed(ms2ns(300), makeMessage(1, 2));
@@ -85,6 +85,18 @@ TEST_F(HandlerThreadTest, DelayedMessageWaitsAndCanBeRemoved) {
     EXPECT_EQ(-4, t->removeMessage(removed));
     EXPECT_TRUE(log.contains("removeMessage# Invalid message id[" + std::to_string(late) +
                              "] in RecordingThread", ANDROID_LOG_ERROR));
+
+    // The synchronous waiter of a removed message returns at once.
+    t->sendMessage(makeMessage(10, 0));
+    ASSERT_TRUE(waitFor([&] { return t->count() == 2; }));
+    auto start = std::chrono::steady_clock::now();
+    std::thread waiter([&] { EXPECT_EQ(-1, t->sendMessageSync(makeMessage(8, 1))); });
+    std::this_thread::sleep_for(std::chrono::milliseconds(50));
+    t->removeAllMessages();
+    waiter.join();
+    // Far below the 20 s time-out.
+    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
+    t->mRelease = true;
     t->requestThreadExit();
 }
 
@@ -156,21 +168,6 @@ TEST_F(HandlerThreadTest, AfterExitSendsAreRefusedAndQueuedMessagesDropped) {
     EXPECT_TRUE(log.contains("RecordingThread is pending to exit", ANDROID_LOG_ERROR));
     EXPECT_EQ(refused + 2, kelvo::HealthCounters::get(kelvo::Health::MessagesRefused));
     EXPECT_EQ(dropped + 2, kelvo::HealthCounters::get(kelvo::Health::MessagesDropped));
-}
-
-TEST_F(HandlerThreadTest, SynchronousWaiterOfADroppedMessageReturnsAtOnce) {
-    sp<RecordingThread> t = new RecordingThread();
-    t->sendMessage(makeMessage(10, 0));
-    ASSERT_TRUE(waitFor([&] { return t->count() == 1; }));
-    auto start = std::chrono::steady_clock::now();
-    std::thread waiter([&] { EXPECT_EQ(-1, t->sendMessageSync(makeMessage(8, 1))); });
-    std::this_thread::sleep_for(std::chrono::milliseconds(50));
-    t->removeAllMessages();
-    waiter.join();
-    // Far below the 20 s time-out.
-    EXPECT_LT(std::chrono::steady_clock::now() - start, std::chrono::seconds(10));
-    t->mRelease = true;
-    t->requestThreadExit();
 }
 
 TEST_F(HandlerThreadTest, DeliversInOrderWithIdsThatWrapToZeroAndSkipPendingOnes) {

@@ -17,11 +17,7 @@ namespace {
 constexpr uint32_t kPackagesForUid = 34;
 
 std::vector<String8> names(std::initializer_list<const char*> list) {
-    std::vector<String8> out;
-    for (const char* name : list) {
-        out.push_back(String8(name));
-    }
-    return out;
+    return std::vector<String8>(list.begin(), list.end());
 }
 
 std::string combined(std::initializer_list<const char*> list) {
@@ -30,16 +26,12 @@ std::string combined(std::initializer_list<const char*> list) {
     return out.string();
 }
 
-std::string byUid(int32_t uid, int32_t* ret = nullptr) {
+// The name of a uid, or of a uid's process when a pid is given.
+std::string byUid(int32_t uid, int32_t* ret = nullptr, int32_t pid = -1) {
     String8 out;
-    int32_t r = PackageProperty::getInstance()->queryPackageByUid(uid, out);
-    if (ret != nullptr) *ret = r;
-    return out.string();
-}
-
-std::string byUidAndPid(int32_t uid, int32_t pid, int32_t* ret = nullptr) {
-    String8 out;
-    int32_t r = PackageProperty::getInstance()->queryPackageByUidAndPid(uid, pid, out);
+    PackageProperty* property = PackageProperty::getInstance();
+    int32_t r = pid < 0 ? property->queryPackageByUid(uid, out)
+                        : property->queryPackageByUidAndPid(uid, pid, out);
     if (ret != nullptr) *ret = r;
     return out.string();
 }
@@ -76,7 +68,7 @@ TEST_F(PackagePropertyTest, NamesAUidFromThePackageServiceAndCachesIt) {
     int32_t uid = use(10061);
     state().setPackages(uid, {"com.example.mail"});
     EXPECT_EQ("com.example.mail", byUid(uid));
-    EXPECT_EQ("com.example.mail", byUidAndPid(uid, 4321));
+    EXPECT_EQ("com.example.mail", byUid(uid, nullptr, 4321));
     EXPECT_EQ(1, state().calls("package", kPackagesForUid));
 
     int32_t several = use(10062);
@@ -109,23 +101,24 @@ TEST_F(PackagePropertyTest, ProcessesAndFixedUidsNameSharedUids) {
                           {6001, 10080, "com.example.browser:sandboxed", {"com.example.browser"}}});
     // No CPU handler and no running process: the fixed name wins, unless
     // the fixed uid holds one package.
-    EXPECT_EQ("system", byUidAndPid(system, 1234));
-    EXPECT_EQ("com.example.phone", byUidAndPid(radio, 1234));
-    EXPECT_EQ("com.example.b", byUidAndPid(shared, 5001));
+    EXPECT_EQ("system", byUid(system, nullptr, 1234));
+    EXPECT_EQ("com.example.phone", byUid(radio, nullptr, 1234));
+    EXPECT_EQ("com.example.b", byUid(shared, nullptr, 5001));
     // A pid of another uid does not count: the packages are combined.
-    EXPECT_EQ("com.example.a|com.example.b", byUidAndPid(shared, 5002));
+    EXPECT_EQ("com.example.a|com.example.b", byUid(shared, nullptr, 5002));
     // An isolated process is named by its process.
-    EXPECT_EQ("com.example.browser", byUidAndPid(isolated, 6001));
+    EXPECT_EQ("com.example.browser", byUid(isolated, nullptr, 6001));
     int32_t ret = 0;
-    EXPECT_EQ("", byUidAndPid(isolated, 6002, &ret));
+    EXPECT_EQ("", byUid(isolated, &ret, 6002));
     EXPECT_EQ(-4, ret);
 }
 
-TEST_F(PackagePropertyTest, AddedPackageDoesNotHideTheOthersOfAnUncachedUid) {
+TEST_F(PackagePropertyTest, AddedAndRemovedPackagesKeepTheCacheTrue) {
     PackageProperty* property = PackageProperty::getInstance();
     int32_t uid = use(1000);
     state().setPackages(uid, {"android", "com.example.settings"});
-    // The event comes before anything asked for the uid.
+    // An added package does not hide the others of an uncached uid (the
+    // event comes before anything asked for the uid).
     ASSERT_EQ(0, property->addPackage(uid, String8("com.example.new")));
     std::vector<String8> out;
     ASSERT_EQ(0, property->queryPackagesByUid(uid, out));
@@ -140,14 +133,12 @@ TEST_F(PackagePropertyTest, AddedPackageDoesNotHideTheOthersOfAnUncachedUid) {
     ASSERT_EQ(0, property->queryPackagesByUid(uid, out));
     EXPECT_EQ(names({"android", "com.example.settings", "com.example.new"}), out);
     EXPECT_EQ(calls, state().calls("package", kPackagesForUid));
-}
 
-TEST_F(PackagePropertyTest, RemovingAPackageOrUidAsksTheServiceAgain) {
-    PackageProperty* property = PackageProperty::getInstance();
-    int32_t uid = use(10090);
+    // Removing a package or the uid asks the service again.
+    uid = use(10090);
     state().setPackages(uid, {"com.example.old"});
     EXPECT_EQ("com.example.old", byUid(uid));
-    int32_t calls = state().calls("package", kPackagesForUid);
+    calls = state().calls("package", kPackagesForUid);
 
     // A name the uid does not hold keeps the cache.
     ASSERT_EQ(0, property->removePackage(uid, String8("com.example.other")));
@@ -172,7 +163,7 @@ TEST_F(PackagePropertyTest, MissingPackageServiceFailsFast) {
     std::vector<String8> out;
     EXPECT_EQ(-2, PackageProperty::getInstance()->queryPackagesByUid(uid, out));
     int32_t ret = 0;
-    byUidAndPid(uid, 1, &ret);
+    byUid(uid, &ret, 1);
     EXPECT_EQ(-2, ret);
     // A fixed uid still has its name.
     EXPECT_EQ("bluetooth", byUid(use(1002)));

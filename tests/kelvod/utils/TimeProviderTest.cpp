@@ -22,30 +22,17 @@ std::string duration(TimeProvider provider) {
     return provider.toString(kelvo::TIME_FORMAT_DURATION, false);
 }
 
-// Switches the process time zone for one test and puts the old one back.
+// Switches the process time zone for one test, back to none after it.
 class TimeProviderZoneTest : public ::testing::Test {
 protected:
-    void SetUp() override {
-        const char* tz = getenv("TZ");
-        mHadZone = tz != nullptr;
-        mOldZone = mHadZone ? tz : "";
-    }
     void TearDown() override {
-        if (mHadZone) {
-            setenv("TZ", mOldZone.c_str(), 1);
-        } else {
-            unsetenv("TZ");
-        }
+        unsetenv("TZ");
         tzset();
     }
     static void useZone(const char* zone) {
         setenv("TZ", zone, 1);
         tzset();
     }
-
-private:
-    bool mHadZone = false;
-    std::string mOldZone;
 };
 
 TEST(TimeProviderTest, DurationsRoundMillisecondsAndFloorNegativeTimes) {

@@ -38,9 +38,7 @@ public:
 std::set<int> openTimerFds() {
     std::set<int> fds;
     DIR* dir = opendir("/proc/self/fd");
-    if (dir == nullptr) {
-        return fds;
-    }
+    if (dir == nullptr) return fds;
     while (struct dirent* entry = readdir(dir)) {
         std::string path = std::string("/proc/self/fd/") + entry->d_name;
         char target[64] = {};
