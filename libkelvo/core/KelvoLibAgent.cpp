@@ -3,6 +3,7 @@
 #include <mutex>
 
 #include "LibKelvoLog.h"
+#include "accounters/CpuAccounter.h"
 #include "SqlTypes.h"
 
 namespace kelvo {
@@ -22,8 +23,15 @@ namespace {
 // The built-in accounter of each type. A type whose accounter does not exist
 // yet has an empty entry.
 KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
-    static const KelvoLibAgent::AccounterFactory kFactories[ACCOUNTER_TYPE_COUNT] = {};
-    return kFactories[type];
+    switch (type) {
+        case ACCOUNTER_CPU:
+            return [] {
+                return std::make_unique<CpuAccounter>(
+                        KelvoLibAgent::getInstance()->getSystemBootTime());
+            };
+        default:
+            return nullptr;
+    }
 }
 
 } // namespace
