@@ -289,6 +289,11 @@ int BufferedLogServer::handleEvent(int fd, int events, void*) {
     return 1;
 }
 
+int BufferedLogServer::getListenFd() {
+    std::lock_guard<std::mutex> guard(mLock);
+    return mListenFd;
+}
+
 bool BufferedLogServer::isTrustedPeer(int fd) {
     ucred cred;
     socklen_t len = sizeof(cred);

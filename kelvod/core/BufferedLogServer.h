@@ -66,6 +66,8 @@ public:
     int32_t sendLogMessage(const android::String8& name, const uint8_t* entry, size_t size);
 
     int handleEvent(int fd, int events, void* data) override;
+    // The listening descriptor; -1 when there is none.
+    int getListenFd();
 
     // Reads one entry from a client socket into entry (header and data). 0;
     // 1 at a clean end of stream before the entry; -14 for a failed or short

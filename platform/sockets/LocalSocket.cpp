@@ -86,6 +86,10 @@ extern "C" int socket_local_server(const char* name, int namespaceId, int type) 
         errno = saved;
         return -1;
     }
+    if (!file.empty()) {
+        // Reachable by every user, as an abstract socket is.
+        chmod(file.c_str(), 0666);
+    }
     return fd;
 }
 
