@@ -119,4 +119,4 @@ void BM_BufferedLogEntries(benchmark::State& state) {
 }
 BENCHMARK(BM_BufferedLogEntries)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
 
-} // namespace
+}  // namespace

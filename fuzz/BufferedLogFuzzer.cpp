@@ -27,7 +27,7 @@ void check(bool condition) {
 // Small enough to sit in the socket's buffer whole.
 constexpr size_t kMaxInput = 64 * 1024;
 
-} // namespace
+}  // namespace
 
 extern "C" int LLVMFuzzerTestOneInput(const uint8_t* data, size_t size) {
     if (size > kMaxInput) {

@@ -45,7 +45,7 @@ void setTimeout(int fd, int option, int timeoutMs) {
     setsockopt(fd, SOL_SOCKET, option, &tv, sizeof(tv));
 }
 
-} // namespace
+}  // namespace
 
 BufferedLogServer* BufferedLogServer::getInstance() {
     static std::mutex lock;
@@ -54,7 +54,7 @@ BufferedLogServer* BufferedLogServer::getInstance() {
     std::lock_guard<std::mutex> guard(lock);
     if (instance == nullptr) {
         instance = new android::sp<BufferedLogServer>(
-                new BufferedLogServer("BufferedLogServer", kDefaultIoTimeoutMs));
+            new BufferedLogServer("BufferedLogServer", kDefaultIoTimeoutMs));
     }
     return instance->get();
 }
@@ -125,8 +125,8 @@ int32_t BufferedLogServer::registerLogReceiver(const android::sp<LogReceiver>& r
     bool added;
     {
         std::lock_guard<std::mutex> guard(mLock);
-        added = mReceivers.emplace(std::make_pair(std::string(name.string()), magic), receiver)
-                        .second;
+        added =
+            mReceivers.emplace(std::make_pair(std::string(name.string()), magic), receiver).second;
     }
     if (!added) {
         KLOGE("This type(%s) or magic(%d) has been registered", name.string(), magic);
@@ -160,8 +160,8 @@ int32_t BufferedLogServer::sendLogMessage(const android::String8& name, const ui
     }
     if (receiver == nullptr) {
         HealthCounters::add(Health::BufferedEntryRefused);
-        KLOGE("No receiver to receive message (name=%s%d, type=%s, magic=%d)", name.string(),
-              magic, name.string(), magic);
+        KLOGE("No receiver to receive message (name=%s%d, type=%s, magic=%d)", name.string(), magic,
+              name.string(), magic);
         return -4;
     }
     receiver->onLogReceived(name, entry, size);
@@ -204,7 +204,7 @@ int32_t BufferedLogServer::requestLogMessage(const android::String8& name, int32
         while (written < entry.size()) {
             // The socket's send time-out bounds every wait.
             ssize_t n = TEMP_FAILURE_RETRY(
-                    send(fd, entry.data() + written, entry.size() - written, MSG_NOSIGNAL));
+                send(fd, entry.data() + written, entry.size() - written, MSG_NOSIGNAL));
             if (n <= 0) {
                 break;
             }
@@ -261,7 +261,7 @@ int BufferedLogServer::handleEvent(int fd, int events, void*) {
         std::lock_guard<std::mutex> guard(mLock);
         listener = fd == mListenFd;
         if (!listener && mClients.count(fd) == 0) {
-            return 1; // already removed
+            return 1;  // already removed
         }
     }
     const int failure = android::Looper::EVENT_ERROR | android::Looper::EVENT_HANGUP |
@@ -436,4 +436,4 @@ void BufferedLogServer::removeClientLocked(int fd) {
     }
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -3,15 +3,14 @@
 #include <stddef.h>
 #include <stdint.h>
 #include <sys/types.h>
+#include <utils/Looper.h>
+#include <utils/String8.h>
 
 #include <map>
 #include <mutex>
 #include <string>
 #include <utility>
 #include <vector>
-
-#include <utils/Looper.h>
-#include <utils/String8.h>
 
 #include "core/LogReceiver.h"
 #include "utils/FdObserver.h"
@@ -76,7 +75,7 @@ public:
 
 private:
     struct Client {
-        std::string name; // empty until authenticated
+        std::string name;  // empty until authenticated
     };
 
     void acceptClient();
@@ -102,4 +101,4 @@ private:
     std::mutex mWriteLock;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

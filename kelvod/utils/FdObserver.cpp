@@ -60,4 +60,4 @@ bool FdObserver::threadLoop() {
     return true;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -26,4 +26,4 @@ private:
     android::sp<android::Looper> mLooper;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -18,7 +18,7 @@ int64_t nowMs() {
     return static_cast<int64_t>(ts.tv_sec) * 1000 + ts.tv_nsec / 1000000;
 }
 
-} // namespace
+}  // namespace
 
 BufferedLogClient::~BufferedLogClient() {
     close();
@@ -153,4 +153,4 @@ void BufferedLogClient::close() {
     }
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -1,5 +1,4 @@
 #include <cutils/sockets.h>
-
 #include <errno.h>
 #include <stddef.h>
 #include <string.h>
@@ -62,7 +61,7 @@ bool makeAddress(const char* name, int namespaceId, sockaddr_un* addr, socklen_t
     return true;
 }
 
-} // namespace
+}  // namespace
 
 extern "C" int socket_local_server(const char* name, int namespaceId, int type) {
     sockaddr_un addr;

@@ -26,7 +26,9 @@ public:
     int connect(const std::string& name);
     // Sends one entry; 0, or -1 with errno set.
     int send(int32_t magic, const void* data, size_t size);
-    int send(int32_t magic, const std::string& data) { return send(magic, data.data(), data.size()); }
+    int send(int32_t magic, const std::string& data) {
+        return send(magic, data.data(), data.size());
+    }
     // Sends bytes as they are (several entries in one write, or broken ones).
     int sendRaw(const void* data, size_t size);
     // Waits at most timeoutMs for the next entry from the daemon. 0; or -1
@@ -49,4 +51,4 @@ private:
     int mFd = -1;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

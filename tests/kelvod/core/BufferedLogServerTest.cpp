@@ -81,7 +81,7 @@ protected:
     sp<EntryRecorder> mRecorder;
 };
 
-} // namespace
+}  // namespace
 
 TEST_F(BufferedLogServerTest, ClientsAreAuthenticatedByTheirExactName) {
     LogCapture log;
@@ -91,8 +91,8 @@ TEST_F(BufferedLogServerTest, ClientsAreAuthenticatedByTheirExactName) {
     ASSERT_TRUE(gotCount(1));
     // Parts of a name, a longer one, a taken one and one past 64 bytes.
     uint64_t refused = HealthCounters::get(Health::BufferedClientRefused);
-    for (const std::string& name : std::vector<std::string>{"driver", "kelvo_driver1", "kelvo_driver",
-                                                            std::string(65, 'x')}) {
+    for (const std::string& name : std::vector<std::string>{"driver", "kelvo_driver1",
+                                                            "kelvo_driver", std::string(65, 'x')}) {
         BufferedLogClient other;
         ASSERT_EQ(0, other.connect(name));
         EXPECT_TRUE(other.waitClosed(5000)) << name;
@@ -103,8 +103,7 @@ TEST_F(BufferedLogServerTest, ClientsAreAuthenticatedByTheirExactName) {
     EXPECT_EQ(refused + 3, HealthCounters::get(Health::BufferedClientRefused));
     ASSERT_EQ(0, first.send(0, "b"));
     ASSERT_TRUE(gotCount(2));
-    EXPECT_EQ((std::vector<std::string>{"kelvo_driver:1:a", "kelvo_driver:0:b"}),
-              mRecorder->got());
+    EXPECT_EQ((std::vector<std::string>{"kelvo_driver:1:a", "kelvo_driver:0:b"}), mRecorder->got());
 }
 
 TEST_F(BufferedLogServerTest, EntriesWrittenBeforeCloseArriveWholeAndInOrder) {
@@ -132,8 +131,9 @@ TEST_F(BufferedLogServerTest, BadEntriesDisconnectOnlyTheirClient) {
         const char* error;
     };
     const int32_t cap = static_cast<int32_t>(BufferedLogServer::kMaxEntryLength);
-    for (Case c : {Case{4, 5, "No receiver to receive message (name=kelvo_driver5, "
-                              "type=kelvo_driver, magic=5)"},
+    for (Case c : {Case{4, 5,
+                        "No receiver to receive message (name=kelvo_driver5, "
+                        "type=kelvo_driver, magic=5)"},
                    Case{-1, 0, "Invalid message length: -1"},
                    Case{INT32_MAX, 0, "Invalid message length: 2147483647"},
                    Case{cap + 1, 0, "Invalid message length: 1048577"}}) {
@@ -190,9 +190,8 @@ TEST_F(BufferedLogServerTest, RequestsReachTheNamedClientOrFail) {
     }
     EXPECT_EQ(-14, ret);
     EXPECT_TRUE(log.contains("Failed to write: ", ANDROID_LOG_ERROR));
-    EXPECT_TRUE(waitFor([&] {
-        return mServer->requestLogMessage(String8("Pelmora"), 0, "x", 1) == -10;
-    }));
+    EXPECT_TRUE(
+        waitFor([&] { return mServer->requestLogMessage(String8("Pelmora"), 0, "x", 1) == -10; }));
 }
 
 TEST_F(BufferedLogServerTest, UntrustedPeersAndClientsOverTheCapAreRefused) {
@@ -214,9 +213,9 @@ TEST_F(BufferedLogServerTest, UntrustedPeersAndClientsOverTheCapAreRefused) {
         if (child == 0) {
             BufferedLogClient untrusted;
             _exit(setuid(4242) == 0 && untrusted.connect("Pelmora") == 0 &&
-                                  untrusted.waitClosed(5000)
-                          ? 0
-                          : 1);
+                          untrusted.waitClosed(5000)
+                      ? 0
+                      : 1);
         }
         int status = -1;
         ASSERT_EQ(child, waitpid(child, &status, 0));
