@@ -207,12 +207,14 @@ TEST_F(BufferedLogServerTest, UntrustedPeersAndClientsOverTheCapAreRefused) {
     EXPECT_FALSE(quiet.front()->waitClosed(50));
     quiet.clear();
     if (getuid() == 0) {
-        // A peer of another user, connected from a child process.
+        // A peer of another user, connected from a child process; it is
+        // refused before it could name itself.
+        LogCapture log;
         chmod(mRoot.path().c_str(), 0755);
         pid_t child = fork();
         if (child == 0) {
             BufferedLogClient untrusted;
-            _exit(setuid(4242) == 0 && untrusted.connect("Pelmora") == 0 &&
+            _exit(setuid(4242) == 0 && untrusted.connect("") == 0 &&
                           untrusted.waitClosed(5000)
                       ? 0
                       : 1);
@@ -220,6 +222,7 @@ TEST_F(BufferedLogServerTest, UntrustedPeersAndClientsOverTheCapAreRefused) {
         int status = -1;
         ASSERT_EQ(child, waitpid(child, &status, 0));
         EXPECT_EQ(0, status);
+        EXPECT_TRUE(log.contains("Refused client of uid 4242", ANDROID_LOG_ERROR));
         EXPECT_EQ(refused + 2, HealthCounters::get(Health::BufferedClientRefused));
     }
 }
