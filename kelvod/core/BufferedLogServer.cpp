@@ -178,10 +178,12 @@ int32_t BufferedLogServer::requestLogMessage(const android::String8& name, int32
     // a client removed meanwhile keeps its socket until the write is done,
     // and its descriptor number is never written into after reuse.
     int fd = -1;
+    int clientFd = -1;
     {
         std::lock_guard<std::mutex> guard(mLock);
         for (const auto& client : mClients) {
             if (client.second.name == name.string()) {
+                clientFd = client.first;
                 fd = fcntl(client.first, F_DUPFD_CLOEXEC, 0);
                 break;
             }
@@ -221,7 +223,7 @@ int32_t BufferedLogServer::requestLogMessage(const android::String8& name, int32
         return -14;
     }
     close(fd);
-    KLOGM(LOG_MODULE_BUFFEREDLOG, "Send message(%s) to %d", name.string(), fd);
+    KLOGM(LOG_MODULE_BUFFEREDLOG, "Send message(%s) to %d", name.string(), clientFd);
     return 0;
 }
 

@@ -214,10 +214,8 @@ TEST_F(BufferedLogServerTest, UntrustedPeersAndClientsOverTheCapAreRefused) {
         pid_t child = fork();
         if (child == 0) {
             BufferedLogClient untrusted;
-            _exit(setuid(4242) == 0 && untrusted.connect("") == 0 &&
-                          untrusted.waitClosed(5000)
-                      ? 0
-                      : 1);
+            _exit(setuid(4242) == 0 && untrusted.connect("") == 0 && untrusted.waitClosed(5000) ? 0
+                                                                                                : 1);
         }
         int status = -1;
         ASSERT_EQ(child, waitpid(child, &status, 0));
