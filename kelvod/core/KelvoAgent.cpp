@@ -9,6 +9,7 @@
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "binder/managers/BatteryManager.h"
+#include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "storage/DataUploader.h"
@@ -133,6 +134,8 @@ int32_t KelvoAgent::initiate() {
     startLibrary();
     publishService();
     startBatteryListener();
+    // Listening before any operator registers for its entries.
+    BufferedLogServer::getInstance()->start();
     initRoutines();
     initHandlers();
     return startDispatcher();

@@ -28,6 +28,12 @@ int32_t FdObserver::removeFd(int fd) {
     return mLooper->removeFd(fd) == 1 ? 0 : -2;
 }
 
+void FdObserver::stop() {
+    requestExit();
+    mLooper->wake();
+    join();
+}
+
 bool FdObserver::threadLoop() {
     if (mLooper == nullptr) {
         KLOGE("mLooper is NULL");
@@ -37,7 +43,9 @@ bool FdObserver::threadLoop() {
         case android::Looper::POLL_CALLBACK:
             break;
         case android::Looper::POLL_WAKE:
-            KLOGE("POLL_WAKE");
+            if (!exitPending()) {
+                KLOGE("POLL_WAKE");
+            }
             break;
         case android::Looper::POLL_TIMEOUT:
             KLOGE("POLL_TIMEOUT");
@@ -52,4 +60,4 @@ bool FdObserver::threadLoop() {
     return true;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

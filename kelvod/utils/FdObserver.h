@@ -15,6 +15,8 @@ public:
     // 0, or -2 when the looper refused.
     int32_t addFd(int fd, const android::sp<android::LooperCallback>& callback);
     int32_t removeFd(int fd);
+    // Ends the thread and waits for it (from the thread itself: no wait).
+    void stop();
 
     void onFirstRef() override;
     bool threadLoop() override;
@@ -24,4 +26,4 @@ private:
     android::sp<android::Looper> mLooper;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

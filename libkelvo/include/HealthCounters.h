@@ -25,6 +25,7 @@ enum class Health : uint32_t {
     MessagesDropped,         // queued messages dropped by a stopping thread
     MessagesRefused,         // messages refused by a thread that was not accepting
     FilesDeleted,            // database or backup files deleted by a clean
+    BufferedClientRefused,   // buffered-log peer refused (untrusted uid, client cap)
     Count
 };
 

@@ -19,9 +19,11 @@ fi
 sleep 0.3
 names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
 echo "threads: $names"
-for expected in kelvod KelvoStorage; do
+for expected in kelvod KelvoStorage BufferedLogServ; do
     case " $names " in *" $expected "*) ;; *) echo "FAIL: no thread $expected"; kill -9 $pid; exit 1;; esac
 done
+# The buffered log socket lies below the root.
+[ -S "$root/dev/socket/KELVO_BUFFERED_LOG" ] || { echo "FAIL: no buffered log socket"; kill -9 $pid; exit 1; }
 start=$(date +%s%N)
 kill -TERM $pid
 for _ in $(seq 1 40); do
