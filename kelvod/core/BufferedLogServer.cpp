@@ -10,6 +10,8 @@
 
 #include <cstring>
 
+#include <utils/Timers.h>
+
 #include "HealthCounters.h"
 #include "KelvoLog.h"
 
@@ -306,7 +308,9 @@ bool BufferedLogServer::isTrustedPeer(int fd) {
     if (cred.uid == 0 || cred.uid == kSystemUid || cred.uid == mOwnUid) {
         return true;
     }
-    KLOGE("Refused client of uid %u (pid %d)", cred.uid, cred.pid);
+    if (shouldLogRefusal(mLastPeerLogNs)) {
+        KLOGE("Refused client of uid %u (pid %d)", cred.uid, cred.pid);
+    }
     return false;
 }
 
@@ -318,6 +322,18 @@ size_t BufferedLogServer::unauthenticatedCountLocked() const {
     return count;
 }
 
+bool BufferedLogServer::shouldLogRefusal(std::atomic<nsecs_t>& lastLogNs) {
+    // Any local process can connect: refusals are counted, and logged at
+    // most once a minute so they cannot spend the day's error lines.
+    nsecs_t now = systemTime(SYSTEM_TIME_MONOTONIC);
+    nsecs_t last = lastLogNs.load(std::memory_order_relaxed);
+    if (last != 0 && now - last < kRefusalLogIntervalNs) {
+        return false;
+    }
+    lastLogNs.store(now, std::memory_order_relaxed);
+    return true;
+}
+
 void BufferedLogServer::acceptClient() {
     int listenFd;
     {
@@ -327,9 +343,19 @@ void BufferedLogServer::acceptClient() {
     int fd = TEMP_FAILURE_RETRY(accept4(listenFd, nullptr, nullptr, SOCK_CLOEXEC));
     if (fd < 0) {
         int error = errno;
-        KLOGE("Failed to accept socket client: %s", strerror(error));
+        HealthCounters::add(Health::BufferedClientRefused);
         if (error == EBADF || error == ENOTSOCK || error == EINVAL) {
+            KLOGE("Failed to accept socket client: %s", strerror(error));
             recreateListener();
+            return;
+        }
+        // Out of descriptors, say: the pending connection keeps the socket
+        // readable, so back off instead of spinning, and say it once a minute.
+        if (shouldLogRefusal(mLastAcceptLogNs)) {
+            KLOGE("Failed to accept socket client: %s", strerror(error));
+        }
+        if (error == EMFILE || error == ENFILE || error == ENOBUFS || error == ENOMEM) {
+            usleep(kAcceptBackoffUs);
         }
         return;
     }
@@ -345,7 +371,9 @@ void BufferedLogServer::acceptClient() {
     if (mClients.size() >= kMaxClients ||
         unauthenticatedCountLocked() >= kMaxUnauthenticatedClients) {
         HealthCounters::add(Health::BufferedClientRefused);
-        KLOGE("Too many clients: %zu", mClients.size());
+        if (shouldLogRefusal(mLastCapLogNs)) {
+            KLOGE("Too many clients: %zu", mClients.size());
+        }
         close(fd);
         return;
     }

@@ -6,6 +6,7 @@
 #include <utils/Looper.h>
 #include <utils/String8.h>
 
+#include <atomic>
 #include <map>
 #include <mutex>
 #include <string>
@@ -79,6 +80,9 @@ private:
     };
 
     void acceptClient();
+    // True when a refusal of the kind lastLogNs stamps may be logged (once
+    // a minute per kind).
+    bool shouldLogRefusal(std::atomic<nsecs_t>& lastLogNs);
     void recreateListener();
     bool isTrustedPeer(int fd);
     // Reads one entry of the client and hands it on; false when the client
@@ -88,6 +92,14 @@ private:
     void removeClient(int fd);
     void removeClientLocked(int fd);
     size_t unauthenticatedCountLocked() const;
+
+    // A failed accept that is no fault of the socket waits this long before
+    // the next try; refusals are logged at most once an interval.
+    static constexpr useconds_t kAcceptBackoffUs = 100000;
+    static constexpr nsecs_t kRefusalLogIntervalNs = 60000000000LL;
+    std::atomic<nsecs_t> mLastAcceptLogNs{0};
+    std::atomic<nsecs_t> mLastCapLogNs{0};
+    std::atomic<nsecs_t> mLastPeerLogNs{0};
 
     const int mIoTimeoutMs;
     const uid_t mOwnUid;
