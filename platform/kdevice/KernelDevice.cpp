@@ -133,7 +133,9 @@ int socketRequest(int fd, uint32_t request, void* arg, size_t size) {
         errno = error > 0 ? error : EIO;
         return -1;
     }
-    memcpy(arg, bytes.data(), size);
+    if (size > 0) {
+        memcpy(arg, bytes.data(), size);
+    }
     return result;
 }
 

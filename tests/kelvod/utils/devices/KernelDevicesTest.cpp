@@ -140,8 +140,11 @@ TEST_F(KernelDevicesTest, AnswersReadBack) {
     gpu_info_t gpu;
     ASSERT_EQ(0, KelvoDevice::getGpuInfo(&gpu));
     ASSERT_EQ(2, gpu.count);
-    EXPECT_EQ(400000, gpu.entries[1].frequency);
-    EXPECT_EQ(40, gpu.entries[1].idleUs);
+    // The steps are packed: read them by value.
+    int64_t frequency = gpu.entries[1].frequency;
+    int64_t idleUs = gpu.entries[1].idleUs;
+    EXPECT_EQ(400000, frequency);
+    EXPECT_EQ(40, idleUs);
     EXPECT_EQ(2, DpmDevice::getIpCount());
     std::vector<dpm_ip_record_t> records;
     ASSERT_EQ(0, DpmDevice::getIpData(8, &records));
