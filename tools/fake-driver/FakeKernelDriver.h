@@ -1,0 +1,114 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <array>
+#include <functional>
+#include <map>
+#include <mutex>
+#include <optional>
+#include <string>
+#include <thread>
+#include <vector>
+
+namespace kelvo {
+namespace fake {
+
+// A stand-in for the kernel drivers behind "/dev/kelvo" and "/dev/dpm_ldm":
+// serves both sockets below the root (the "ioctl over a socket" protocol of
+// kelvo/KernelDevice.h) from state a test sets, fails chosen requests and
+// records every request it got.
+class FakeKernelDriver {
+public:
+    enum class Device { Kelvo, Dpm };
+
+    struct Request {
+        Device device;
+        uint32_t request;
+        std::vector<uint8_t> argument;  // the bytes as they came in
+    };
+
+    struct GpuStep {
+        int64_t frequency;
+        int64_t busyUs;
+        int64_t idleUs;
+    };
+
+    struct State {
+        // "/dev/kelvo"
+        std::map<uint32_t, bool> flags;  // the switch requests, by number
+        std::vector<GpuStep> gpuSteps;
+        std::optional<int32_t> gpuCount;  // reported instead of the steps' number
+        uint32_t brightness = 0;
+        // Process names by pid; a name of 48 bytes or more fills the field
+        // without a terminator.
+        std::map<int32_t, std::string> processNames;
+        // "/dev/dpm_ldm"
+        int32_t version = 1;
+        int32_t enable = 0;
+        int32_t period = 0;
+        std::vector<std::array<uint8_t, 96>> ipRecords;
+        std::optional<int32_t> ipCount;  // reported instead of the records' number
+        std::array<std::string, 2> ddrNames = {"DDR_FREQ_TIME", "DDR_FREQ_FLUX"};
+        std::array<std::vector<int64_t>, 2> ddrValues;
+        std::optional<int32_t> ddrCount;  // reported instead of the values' number
+    };
+
+    // Report requests (per-process CPU time, kernel workers, uevents, binder
+    // statistics) are handed to this after they are answered; the device
+    // simulator answers them as the buffered-log client of the driver.
+    using RequestListener = std::function<void(const Request&)>;
+
+    FakeKernelDriver() = default;
+    ~FakeKernelDriver();
+    FakeKernelDriver(const FakeKernelDriver&) = delete;
+    FakeKernelDriver& operator=(const FakeKernelDriver&) = delete;
+
+    // Serves "<root>/dev/kelvo" and "<root>/dev/dpm_ldm" under the current
+    // root (a stale file at either path is replaced). false when a socket
+    // cannot be bound.
+    bool start();
+    // Stops serving and removes both sockets.
+    void stop();
+
+    void update(const std::function<void(State&)>& change);
+    State state() const;
+
+    // The request is answered with -1 and the error, or, when hangUp is set,
+    // by closing the connection without a reply.
+    void failRequest(Device device, uint32_t request, int error, bool hangUp = false);
+    void clearFailures();
+
+    std::vector<Request> requests() const;
+    void clearRequests();
+
+    void setRequestListener(RequestListener listener);
+
+private:
+    struct Answer {
+        int32_t result = 0;
+        int32_t error = 0;
+        bool hangUp = false;
+    };
+
+    void serve();
+    void serveConnection(int fd, Device device);
+    // Fills the argument in place for the request.
+    Answer answer(Device device, uint32_t request, std::vector<uint8_t>* argument);
+    Answer answerKelvo(uint32_t request, std::vector<uint8_t>* argument);
+    Answer answerDpm(uint32_t request, std::vector<uint8_t>* argument);
+
+    mutable std::mutex mLock;
+    State mState;
+    std::map<std::pair<Device, uint32_t>, Answer> mFailures;
+    std::vector<Request> mRequests;
+    RequestListener mListener;
+
+    std::string mPaths[2];
+    int mListenFds[2] = {-1, -1};
+    int mStopPipe[2] = {-1, -1};
+    std::thread mThread;
+};
+
+} // namespace fake
+} // namespace kelvo
