@@ -26,6 +26,7 @@ enum class Health : uint32_t {
     MessagesRefused,         // messages refused by a thread that was not accepting
     FilesDeleted,            // database or backup files deleted by a clean
     BufferedClientRefused,   // buffered-log peer refused (untrusted uid, client cap)
+    DeviceAnswersRefused,    // kernel device answers refused or capped (bad value, count, name)
     Count
 };
 

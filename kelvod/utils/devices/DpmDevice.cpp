@@ -4,6 +4,7 @@
 #include <string.h>
 
 #include "DeviceQuery.h"
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 
 namespace kelvo {
@@ -18,6 +19,7 @@ int exchangeValue(const char* file, const char* func, uint32_t request, int32_t 
         return ret;
     }
     if (value < 0) {
+        HealthCounters::add(Health::DeviceAnswersRefused);
         logErrorLine("[%s] %s# Invalid value read: %d", file, func, static_cast<int>(value));
         return -2;
     }
@@ -27,6 +29,7 @@ int exchangeValue(const char* file, const char* func, uint32_t request, int32_t 
 
 int capCount(const char* file, const char* func, int value, int32_t cap) {
     if (value > cap) {
+        HealthCounters::add(Health::DeviceAnswersRefused);
         logErrorLine("[%s] %s# Count %d capped at %d", file, func, value, static_cast<int>(cap));
         return cap;
     }
@@ -90,6 +93,7 @@ int DpmDevice::getIpData(int32_t capacity, std::vector<dpm_ip_record_t>* records
     }
     memcpy(&head, buffer.data(), sizeof(head));
     if (head.count < 0) {
+        HealthCounters::add(Health::DeviceAnswersRefused);
         KLOGE("Invalid value read: %d", static_cast<int>(head.count));
         return -2;
     }

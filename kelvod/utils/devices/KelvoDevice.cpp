@@ -3,6 +3,7 @@
 #include <string.h>
 
 #include "DeviceQuery.h"
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 
 namespace kelvo {
@@ -57,6 +58,7 @@ int KelvoDevice::getGpuInfo(gpu_info_t* info) {
         return ret;
     }
     if (info->count < 0 || info->count > kMaxGpuSteps) {
+        HealthCounters::add(Health::DeviceAnswersRefused);
         KLOGE("Invalid gpu frequency count: %d", static_cast<int>(info->count));
         info->count = 0;
         return -2;
@@ -88,6 +90,7 @@ int KelvoDevice::getProcessName(int32_t pid, const char* threadName, std::string
     }
     size_t length = strnlen(block.processName, sizeof(block.processName));
     if (length == 0) {
+        HealthCounters::add(Health::DeviceAnswersRefused);
         KLOGE("Failed to get process name");
         return -2;
     }

@@ -9,6 +9,7 @@
 #include <vector>
 
 #include "FakeKernelDriver.h"
+#include "HealthCounters.h"
 #include "common/TestEnv.h"
 #include "utils/devices/DpmDevice.h"
 #include "utils/devices/KelvoDevice.h"
@@ -215,7 +216,14 @@ TEST_F(KernelDevicesTest, HostileCounts) {
             s.ipRecords.resize(4);
             cases[i].set(s);
         });
+        // Every refused or capped answer is counted; a good answer or a bad
+        // argument of the caller is not.
+        uint64_t refused = kelvo::HealthCounters::get(kelvo::Health::DeviceAnswersRefused);
         EXPECT_EQ(cases[i].expected, cases[i].call()) << "case " << i;
+        bool counted = cases[i].expected != 0 && cases[i].expected != -5;
+        EXPECT_EQ(refused + (counted ? 1 : 0),
+                  kelvo::HealthCounters::get(kelvo::Health::DeviceAnswersRefused))
+                << "case " << i;
     }
 }
 
