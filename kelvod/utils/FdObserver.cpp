@@ -43,8 +43,10 @@ bool FdObserver::threadLoop() {
         case android::Looper::POLL_CALLBACK:
             break;
         case android::Looper::POLL_WAKE:
+            // A wake is no fault: the looper is woken to stop, or to rebuild
+            // its descriptor set after a descriptor went away.
             if (!exitPending()) {
-                KLOGE("POLL_WAKE");
+                KLOGD("POLL_WAKE");
             }
             break;
         case android::Looper::POLL_TIMEOUT:
