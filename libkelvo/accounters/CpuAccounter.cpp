@@ -6,6 +6,7 @@
 #include <limits>
 
 #include "AccounterTypes.h"
+#include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "LibKelvoLog.h"
 #include "allocators/AccounterData.h"
@@ -281,6 +282,11 @@ int32_t CpuAccounter::onActionForeground(const Parcel& action) {
     // first, but the current state still follows the latest change.
     const bool known = mEvents.find(timestamp) != mEvents.end();
     if (!known && timestamp >= mLastAccountTime) {
+        // Changes with no pass to use them: the oldest goes, counted.
+        if (mEvents.size() >= kMaxEvents) {
+            mEvents.erase(mEvents.begin());
+            HealthCounters::add(Health::AccounterEventsDropped);
+        }
         mEvents[timestamp] = polling_event{mScreenOn, mForeground};
     }
     mScreenOn = name != String8(kScreenOffName);

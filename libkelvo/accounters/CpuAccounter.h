@@ -80,6 +80,8 @@ private:
     int64_t mIdlePower;
     // Per cluster, the power of each frequency step; never changed by a pass.
     std::vector<std::vector<int32_t>> mClusterPowers;
+    // At most this many foreground changes wait for their pass.
+    static constexpr size_t kMaxEvents = 1024;
     std::map<int64_t, polling_event> mEvents;
     // Pass shapes (step count per cluster) that differed from the profile
     // and were logged.

@@ -27,6 +27,7 @@ enum class Health : uint32_t {
     FilesDeleted,            // database or backup files deleted by a clean
     BufferedClientRefused,   // buffered-log peer refused (untrusted uid, client cap)
     DeviceAnswersRefused,    // kernel device answers refused or capped (bad value, count, name)
+    AccounterEventsDropped,  // oldest timeline events dropped by an accounter at its cap
     Count
 };
 

@@ -15,7 +15,7 @@ const char* const kHealthNames[] = {
         "error_lines_suppressed",    "error_rows_dropped",      "flush_rows_abandoned",
         "inserts_deferred",          "upload_failures",         "upload_records_refused",
         "messages_dropped",          "messages_refused",        "files_deleted",
-        "buffered_client_refused",   "device_answers_refused",
+        "buffered_client_refused",   "device_answers_refused",  "accounter_events_dropped",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

@@ -29,10 +29,8 @@ struct Cluster {
 class CpuAccounterTest : public ::testing::Test {
 protected:
     void SetUp() override {
-        std::string here = __FILE__;
         mRoot.writeFile("/data/misc/kelvo/tv_kelvo_config.xml",
-                        readHostFile(here.substr(0, here.rfind("tests/libkelvo/")) +
-                                     "config/tv_kelvo_config.xml"));
+                        readHostFile(KELVO_SAMPLE_CONFIG));
         XmlParser::resetInstance();
         KelvoLibAgent::getInstance()->resetAccountersForTest();
         KelvoLibAgent::getInstance()->start(500);
@@ -171,6 +169,13 @@ TEST_F(CpuAccounterTest, ForegroundTimeline) {
     EXPECT_EQ(-1, withApp(1050, 1)); // before the balanced start
     ASSERT_EQ(0, withApp(1200, 1));
     EXPECT_EQ(component(1100, 1200, 100, 1, 100, 1, true), mListener->mReplies[4].bytes);
+
+    // Changes that no pass takes are capped: the oldest goes, counted.
+    uint64_t dropped = HealthCounters::get(Health::AccounterEventsDropped);
+    for (int64_t t = 2000; t < 2000 + 1025; ++t) ASSERT_EQ(0, foreground(t, "com.a"));
+    EXPECT_EQ(dropped + 1, HealthCounters::get(Health::AccounterEventsDropped));
+    EXPECT_EQ(-1, withApp(2000, 0));
+    EXPECT_EQ(0, withApp(2001, 0));
 }
 
 } // namespace

@@ -286,9 +286,7 @@ TEST_F(XmlParserTest, LookupsNeedAUsableFile) {
 // The sample answers every request the library and the daemon make, with
 // the shape each reader needs, and without one error line.
 TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
-    std::string here = __FILE__;
-    std::string sample = readHostFile(here.substr(0, here.rfind("tests/libkelvo/utils/")) +
-                                      "config/tv_kelvo_config.xml");
+    std::string sample = readHostFile(KELVO_SAMPLE_CONFIG);
     ASSERT_FALSE(sample.empty());
     mRoot.writeFile(kDataPath, sample);
     struct Request {
