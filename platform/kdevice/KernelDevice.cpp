@@ -18,20 +18,6 @@ namespace kelvo {
 
 namespace {
 
-void putUint32(uint8_t* at, uint32_t value) {
-    for (int i = 0; i < 4; ++i) {
-        at[i] = static_cast<uint8_t>(value >> (8 * i));
-    }
-}
-
-uint32_t getUint32(const uint8_t* at) {
-    uint32_t value = 0;
-    for (int i = 0; i < 4; ++i) {
-        value |= static_cast<uint32_t>(at[i]) << (8 * i);
-    }
-    return value;
-}
-
 // Waits until the socket is ready for the events; false with errno set on a
 // time-out (ETIMEDOUT) or an error.
 bool waitReady(int fd, short events) {
@@ -111,8 +97,8 @@ int connectSocket(const std::string& path) {
 
 int socketRequest(int fd, uint32_t request, void* arg, size_t size) {
     uint8_t header[8];
-    putUint32(header, request);
-    putUint32(header + 4, static_cast<uint32_t>(size));
+    KernelDevice::putUint32(header, request);
+    KernelDevice::putUint32(header + 4, static_cast<uint32_t>(size));
     if (!sendAll(fd, header, sizeof(header)) ||
         !sendAll(fd, static_cast<const uint8_t*>(arg), size)) {
         return -1;
@@ -127,8 +113,8 @@ int socketRequest(int fd, uint32_t request, void* arg, size_t size) {
     if (!receiveAll(fd, reinterpret_cast<uint8_t*>(&bytes[0]), size)) {
         return -1;
     }
-    int32_t result = static_cast<int32_t>(getUint32(reply));
-    int32_t error = static_cast<int32_t>(getUint32(reply + 4));
+    int32_t result = static_cast<int32_t>(KernelDevice::getUint32(reply));
+    int32_t error = static_cast<int32_t>(KernelDevice::getUint32(reply + 4));
     if (result < 0) {
         errno = error > 0 ? error : EIO;
         return -1;
@@ -140,6 +126,20 @@ int socketRequest(int fd, uint32_t request, void* arg, size_t size) {
 }
 
 } // namespace
+
+void KernelDevice::putUint32(uint8_t* at, uint32_t value) {
+    for (int i = 0; i < 4; ++i) {
+        at[i] = static_cast<uint8_t>(value >> (8 * i));
+    }
+}
+
+uint32_t KernelDevice::getUint32(const uint8_t* at) {
+    uint32_t value = 0;
+    for (int i = 0; i < 4; ++i) {
+        value |= static_cast<uint32_t>(at[i]) << (8 * i);
+    }
+    return value;
+}
 
 int KernelDevice::open(const char* devicePath) {
     if (devicePath == nullptr) {

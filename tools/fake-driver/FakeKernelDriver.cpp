@@ -86,20 +86,6 @@ bool writeAll(int fd, const uint8_t* data, size_t size) {
     return true;
 }
 
-void putUint32(uint8_t* at, uint32_t value) {
-    for (int i = 0; i < 4; ++i) {
-        at[i] = static_cast<uint8_t>(value >> (8 * i));
-    }
-}
-
-uint32_t getUint32(const uint8_t* at) {
-    uint32_t value = 0;
-    for (int i = 0; i < 4; ++i) {
-        value |= static_cast<uint32_t>(at[i]) << (8 * i);
-    }
-    return value;
-}
-
 // Copies what fits of the bytes into the argument at the offset.
 void putBytes(std::vector<uint8_t>* argument, size_t offset, const void* bytes, size_t size) {
     if (offset >= argument->size()) {
@@ -240,8 +226,8 @@ void FakeKernelDriver::serveConnection(int fd, Device device) {
         if (!readExactly(fd, header, sizeof(header), mStopPipe[0])) {
             return;
         }
-        uint32_t request = getUint32(header);
-        uint32_t size = getUint32(header + 4);
+        uint32_t request = KernelDevice::getUint32(header);
+        uint32_t size = KernelDevice::getUint32(header + 4);
         if (size > KernelDevice::kMaxArgumentBytes) {
             return;
         }
@@ -269,8 +255,8 @@ void FakeKernelDriver::serveConnection(int fd, Device device) {
             return;
         }
         uint8_t head[8];
-        putUint32(head, static_cast<uint32_t>(reply.result));
-        putUint32(head + 4, static_cast<uint32_t>(reply.error));
+        KernelDevice::putUint32(head, static_cast<uint32_t>(reply.result));
+        KernelDevice::putUint32(head + 4, static_cast<uint32_t>(reply.error));
         if (!writeAll(fd, head, sizeof(head)) || !writeAll(fd, argument.data(), argument.size())) {
             return;
         }

@@ -35,6 +35,11 @@ public:
     static int ioctl(int fd, uint32_t request, void* arg, size_t size);
 
     static void close(int fd);
+
+    // The protocol's little-endian 32-bit words, shared with the stand-in
+    // drivers that serve it.
+    static void putUint32(uint8_t* at, uint32_t value);
+    static uint32_t getUint32(const uint8_t* at);
 };
 
 } // namespace kelvo
