@@ -90,6 +90,10 @@ int32_t BufferedLogServer::start() {
 }
 
 void BufferedLogServer::stop() {
+    // The thread goes first: a client it is reading is never closed under it.
+    if (mObserver != nullptr) {
+        mObserver->stop();
+    }
     {
         std::lock_guard<std::mutex> guard(mLock);
         while (!mClients.empty()) {
@@ -100,9 +104,6 @@ void BufferedLogServer::stop() {
             close(mListenFd);
             mListenFd = -1;
         }
-    }
-    if (mObserver != nullptr) {
-        mObserver->stop();
     }
 }
 
