@@ -9,6 +9,7 @@
 #include "core/KelvoAgent.h"
 #include "core/Notifier.h"
 #include "storage/DataUploader.h"
+#include "utils/TimerManager.h"
 
 namespace kelvo {
 
@@ -17,6 +18,8 @@ namespace {
 // Runs lateInitialize on the operator's own thread. Internal: never sent by
 // anyone but initialize().
 constexpr int32_t kLateInitializeMessage = 100;
+// what: timer id; sent to itself when a timer could not be re-armed.
+constexpr int32_t kTimerRearmMessage = 101;
 
 // Request codes of the hourly routine.
 constexpr int32_t kHourlyVote = 0;
@@ -304,6 +307,8 @@ int32_t KelvoOperator::handleParcelMessage(const ParcelMessage& msg) {
             return handleBufferedLog(body);
         case MESSAGE_CUSTOMIZED:
             return handleCustomized(msg.what, body, msg.getReply());
+        case kTimerRearmMessage:
+            return handleTimerRearm(msg.what);
         case kLateInitializeMessage:
             if (mLateInitialized) {
                 KLOGE("Late initialization already done: %s", getName());
@@ -450,6 +455,25 @@ void KelvoOperator::registerDispatcherTag() {}
 void KelvoOperator::setCandidateElector() {}
 int32_t KelvoOperator::checkEnable() { return 0; }
 int32_t KelvoOperator::setConfiguration() { return 0; }
+
+int32_t KelvoOperator::rearmTimer(const android::sp<TimerCallback>& callback, int64_t firstMs,
+                                  int64_t intervalMs) {
+    int32_t ret = TimerManager::getInstance()->rearmTimer(firstMs, intervalMs, callback);
+    if (ret == 0) {
+        return 0;
+    }
+    HealthCounters::add(Health::TimerRearmRetries);
+    int32_t id = callback != nullptr ? callback->getId() : -1;
+    KLOGE("Failed to re-arm timer %d of %s: %d, retrying in %lld ms", id, getName(), ret,
+          static_cast<long long>(kTimerRetryDelayMs));
+    sendMessageDelayed(kTimerRetryDelayMs * 1000000LL, ParcelMessage(kTimerRearmMessage, id));
+    return ret;
+}
+
+int32_t KelvoOperator::handleTimerRearm(int32_t id) {
+    KLOGI("No timer %d to re-arm in %s", id, getName());
+    return 0;
+}
 
 int32_t KelvoOperator::handleTimerExpired(int32_t) {
     KLOGI("Receive timer expired message, please implement this function in subclass");

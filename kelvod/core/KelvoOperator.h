@@ -15,6 +15,7 @@
 #include "core/NotifierListener.h"
 #include "storage/StorageOperator.h"
 #include "utils/HandlerThread.h"
+#include "utils/TimerCallback.h"
 
 namespace kelvo {
 
@@ -120,6 +121,9 @@ public:
     virtual int32_t checkEnable();
     virtual int32_t setConfiguration();
     virtual int32_t handleTimerExpired(int32_t id);
+    // Called kTimerRetryDelayMs after rearmTimer could neither re-arm nor
+    // add a timer of this operator: compute the times again and re-arm.
+    virtual int32_t handleTimerRearm(int32_t id);
     virtual int32_t handleLogger(int64_t time, int32_t tag, const char* text);
     virtual int32_t handleBufferedLog(const android::Parcel& data);
     virtual int32_t handleCustomized(int32_t code, const android::Parcel& data,
@@ -129,7 +133,14 @@ public:
 
     int32_t handleParcelMessage(const ParcelMessage& msg) override;
 
+    static constexpr int64_t kTimerRetryDelayMs = 10000;
+
 protected:
+    // Re-arms one of this operator's timers (TimerManager::rearmTimer); when
+    // that fails it logs, counts, and asks for handleTimerRearm(id) later,
+    // so a timer is never silently lost.
+    int32_t rearmTimer(const android::sp<TimerCallback>& callback, int64_t firstMs,
+                       int64_t intervalMs);
     int32_t handleNotification(int32_t type, const android::Parcel& data);
     // Builds an action for this operator's accounter and hands it over.
     int32_t feedAccounter(const android::Parcel& action);

@@ -135,6 +135,27 @@ int32_t TimerManager::rescheduleTimer(int64_t firstMs, int64_t intervalMs,
     return rescheduleLocked(it, true, firstMs, intervalMs);
 }
 
+int32_t TimerManager::rearmTimer(int64_t firstMs, int64_t intervalMs,
+                                 const android::sp<TimerCallback>& callback) {
+    if (firstMs < 0 || intervalMs < 0 || callback == nullptr) {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    {
+        std::lock_guard<std::mutex> guard(mLock);
+        auto it = mTimers.find(callback);
+        if (it != mTimers.end() && rescheduleLocked(it, true, firstMs, intervalMs) == 0) {
+            return 0;
+        }
+    }
+    // Gone, or erased by the failed reschedule: add it again.
+    int32_t ret = addTimer(firstMs, intervalMs, callback);
+    if (ret != 0) {
+        KLOGE("Failed to add timer %d again: %d", callback->getId(), ret);
+    }
+    return ret;
+}
+
 int64_t TimerManager::getExpireTime(const android::sp<TimerCallback>& callback) {
     if (callback == nullptr) {
         KLOGE("Invalid parameter");

@@ -39,6 +39,11 @@ public:
                             const android::sp<TimerCallback>& callback);
     // Milliseconds until the next expiry, or a negative result.
     int64_t getExpireTime(const android::sp<TimerCallback>& callback);
+    // Arms callback's timer to fire in firstMs, then every intervalMs (0:
+    // once). A timer the manager lost (a failed reschedule erases it) or
+    // never had is added again with the same times. 0, or the add's error.
+    int32_t rearmTimer(int64_t firstMs, int64_t intervalMs,
+                       const android::sp<TimerCallback>& callback);
 
     // For TimerCallback: holds the timer table locked when the callback is
     // still registered with exactly this descriptor; otherwise the returned

@@ -28,6 +28,8 @@ enum class Health : uint32_t {
     BufferedClientRefused,   // buffered-log peer refused (untrusted uid, client cap)
     DeviceAnswersRefused,    // kernel device answers refused or capped (bad value, count, name)
     AccounterEventsDropped,  // oldest timeline events dropped by an accounter at its cap
+    TimerRearmRetries,       // timers that could not be re-armed at once (retried later)
+    ValuesSaturated,         // values clamped to their stored or sent width
     Count
 };
 

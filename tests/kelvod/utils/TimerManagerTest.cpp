@@ -168,6 +168,18 @@ TEST_F(TimerManagerTest, ReArmedTimerIsWatchedAgainAfterTheLooperDroppedIt) {
     EXPECT_TRUE(waitFor([&] { return mThread->timerCount(12) >= 3; }, 2000ms));
 }
 
+TEST_F(TimerManagerTest, RearmAddsATimerTheManagerLost) {
+    sp<TimerCallback> callback = makeCallback(13);
+    // Never added (or erased by a failed reschedule): a plain reschedule
+    // gives up, a re-arm adds it with the same times.
+    EXPECT_EQ(-4, mManager->rescheduleTimer(0, 20, callback));
+    ASSERT_EQ(0, mManager->rearmTimer(0, 20, callback));
+    ASSERT_TRUE(waitFor([&] { return mThread->timerCount(13) >= 2; }, 2000ms));
+    ASSERT_EQ(0, mManager->rearmTimer(60000, 0, callback));
+    EXPECT_GT(mManager->getExpireTime(callback), 50000);
+    EXPECT_EQ(-5, mManager->rearmTimer(-1, 0, callback));
+}
+
 TEST_F(TimerManagerTest, RemovedAndRescheduledTimersRacingTheirExpiriesStayQuiet) {
     LogCapture log;
     constexpr int kTimers = 24;
