@@ -337,7 +337,7 @@ int32_t AppsAccounting::queryAppsComponent(int64_t start, int64_t end,
             continue;
         }
         for (int i = 0; i < 4; ++i) {
-            energy[i] = static_cast<int64_t>(static_cast<double>(energy[i]) * factor);
+            energy[i] = KelvoUtils::scaleEnergy(energy[i], factor);
         }
         android::Parcel fields;
         switch (kKinds[c]) {

@@ -5,6 +5,7 @@
 #include <cerrno>
 #include <cstring>
 
+#include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "kelvo/RootPath.h"
 
@@ -59,6 +60,53 @@ android::String8 KelvoUtils::quoteSqlText(const char* value) {
 
 android::String8 KelvoUtils::quoteSqlIdentifier(const char* name) {
     return quote(name, '"');
+}
+
+
+int64_t KelvoUtils::scaleEnergy(int64_t energy, double ratio) {
+    if (!(ratio > 0.0)) {
+        return energy;
+    }
+    double product = static_cast<double>(energy) * ratio;
+    // 2^63 is exact in double; anything at or past it does not fit.
+    constexpr double kLimit = 9223372036854775808.0;
+    if (product >= kLimit) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT64_MAX;
+    }
+    if (product < -kLimit) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT64_MIN;
+    }
+    return static_cast<int64_t>(product);
+}
+
+int32_t KelvoUtils::saturateInt32(int64_t value) {
+    if (value > INT32_MAX) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT32_MAX;
+    }
+    if (value < INT32_MIN) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT32_MIN;
+    }
+    return static_cast<int32_t>(value);
+}
+
+int32_t KelvoUtils::saturateInt32(double value) {
+    if (value != value) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return 0;
+    }
+    if (value >= 2147483648.0) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT32_MAX;
+    }
+    if (value <= -2147483649.0) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT32_MIN;
+    }
+    return static_cast<int32_t>(value);
 }
 
 } // namespace kelvo

@@ -23,6 +23,16 @@ public:
     static android::String8 quoteSqlText(const char* value);
     // A name as an SQL identifier: in double quotes, every double quote doubled.
     static android::String8 quoteSqlIdentifier(const char* name);
+
+    // An energy scaled by the hour's compensation ratio for an upload: the
+    // product in double, truncated toward zero and clamped to int64. A ratio
+    // of 0 or below means "no battery measurement" and scales by 1.0. Every
+    // uploader scales through it.
+    static int64_t scaleEnergy(int64_t energy, double ratio);
+    // A value narrowed to int32 for a row or an upload field: clamped to
+    // the int32 range (counted as saturated when it had to be).
+    static int32_t saturateInt32(int64_t value);
+    static int32_t saturateInt32(double value);
 };
 
 } // namespace kelvo

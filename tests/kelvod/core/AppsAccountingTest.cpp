@@ -148,6 +148,11 @@ TEST_F(AppsAccountingTest, UploadsTheTopApplicationsInEnergyOrder) {
     EXPECT_TRUE(e["params"].isMember("11"));
     EXPECT_FALSE(e["params"].isMember("12")); // ten applications only
 
+    // An hour without a battery report has ratio 0: energies go unscaled,
+    // never to 0.
+    ASSERT_EQ(0, AppsAccounting::getInstance()->uploadHourlyAppsAccounting(kTen + kHour, 0.0f));
+    EXPECT_EQ(120, sentEvent()["params"]["3"]["params"]["2"]["params"]["4"].asInt64());
+
     // The daily upload takes twenty, the quoted name included, and notes
     // the names in the power log.
     ASSERT_EQ(0, AppsAccounting::getInstance()->uploadDailyAppsAccounting(kTen + kHour, 1.0f));
