@@ -84,6 +84,18 @@ TEST_F(ComponentAccounterTest, FixedPowersComeFromTheProfile) {
         ASSERT_EQ(0, c.off.send());
         EXPECT_EQ(c.replies, replyBytes(*listener));
     }
+    // DeactivateAll: each kind's records carry that kind, not the last read.
+    KelvoLibAgent::getInstance()->resetAccountersForTest();
+    auto listener = listenTo(bt);
+    ASSERT_EQ(0, Fields(bt, ACTION_ACTIVATE).i32(0).i64(0).str("com.a").send());
+    ASSERT_EQ(0, Fields(bt, ACTION_ACTIVATE).i32(3).i64(0).str("com.b").send());
+    ASSERT_EQ(0, Fields(bt, ACTION_ACTIVATE).i32(4).i64(0).str("com.c").send());
+    ASSERT_EQ(0, Fields(bt, ACTION_DEACTIVATE_ALL).i64(1000).send());
+    EXPECT_EQ((std::vector<Bytes>{elementReply(0, 0, 1000, "com.a", screenOnBackground(1000, 12)),
+                                  elementReply(3, 0, 1000, "com.b", screenOnBackground(1000, 8)),
+                                  componentReply(3, 0, 1000, screenOnBackground(1000, 8)),
+                                  elementReply(4, 0, 1000, "com.c", screenOnBackground(1000, 11))}),
+              replyBytes(*listener));
 }
 
 // Receiver: (1500 + 20 V) / 100; speaker: 40 + 6 V; both: the sum. One
