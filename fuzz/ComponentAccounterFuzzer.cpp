@@ -31,7 +31,7 @@ namespace {
 constexpr size_t kMaxFields = 4096;
 
 constexpr int32_t kTypes[] = {
-        kelvo::ACCOUNTER_BRIGHTNESS, kelvo::ACCOUNTER_GNSS,   kelvo::ACCOUNTER_FLASHLIGHT,
+        kelvo::ACCOUNTER_BRIGHTNESS, kelvo::ACCOUNTER_GNSS,      kelvo::ACCOUNTER_FLASHLIGHT,
         kelvo::ACCOUNTER_CAMERA,     kelvo::ACCOUNTER_BLUETOOTH, kelvo::ACCOUNTER_GPU,
         kelvo::ACCOUNTER_SENSOR,     kelvo::ACCOUNTER_AUDIO,
 };

@@ -82,8 +82,8 @@ int32_t GpuAccounter::getPowerValue(int32_t key, const Parcel& action, Parcel& p
     }
     std::vector<gpu_entry> entries(count);
     for (gpu_entry& entry : entries) {
-        if (action.readInt64(&entry.hertz) != NO_ERROR || action.readInt64(&entry.busy) != NO_ERROR ||
-            action.readInt64(&entry.idle) != NO_ERROR) {
+        if (action.readInt64(&entry.hertz) != NO_ERROR ||
+            action.readInt64(&entry.busy) != NO_ERROR || action.readInt64(&entry.idle) != NO_ERROR) {
             return -1;
         }
     }

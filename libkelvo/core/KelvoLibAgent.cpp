@@ -156,7 +156,8 @@ int32_t KelvoLibAgent::setDataAccounter(const android::Parcel& action) {
 }
 
 int32_t KelvoLibAgent::setDisplayEnergyPolicy(int32_t policy) {
-    auto* accounter = dynamic_cast<BrightnessAccounter*>(findAccounter(ACCOUNTER_BRIGHTNESS));
+    auto* accounter =
+            dynamic_cast<BrightnessAccounter*>(findAccounter(ACCOUNTER_BRIGHTNESS));
     if (accounter == nullptr) {
         LLOGE("Failed to find accounter by type: %d", ACCOUNTER_BRIGHTNESS);
         return -1;
