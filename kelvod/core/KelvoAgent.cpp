@@ -12,6 +12,7 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "routines/HourlyRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -27,7 +28,14 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
 
+android::sp<KelvoOperator> makeHourlyRoutine() {
+    return new HourlyRoutine();
+}
+
+// What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
+    Factories() { routines[ROUTINE_HOURLY] = &makeHourlyRoutine; }
+
     std::mutex lock;
     KelvoAgent::OperatorFactory handlers[HANDLER_COUNT] = {};
     KelvoAgent::OperatorFactory routines[ROUTINE_COUNT] = {};
@@ -90,6 +98,12 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
     }
     std::lock_guard<std::mutex> guard(factories().lock);
     factories().routines[id] = factory;
+}
+
+void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < ROUTINE_COUNT) {
+        setRoutine(id, op);
+    }
 }
 
 void KelvoAgent::setExitHook(ExitHook hook) {

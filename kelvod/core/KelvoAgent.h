@@ -83,6 +83,9 @@ public:
     static void setHandlerFactory(int32_t id, OperatorFactory factory);
     static void setRoutineFactory(int32_t id, OperatorFactory factory);
     static void setExitHook(ExitHook hook);
+    // Puts an operator built by the caller into a routine slot, without the
+    // start-up sequence (tests).
+    void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();
 

@@ -30,6 +30,7 @@ enum class Health : uint32_t {
     AccounterEventsDropped,  // oldest timeline events dropped by an accounter at its cap
     TimerRearmRetries,       // timers that could not be re-armed at once (retried later)
     ValuesSaturated,         // values clamped to their stored or sent width
+    RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
     Count
 };
 
