@@ -147,12 +147,12 @@ protected:
     }
     static void setClock(int64_t t) { WallClock::setFixedTimeMs(t); }
     // The routine with the usual electors: 0x1 records and uploads, the
-    // battery reports; candidates 5 to 8 have none.
+    // battery reports; candidates 5 and 7 have none.
     void start(std::vector<int64_t> battery = {}, std::vector<int64_t> model = {}) {
         mRoutine->earlyInitialize();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
         mRoutine->initialize();
-        add(new Elector(0x1, {1, 2, 3, 4}, model, true));
+        add(new Elector(0x1, {1, 2, 3, 4, 6, 8}, model, true));
         add(new Elector(0x2, {2, 3}));
         add(new Elector(HourlyRoutine::kBatteryElector, {1}, battery));
     }
