@@ -58,7 +58,7 @@ int64_t tickRows() {
     Parcel reply;
     int32_t rows = 0;
     if (kelvo::StorageOperator::queryEntriesSimple(
-                android::String8("SELECT COUNT(*) FROM debug_hourly_tick"), &reply, 1, rows) < 0 ||
+            android::String8("SELECT COUNT(*) FROM debug_hourly_tick"), &reply, 1, rows) < 0 ||
         rows < 1) {
         return -1;
     }
@@ -100,9 +100,8 @@ void BM_HourlyRound(benchmark::State& state) {
             kelvo::WallClock::setFixedTimeMs(kDay + (r + 1) * kHourMs + 5000);
             Clock::time_point start = Clock::now();
             routine->sendMessage(
-                    kelvo::ParcelMessage(kelvo::MESSAGE_TIMER, kelvo::HourlyRoutine::kHourlyTimerId));
-            while (tickRows() == before &&
-                   Clock::now() - start < std::chrono::seconds(70)) {
+                kelvo::ParcelMessage(kelvo::MESSAGE_TIMER, kelvo::HourlyRoutine::kHourlyTimerId));
+            while (tickRows() == before && Clock::now() - start < std::chrono::seconds(70)) {
                 std::this_thread::sleep_for(std::chrono::microseconds(200));
             }
             ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - start).count());
@@ -129,4 +128,4 @@ void BM_HourlyRound(benchmark::State& state) {
 }
 BENCHMARK(BM_HourlyRound)->Iterations(1)->UseRealTime()->Unit(benchmark::kMillisecond);
 
-} // namespace
+}  // namespace
