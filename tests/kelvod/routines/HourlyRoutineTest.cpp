@@ -33,8 +33,6 @@ constexpr int64_t kMin = 60000;
 
 const column_attribute kTimeChangedColumns[] = {{COLUMN_TIME, "timestamp"}, {COLUMN_LONG, "delta"}};
 const table_attribute kTimeChanged = {"1.0", 1, 2, kTimeChangedColumns, "raw_time_changed"};
-const column_attribute kTickCols[] = {{COLUMN_TIME, "start_routine"}, {COLUMN_TIME, "end_routine"}};
-const table_attribute kTick = {"1.0", 1, 2, kTickCols, "debug_hourly_tick"};
 
 std::mutex gLock;
 std::vector<std::string> gSeen;  // "notification@HH:MM[/ratio x 1000]"
@@ -216,14 +214,10 @@ class HourlyFlowTest : public HourlyRoutineTest, public ::testing::WithParamInte
 
 TEST_P(HourlyFlowTest, RoundsStepAndUploadOnTheLastVote) {
     const FlowCase& c = GetParam();
-    Parcel tick, change;
-    tick.writeInt64(c.lastStart);
-    tick.writeInt64(c.lastStart + kMin);
-    StorageOperator::insertEntries(kTick, tick, c.lastStart != 0, false);
-    change.writeInt64(kDay);
-    change.writeInt64(c.timeChange);
-    StorageOperator::insertEntries(kTimeChanged, change, c.timeChange != 0, false);
-    mStorage->flushAllEntries();
+    kelvo::test::DirectDb db(dbPath());
+    std::string last = std::to_string(c.lastStart), delta = std::to_string(c.timeChange);
+    db.exec("INSERT INTO debug_hourly_tick(start_routine) SELECT " + last + " WHERE " + last);
+    db.exec("INSERT INTO raw_time_changed(delta) SELECT " + delta + " WHERE " + delta);
     LogCapture log;
     start({c.battery, c.battery2}, {c.free, c.model});
     setClock(c.at);
