@@ -132,6 +132,12 @@ void KelvoAgent::setRoutine(int32_t id, const android::sp<KelvoOperator>& op) {
     mRoutines[id] = op;
 }
 
+void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < ROUTINE_COUNT) {
+        setRoutine(id, op);
+    }
+}
+
 int32_t KelvoAgent::initiate() {
     startHandlers();
     startRoutines();
