@@ -1253,6 +1253,8 @@ int32_t CpuHandler::handleComponentResult(const Parcel& data) {
 
 int32_t CpuHandler::handleApplicationResult(const Parcel& data) {
     Parcel rows;
+    // The rows take about the room of the records they come from.
+    rows.setDataCapacity(data.dataSize() + 64);
     int32_t count = 0;
     while (data.dataAvail() > 0) {
         int32_t uid = 0;
