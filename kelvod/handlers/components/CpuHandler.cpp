@@ -382,15 +382,6 @@ void CpuHandler::cleanTables(int64_t time) {
     cleanObsoleteEntries(kHourlyApplicationsTable.name, time, "timestamp");
 }
 
-void CpuHandler::dump(String8& out) {
-    out.appendFormat(
-        "CpuHandler: clusters %zu, ready %d, first sample %d, uids %zu, pids %zu, "
-        "uid baselines %zu, pending passes %zu\n",
-        mClusterOrder.size(), mConfigsReady ? 1 : 0, mFirstSample ? 1 : 0, mUids.size(),
-        mPids.size(), mUidBaselines.size(), mPending.size());
-    KelvoOperator::dump(out);
-}
-
 // ---- Cluster discovery ----
 
 int32_t CpuHandler::readClusterConfig(int32_t core, std::map<std::string, cluster_info>& clusters,
