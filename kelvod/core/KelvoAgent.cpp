@@ -12,8 +12,9 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
-#include "routines/PollingRoutine.h"
+#include "handlers/components/CpuHandler.h"
 #include "routines/HourlyRoutine.h"
+#include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -29,6 +30,10 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
 
+android::sp<KelvoOperator> makeCpuHandler() {
+    return new CpuHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -40,6 +45,7 @@ android::sp<KelvoOperator> makeHourlyRoutine() {
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
+        handlers[HANDLER_CPU] = &makeCpuHandler;
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
     }

@@ -33,6 +33,10 @@ enum class Health : uint32_t {
     SettingsRefused,         // property values refused (not a number, out of range): default used
     AccounterStateCapped,    // accounter state grown from log text refused at its cap
     RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
+    CpuReportsRefused,       // per-process CPU reports dropped (bad length or count)
+    CpuReportsLate,          // CPU passes run without their per-process report
+    CpuEntriesCapped,        // processes or uids not followed: their maps were full
+    CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
     Count
 };
 

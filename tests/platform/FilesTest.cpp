@@ -2,13 +2,16 @@
 
 #include <gtest/gtest.h>
 #include <string.h>
+#include <unistd.h>
 
 #include <cust/CustConfig.h>
 
 #include <string>
+#include <vector>
 
 #include "common/TestEnv.h"
 #include "kelvo/HostProperties.h"
+#include "kelvo/Processors.h"
 #include "kelvo/RootPath.h"
 
 using kelvo::RootPath;
@@ -94,3 +97,36 @@ TEST(CustConfigTest, RefusesWhatItCannotAnswerExactly) {
 }
 
 } // namespace
+
+// The processor count comes from the device tree below the root, in order:
+// "possible", the cpuN folders, the machine's own count.
+TEST(ProcessorsTest, CountComesFromTheRootsTree) {
+    struct Case {
+        const char* name;
+        const char* possible; // nullptr: no file
+        std::vector<const char*> folders;
+        int32_t expected; // 0: the machine's own count
+    } cases[] = {
+            {"range", "0-7\n", {"cpu0"}, 8},
+            {"list", "0-3,6,8-9\n", {}, 10},
+            {"single", "0\n", {}, 1},
+            {"bad list falls back to folders", "7-3\n", {"cpu0", "cpu5", "cpufreq", "cpuidle"}, 6},
+            {"huge index falls back", "0-100000\n", {"cpu1"}, 2},
+            {"folders", nullptr, {"cpu0", "cpu11", "cpux1", "cpu2a"}, 12},
+            {"nothing", nullptr, {}, 0},
+    };
+    for (const Case& c : cases) {
+        SCOPED_TRACE(c.name);
+        kelvo::test::TempRoot root;
+        kelvo::test::makeHostDirs(root.path() + "/sys/devices/system/cpu");
+        if (c.possible != nullptr) {
+            root.writeFile("/sys/devices/system/cpu/possible", c.possible);
+        }
+        for (const char* f : c.folders) {
+            kelvo::test::makeHostDirs(root.path() + "/sys/devices/system/cpu/" + f);
+        }
+        int32_t expected = c.expected > 0 ? c.expected
+                                          : static_cast<int32_t>(sysconf(_SC_NPROCESSORS_CONF));
+        EXPECT_EQ(expected, kelvo::Processors::configuredCount());
+    }
+}
