@@ -1,7 +1,7 @@
 // The cost of one state action (a foreground change) handed to an accounter
-// through setDataAccounter, per element it touches: the accounter holds 20
-// shared allocators of 10 elements each, and every allocator closes the
-// interval of each of its elements under the old foreground.
+// through setDataAccounter, per element it touches: the sensor accounter
+// holds 32 sensor types of 8 users each, and every type's shared allocator
+// closes the interval of each of its users under the old foreground.
 //
 // The cost of one CPU accounting pass: a SetValue over 2 clusters of 20
 // frequency steps and 300 applications, from the parcel to the replies.
@@ -22,9 +22,6 @@
 #include "AccounterTypes.h"
 #include "KelvoLibEntry.h"
 #include "LibraryListener.h"
-#include "accounters/DataAccounter.h"
-#include "allocators/AccounterData.h"
-#include "allocators/SharedAllocator.h"
 #include "core/KelvoLibAgent.h"
 #include "kelvo/RootPath.h"
 #include "utils/XmlParser.h"
@@ -35,57 +32,92 @@ using Clock = std::chrono::steady_clock;
 
 namespace {
 
-constexpr int32_t kType = kelvo::ACCOUNTER_GNSS;
-constexpr int32_t kAllocators = 20;
-constexpr int32_t kElementsPerAllocator = 10;
-constexpr int32_t kElements = kAllocators * kElementsPerAllocator;
+constexpr int32_t kType = kelvo::ACCOUNTER_SENSOR;
+constexpr int32_t kSensorTypes = 32;
+constexpr int32_t kUsersPerType = 8;
+constexpr int32_t kElements = kSensorTypes * kUsersPerType;
 constexpr int kActionsPerBatch = 1000;
-
-// One shared allocator per int32 key; SetValue: int64 time, int32 power.
-class BenchAccounter : public kelvo::DataAccounter {
-protected:
-    std::unique_ptr<kelvo::BaseAllocator> createAllocators(int32_t key) override {
-        return std::make_unique<kelvo::SharedAllocator<kelvo::accounter_data>>(this);
-    }
-    int32_t getAllocatorKey(const Parcel& action) override { return action.readInt32(); }
-    int32_t getPowerValue(int32_t key, const Parcel& action, Parcel& power) override {
-        power.writeInt64(action.readInt64());
-        power.writeInt32(action.readInt32());
-        return 0;
-    }
-};
 
 class NullListener : public kelvo::LibraryListener {
 public:
     int32_t handleLibraryEvent(int32_t event, const Parcel& reply) override { return 0; }
 };
 
+// A private root holding a profile made of the given components; the
+// accounters read it when they are created. Empty on failure.
+std::string writeProfile(const std::string& components) {
+    char tmpl[] = "/tmp/kelvo-bench-profile-XXXXXX";
+    if (mkdtemp(tmpl) == nullptr) {
+        return "";
+    }
+    std::string root = tmpl;
+    std::string xml = "<config><element id=\"0\">" + components + "</element></config>";
+    std::string dir = root + "/data/misc/kelvo";
+    std::string cmd = "mkdir -p '" + dir + "'";
+    FILE* file = system(cmd.c_str()) == 0 ? fopen((dir + "/tv_kelvo_config.xml").c_str(), "w")
+                                          : nullptr;
+    if (file == nullptr) {
+        return "";
+    }
+    fputs(xml.c_str(), file);
+    fclose(file);
+    return root;
+}
+
+// Uses the profile at root until it goes out of scope, then removes it.
+class ProfileRoot {
+public:
+    explicit ProfileRoot(const std::string& components)
+        : mSavedRoot(kelvo::RootPath::root()), mRoot(writeProfile(components)) {
+        if (!mRoot.empty()) {
+            kelvo::RootPath::setRoot(mRoot.c_str());
+        }
+        kelvo::XmlParser::resetInstance();
+        kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();
+    }
+    ~ProfileRoot() {
+        kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();
+        kelvo::RootPath::setRoot(mSavedRoot.c_str());
+        kelvo::XmlParser::resetInstance();
+        if (!mRoot.empty()) {
+            std::string cmd = "rm -rf '" + mRoot + "'";
+            int ignored = system(cmd.c_str());
+            (void)ignored;
+        }
+    }
+    bool ok() const { return !mRoot.empty(); }
+
+private:
+    std::string mSavedRoot;
+    std::string mRoot;
+};
+
+std::string sensorProfile() {
+    std::string xml = "<component id=\"7\">";
+    for (int32_t type = 0; type < kSensorTypes; ++type) {
+        xml += "<parameter id=\"" + std::to_string(type) + "\"><value>" +
+               std::to_string(2 + type) + "</value></parameter>";
+    }
+    return xml + "</component>";
+}
+
 bool setUpAccounter() {
-    kelvo::KelvoLibAgent* agent = kelvo::KelvoLibAgent::getInstance();
-    agent->resetAccountersForTest();
-    agent->setAccounterFactoryForTest(kType, [] { return std::make_unique<BenchAccounter>(); });
     if (kelvo::registerLibraryListener(kType, new NullListener()) != 0) {
         return false;
     }
-    for (int32_t key = 0; key < kAllocators; ++key) {
-        Parcel power;
-        power.writeInt32(kType);
-        power.writeInt32(kelvo::ACTION_SET_VALUE);
-        power.writeInt32(key);
-        power.writeInt64(0);
-        power.writeInt32(300 + key);
-        if (kelvo::setDataAccounter(power) != 0) {
-            return false;
-        }
-        for (int32_t i = 0; i < kElementsPerAllocator; ++i) {
-            char name[48];
-            snprintf(name, sizeof(name), "com.vendor.app%02d:worker%d", i, key);
+    for (int32_t type = 0; type < kSensorTypes; ++type) {
+        for (int32_t i = 0; i < kUsersPerType; ++i) {
+            char package[32];
+            char user[32];
+            snprintf(package, sizeof(package), "com.vendor.app%02d", i);
+            snprintf(user, sizeof(user), "listener%d", type);
             Parcel activate;
             activate.writeInt32(kType);
             activate.writeInt32(kelvo::ACTION_ACTIVATE);
-            activate.writeInt32(key);
+            activate.writeInt32(type);
             activate.writeInt64(0);
-            activate.writeString8(String8(name));
+            activate.writeString8(String8(package));
+            activate.writeString8(String8(user));
             if (kelvo::setDataAccounter(activate) != 0) {
                 return false;
             }
@@ -95,7 +127,8 @@ bool setUpAccounter() {
 }
 
 void BM_AccounterStateChange(benchmark::State& state) {
-    if (!setUpAccounter()) {
+    ProfileRoot profile(sensorProfile());
+    if (!profile.ok() || !setUpAccounter()) {
         state.SkipWithError("setting up the accounter failed");
         return;
     }
@@ -126,7 +159,6 @@ void BM_AccounterStateChange(benchmark::State& state) {
         double ns = std::chrono::duration<double, std::nano>(Clock::now() - start).count();
         nsPerElement.push_back(ns / kActionsPerBatch / kElements);
     }
-    kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();
     if (failed || nsPerElement.empty()) {
         state.SkipWithError("a foreground change failed");
         return;
@@ -141,15 +173,9 @@ constexpr int32_t kSteps = 20;
 constexpr int32_t kApplications = 300;
 constexpr int kPassesPerBatch = 100;
 
-// A private root holding a CPU profile of the benchmark's shape; the
-// accounter reads it when it is created.
-std::string writeCpuProfile() {
-    char tmpl[] = "/tmp/kelvo-bench-cpu-XXXXXX";
-    if (mkdtemp(tmpl) == nullptr) {
-        return "";
-    }
-    std::string root = tmpl;
-    std::string xml = "<config><element id=\"0\"><component id=\"3\">";
+// The CPU profile of the benchmark's shape.
+std::string cpuProfile() {
+    std::string xml = "<component id=\"3\">";
     for (int32_t c = 0; c < kClusters; ++c) {
         xml += "<parameter id=\"" + std::to_string(c) + "\">";
         for (int32_t f = 0; f < kSteps; ++f) {
@@ -157,17 +183,7 @@ std::string writeCpuProfile() {
         }
         xml += "</parameter>";
     }
-    xml += "<parameter id=\"100\"><value>4</value></parameter></component></element></config>";
-    std::string dir = root + "/data/misc/kelvo";
-    std::string cmd = "mkdir -p '" + dir + "'";
-    FILE* file = system(cmd.c_str()) == 0 ? fopen((dir + "/tv_kelvo_config.xml").c_str(), "w")
-                                          : nullptr;
-    if (file == nullptr) {
-        return "";
-    }
-    fputs(xml.c_str(), file);
-    fclose(file);
-    return root;
+    return xml + "<parameter id=\"100\"><value>4</value></parameter></component>";
 }
 
 std::unique_ptr<Parcel> cpuPass(int64_t end) {
@@ -200,15 +216,11 @@ std::unique_ptr<Parcel> cpuPass(int64_t end) {
 }
 
 void BM_CpuAccounterPass(benchmark::State& state) {
-    const std::string savedRoot = kelvo::RootPath::root();
-    const std::string root = writeCpuProfile();
-    if (root.empty()) {
+    ProfileRoot profile(cpuProfile());
+    if (!profile.ok()) {
         state.SkipWithError("writing the profile failed");
         return;
     }
-    kelvo::RootPath::setRoot(root.c_str());
-    kelvo::XmlParser::resetInstance();
-    kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();
     bool failed = kelvo::registerLibraryListener(kelvo::ACCOUNTER_CPU, new NullListener()) != 0;
     std::vector<std::unique_ptr<Parcel>> passes;
     std::vector<double> usPerPass;
@@ -227,11 +239,7 @@ void BM_CpuAccounterPass(benchmark::State& state) {
         double us = std::chrono::duration<double, std::micro>(Clock::now() - start).count();
         usPerPass.push_back(us / kPassesPerBatch);
     }
-    kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();
-    kelvo::RootPath::setRoot(savedRoot.c_str());
-    kelvo::XmlParser::resetInstance();
-    std::string cmd = "rm -rf '" + root + "'";
-    if (system(cmd.c_str()) != 0 || failed || usPerPass.empty()) {
+    if (failed || usPerPass.empty()) {
         state.SkipWithError("a CPU pass failed");
         return;
     }

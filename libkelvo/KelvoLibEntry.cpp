@@ -36,6 +36,14 @@ int32_t setDataAccounter(const android::Parcel& action) {
     return ret;
 }
 
+int32_t setDisplayEnergyPolicy(int32_t policy) {
+    int32_t ret = KelvoLibAgent::getInstance()->setDisplayEnergyPolicy(policy);
+    if (ret < 0) {
+        HealthCounters::add(Health::LibraryParcelRefused);
+    }
+    return ret;
+}
+
 int32_t getXmlConfig(int32_t element, const android::Parcel& request, android::Parcel* reply) {
     // The power profile (element 0) belongs to the accounters alone.
     if (element < CONFIG_ABNORMALITY_THRESHOLD || element > CONFIG_TEXT) {

@@ -33,6 +33,13 @@ int32_t unregisterLibraryListener(int32_t type);
 // the caller's thread. 0, or -1 on failure.
 int32_t setDataAccounter(const android::Parcel& action);
 
+// The display handler's effective energy accounting policy (1: levels in
+// hundredths, 2: in ten-thousandths), which the brightness accounter scales
+// its powers by from then on; until it is set, the configured policy holds.
+// Set it again whenever the effective policy changes (a driver that refuses
+// policy 2 leaves policy 1). 0, or -1 for a policy other than 1 or 2.
+int32_t setDisplayEnergyPolicy(int32_t policy);
+
 // Elements of the configuration file.
 enum ConfigElement {
     CONFIG_POWER_PROFILE = 0,         // the library's own: refused by getXmlConfig

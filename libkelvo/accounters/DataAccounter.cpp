@@ -120,6 +120,10 @@ int32_t DataAccounter::getAllocatorKey(const Parcel& action) {
     return 0;
 }
 
+int32_t DataAccounter::getBalanceKey(int32_t key) const {
+    return key;
+}
+
 BaseAllocator* DataAccounter::findAllocator(int32_t key) const {
     auto it = mAllocators.find(key);
     return it == mAllocators.end() ? nullptr : it->second.get();
@@ -154,6 +158,29 @@ int32_t DataAccounter::onActionForeground(const Parcel& action) {
     if (action.readInt64(&timestamp) != NO_ERROR || action.readString8(&name) != NO_ERROR) {
         LLOGE("Invalid parameter");
         return -1;
+    }
+    updateAllocators(timestamp);
+    mForeground = name;
+    return 0;
+}
+
+int32_t DataAccounter::moveForegroundElement(int32_t key, const Parcel& action) {
+    int64_t timestamp = 0;
+    String8 name;
+    if (action.readInt64(&timestamp) != NO_ERROR || action.readString8(&name) != NO_ERROR) {
+        LLOGE("Invalid parameter");
+        return -1;
+    }
+    BaseAllocator* allocator = obtainAllocator(key);
+    if (allocator == nullptr) {
+        return -1;
+    }
+    // Nothing to report when no element is active yet.
+    if (mForeground.size() > 0) {
+        allocator->removeElement(mForeground, timestamp);
+    }
+    if (name.size() > 0 && allocator->addElement(name, timestamp) < 0) {
+        LLOGE("Failed to add element");
     }
     updateAllocators(timestamp);
     mForeground = name;
@@ -211,7 +238,7 @@ int32_t DataAccounter::onActionBalance(const Parcel& action) {
     // from being cut at this time.
     int32_t result = 0;
     for (auto& entry : mAllocators) {
-        if (entry.second->balanceAccounting(end, newStart, entry.first) < 0) {
+        if (entry.second->balanceAccounting(end, newStart, getBalanceKey(entry.first)) < 0) {
             LLOGE("Failed to balance accounting data");
             result = -1;
         }

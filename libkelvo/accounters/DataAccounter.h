@@ -60,6 +60,8 @@ protected:
                                   android::Parcel& power);
     // Reads the allocator key fields of Activate, Deactivate and SetValue.
     virtual int32_t getAllocatorKey(const android::Parcel& action);
+    // The key a Balance hands to the allocator stored under key.
+    virtual int32_t getBalanceKey(int32_t key) const;
 
     // Each action reads its fields after the action code.
     virtual int32_t onActionForeground(const android::Parcel& action);
@@ -79,6 +81,12 @@ protected:
     BaseAllocator* obtainAllocator(int32_t key);
     // Accounts every allocator up to the timestamp under the current state.
     void updateAllocators(int64_t timestamp);
+    // A Foreground action of the accounters whose one element is the
+    // foreground application: the current foreground's record is reported
+    // up to the time, the new name becomes the element, then the state
+    // changes. The allocator of the key is created when there is none yet,
+    // so a foreground known before any power value is still charged.
+    int32_t moveForegroundElement(int32_t key, const android::Parcel& action);
 
     android::String8 mForeground;
     bool mScreenOn;

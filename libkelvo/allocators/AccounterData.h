@@ -129,6 +129,68 @@ using accounter_data = timed_accounter_data<1000>;
 // Sensors: their powers carry one more decimal (energy / 10000).
 using sensor_accounter_data = timed_accounter_data<10000>;
 
+// GPU usage: the interval's duration and the busy time of the batch it
+// charges. A batch (the power description: int32 count, then per frequency
+// step int32 power, int64 busy ms, int64 idle ms) is charged by the first
+// accounting step of zero length, which is the step the GPU handler takes at
+// the time of its reading; the step marks the batch consumed (count 0), so a
+// second step at the same time charges nothing. A step over time charges
+// nothing and consumes the batch as well: the reading belonged to its own
+// time.
+struct gpu_accounter_data {
+    int32_t duration = 0;
+    int64_t busy = 0;
+
+    void setInterval(int64_t start, int64_t end) { duration = clampDuration(start, end); }
+
+    int64_t calculateEnergy(android::Parcel& power) {
+        busy = 0;
+        power.setDataPosition(0);
+        int32_t count = 0;
+        if (power.readInt32(&count) != android::NO_ERROR || count <= 0) {
+            return 0;
+        }
+        int64_t energy = 0;
+        if (duration == 0) {
+            for (int32_t i = 0; i < count; ++i) {
+                int32_t stepPower = 0;
+                int64_t stepBusy = 0;
+                int64_t stepIdle = 0;
+                if (power.readInt32(&stepPower) != android::NO_ERROR ||
+                    power.readInt64(&stepBusy) != android::NO_ERROR ||
+                    power.readInt64(&stepIdle) != android::NO_ERROR) {
+                    break;
+                }
+                if (stepBusy < 1) {
+                    continue;
+                }
+                busy = addSaturated(busy, stepBusy);
+                int64_t product = 0;
+                if (__builtin_mul_overflow(stepBusy, static_cast<int64_t>(stepPower), &product)) {
+                    product = stepPower < 0 ? std::numeric_limits<int64_t>::min()
+                                            : std::numeric_limits<int64_t>::max();
+                }
+                energy = addSaturated(energy, product);
+            }
+        }
+        power.setDataPosition(0);
+        power.writeInt32(0);
+        power.setDataPosition(0);
+        return energy / 1000;
+    }
+
+    gpu_accounter_data& operator+=(const gpu_accounter_data& other) {
+        duration = addSaturated(duration, other.duration);
+        busy = addSaturated(busy, other.busy);
+        return *this;
+    }
+
+    void writeToParcel(android::Parcel& out) const {
+        out.writeInt32(duration);
+        out.writeInt64(busy);
+    }
+};
+
 // CPU time of one application, given per batch; its energy comes from the
 // weight split of WeightAllocator.
 struct cpu_accounter_data {

@@ -8,6 +8,7 @@
 #include <utils/String8.h>
 
 #include "AccounterTypes.h"
+#include "HealthCounters.h"
 #include "LibKelvoLog.h"
 #include "accounters/DataAccounter.h"
 #include "allocators/AccounterData.h"
@@ -21,6 +22,10 @@ namespace kelvo {
 template <typename T>
 class SharedAllocator : public BaseAllocator {
 public:
+    // Most elements at once: names come from log text, and every interval
+    // walks them all. A new name beyond is refused and counted.
+    static constexpr size_t kMaxElements = 1024;
+
     explicit SharedAllocator(DataAccounter* owner) : BaseAllocator(owner) {}
 
     void updateElement(int64_t timestamp) override {
@@ -54,6 +59,11 @@ public:
         updateElement(timestamp);
         if (mElements.find(name) != mElements.end()) {
             return 0;
+        }
+        if (mElements.size() >= kMaxElements) {
+            LLOGE("Too many elements: %zu, refused: %s", mElements.size(), name.c_str());
+            HealthCounters::add(Health::AccounterStateCapped);
+            return -1;
         }
         element_data<T> record;
         record.start = timestamp;

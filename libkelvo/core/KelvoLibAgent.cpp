@@ -3,7 +3,15 @@
 #include <mutex>
 
 #include "LibKelvoLog.h"
+#include "accounters/AudioAccounter.h"
+#include "accounters/BluetoothAccounter.h"
+#include "accounters/BrightnessAccounter.h"
+#include "accounters/CameraAccounter.h"
 #include "accounters/CpuAccounter.h"
+#include "accounters/FlashlightAccounter.h"
+#include "accounters/GnssAccounter.h"
+#include "accounters/GpuAccounter.h"
+#include "accounters/SensorAccounter.h"
 #include "SqlTypes.h"
 
 namespace kelvo {
@@ -24,6 +32,22 @@ namespace {
 // yet has an empty entry.
 KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
     switch (type) {
+        case ACCOUNTER_BRIGHTNESS:
+            return [] { return std::make_unique<BrightnessAccounter>(); };
+        case ACCOUNTER_GNSS:
+            return [] { return std::make_unique<GnssAccounter>(); };
+        case ACCOUNTER_FLASHLIGHT:
+            return [] { return std::make_unique<FlashlightAccounter>(); };
+        case ACCOUNTER_CAMERA:
+            return [] { return std::make_unique<CameraAccounter>(); };
+        case ACCOUNTER_BLUETOOTH:
+            return [] { return std::make_unique<BluetoothAccounter>(); };
+        case ACCOUNTER_GPU:
+            return [] { return std::make_unique<GpuAccounter>(); };
+        case ACCOUNTER_SENSOR:
+            return [] { return std::make_unique<SensorAccounter>(); };
+        case ACCOUNTER_AUDIO:
+            return [] { return std::make_unique<AudioAccounter>(); };
         case ACCOUNTER_CPU:
             return [] {
                 return std::make_unique<CpuAccounter>(
@@ -129,6 +153,16 @@ int32_t KelvoLibAgent::setDataAccounter(const android::Parcel& action) {
         return -1;
     }
     return accounter->handleAction(action);
+}
+
+int32_t KelvoLibAgent::setDisplayEnergyPolicy(int32_t policy) {
+    auto* accounter =
+            dynamic_cast<BrightnessAccounter*>(findAccounter(ACCOUNTER_BRIGHTNESS));
+    if (accounter == nullptr) {
+        LLOGE("Failed to find accounter by type: %d", ACCOUNTER_BRIGHTNESS);
+        return -1;
+    }
+    return accounter->setEffectivePolicy(policy);
 }
 
 void KelvoLibAgent::setAccounterFactoryForTest(int32_t type, AccounterFactory factory) {

@@ -44,6 +44,9 @@ public:
     // action: int32 AccounterType, int32 AccounterAction, the action's fields.
     // The accounter's result, or -1 when there is no accounter of the type.
     int32_t setDataAccounter(const android::Parcel& action);
+    // The display's effective energy accounting policy, for the brightness
+    // accounter. 0, or -1 for an unknown policy.
+    int32_t setDisplayEnergyPolicy(int32_t policy);
 
     // Tests only: makes the type's accounters with the factory (null
     // restores the built-in one), and drops every accounter and restores the

@@ -31,6 +31,7 @@ enum class Health : uint32_t {
     TimerRearmRetries,       // timers that could not be re-armed at once (retried later)
     ValuesSaturated,         // values clamped to their stored or sent width
     SettingsRefused,         // property values refused (not a number, out of range): default used
+    AccounterStateCapped,    // accounter state grown from log text refused at its cap
     Count
 };
 

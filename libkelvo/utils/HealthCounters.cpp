@@ -17,6 +17,7 @@ const char* const kHealthNames[] = {
         "messages_dropped",          "messages_refused",        "files_deleted",
         "buffered_client_refused",   "device_answers_refused",  "accounter_events_dropped",
         "timer_rearm_retries",       "values_saturated",        "settings_refused",
+        "accounter_state_capped",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),
