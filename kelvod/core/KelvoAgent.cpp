@@ -13,6 +13,7 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "routines/PollingRoutine.h"
+#include "routines/HourlyRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -32,9 +33,16 @@ android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
 
-// What start-up creates unless a test or the simulator replaced it.
+android::sp<KelvoOperator> makeHourlyRoutine() {
+    return new HourlyRoutine();
+}
+
+// What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
-    Factories() { routines[ROUTINE_POLLING] = &makePollingRoutine; }
+    Factories() {
+        routines[ROUTINE_POLLING] = &makePollingRoutine;
+        routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
+    }
 
     std::mutex lock;
     KelvoAgent::OperatorFactory handlers[HANDLER_COUNT] = {};
@@ -98,6 +106,12 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
     }
     std::lock_guard<std::mutex> guard(factories().lock);
     factories().routines[id] = factory;
+}
+
+void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < ROUTINE_COUNT) {
+        setRoutine(id, op);
+    }
 }
 
 void KelvoAgent::setExitHook(ExitHook hook) {

@@ -32,6 +32,7 @@ enum class Health : uint32_t {
     ValuesSaturated,         // values clamped to their stored or sent width
     SettingsRefused,         // property values refused (not a number, out of range): default used
     AccounterStateCapped,    // accounter state grown from log text refused at its cap
+    RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
     Count
 };
 
