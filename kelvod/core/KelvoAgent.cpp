@@ -12,6 +12,8 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "handlers/components/FlashlightHandler.h"
+#include "handlers/components/GnssHandler.h"
 #include "routines/PollingRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "storage/DataUploader.h"
@@ -29,6 +31,14 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
 
+android::sp<KelvoOperator> makeGnssHandler() {
+    return new GnssHandler();
+}
+
+android::sp<KelvoOperator> makeFlashlightHandler() {
+    return new FlashlightHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -42,6 +52,8 @@ struct Factories {
     Factories() {
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
+        handlers[HANDLER_GNSS] = &makeGnssHandler;
+        handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
     }
 
     std::mutex lock;
@@ -146,12 +158,6 @@ void KelvoAgent::setHandler(int32_t id, const android::sp<KelvoOperator>& op) {
 void KelvoAgent::setRoutine(int32_t id, const android::sp<KelvoOperator>& op) {
     std::lock_guard<std::mutex> guard(mSlotLock);
     mRoutines[id] = op;
-}
-
-void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
-    if (id >= 0 && id < ROUTINE_COUNT) {
-        setRoutine(id, op);
-    }
 }
 
 int32_t KelvoAgent::initiate() {

@@ -1,0 +1,184 @@
+#pragma once
+
+#include <stddef.h>
+#include <stdint.h>
+
+#include <initializer_list>
+#include <string>
+#include <vector>
+
+#include <binder/Parcel.h>
+#include <utils/String8.h>
+
+#include "core/KelvoOperator.h"
+#include "storage/TableAttribute.h"
+
+namespace kelvo {
+
+// Columns of the family's tables. Durations are milliseconds (int), energies
+// in the accounter's unit (long); the result pairs come in the order
+// foreground, background, screen on, screen off, then the charge pairs.
+#define KELVO_RESULT_PAIR_COLUMNS                                                     \
+    {COLUMN_INT, "foreground_duration"}, {COLUMN_LONG, "foreground_energy"},          \
+            {COLUMN_INT, "background_duration"}, {COLUMN_LONG, "background_energy"},  \
+            {COLUMN_INT, "screen_on_duration"}, {COLUMN_LONG, "screen_on_energy"},    \
+            {COLUMN_INT, "screen_off_duration"}, {COLUMN_LONG, "screen_off_energy"}
+#define KELVO_CHARGE_PAIR_COLUMNS                                                           \
+    {COLUMN_INT, "charge_foreground_duration"}, {COLUMN_LONG, "charge_foreground_energy"},  \
+            {COLUMN_INT, "charge_background_duration"},                                     \
+            {COLUMN_LONG, "charge_background_energy"}
+
+inline const column_attribute kFamilyRawApplicationsColumns[] = {
+        {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
+        KELVO_RESULT_PAIR_COLUMNS, KELVO_CHARGE_PAIR_COLUMNS,
+};
+inline const column_attribute kFamilyRawComponentColumns[] = {
+        {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},
+        KELVO_RESULT_PAIR_COLUMNS, KELVO_CHARGE_PAIR_COLUMNS,
+};
+inline const column_attribute kFamilyHourlyApplicationsColumns[] = {
+        {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, KELVO_RESULT_PAIR_COLUMNS,
+};
+inline const column_attribute kFamilyHourlyComponentColumns[] = {
+        {COLUMN_TIME, "timestamp"}, KELVO_RESULT_PAIR_COLUMNS,
+};
+constexpr int32_t kFamilyRawApplicationsCount = 15;
+constexpr int32_t kFamilyRawComponentCount = 14;
+constexpr int32_t kFamilyHourlyApplicationsCount = 10;
+constexpr int32_t kFamilyHourlyComponentCount = 9;
+
+// What tells one member of the component handler family from another: its
+// tables, its word in log texts, its applications-accounting code and its
+// upload fields. Every member shares the hourly cycle built on them.
+struct component_family {
+    const char* word;  // "gnss": in log texts and error lines
+    // Raw application results: start_time, end_time, name, the four result
+    // pairs, the two charge pairs.
+    const table_attribute* rawApplications;
+    // Raw component results (start_time, end_time, pairs); null for a member
+    // whose component sums are those of its hourly application rows.
+    const table_attribute* rawComponent;
+    const table_attribute* hourlyApplications;  // timestamp, name, result pairs
+    const table_attribute* hourlyComponent;     // timestamp, result pairs
+    int32_t appsCode;                           // code in the applications accounting
+    uint32_t componentField;                    // upload field of the component class
+    uint32_t applicationsField;                 // upload field of the top-application array
+    // Ranking of the top applications: by summed time, or by the longest
+    // single hour (members whose hourly rows overlap, like shared users).
+    bool rankByLongestHour = false;
+};
+
+// Whether and how a member's component is governed by the data-source policy
+// of the configuration: its policy component, the word of its log lines and
+// the policies it runs with. A member without one is always enabled.
+struct data_source_policy {
+    int32_t component;  // ConfigPolicyComponent, -1 when not governed
+    const char* word;   // "Camera": "Camera policy: %d"
+    std::vector<int32_t> accepted;
+};
+
+// Base of the component handlers: the hourly tick, the applications and
+// component accounting of the hour, energy compensation, and the hourly,
+// daily and dawn uploads of the component class and the top applications.
+// Every vote is cast, whatever failed before it: a failed query only leaves
+// its part out. Members add their own messages and state.
+class ComponentHandler : public KelvoOperator {
+public:
+    // Name buffers of parsed messages hold a whole package name; uploads cut
+    // names further (kMaxUploadName).
+    static constexpr size_t kNameBufferSize = 256;
+    static constexpr int32_t kMaxUploadName = 100;
+    static constexpr int32_t kTopApplications = 20;
+    static constexpr int32_t kDefaultPolicy = 1;
+
+    // Candidates of the hourly rounds a member votes for.
+    enum candidate : int32_t {
+        CANDIDATE_HOURLY_TICK = 1,
+        CANDIDATE_HOURLY_UPLOAD = 4,
+        CANDIDATE_DAILY_UPLOAD = 6,
+        CANDIDATE_DAWN_UPLOAD = 8,
+    };
+
+    // One summed row of the result pairs (foreground, background, screen
+    // on, screen off; duration then energy), with its name when grouped.
+    struct pair_row {
+        android::String8 name;
+        int64_t v[8] = {0, 0, 0, 0, 0, 0, 0, 0};
+    };
+
+    // A member with more than one table set (one per camera) passes them
+    // all; the cycle runs over each, and the uploads gather them in one event.
+    ComponentHandler(const char* name, int32_t accounterType, uint32_t elector,
+                     std::vector<const component_family*> families,
+                     data_source_policy policy = {-1, "", {}});
+
+    // The message parsers every member uses. A text value is copied into a
+    // kNameBufferSize buffer; an integer starts at `sentinel`, so a value
+    // that is not a number ("uid=abc") fails instead of reading as 0 or as a
+    // stale value. 0, the parser's negative result, or -2 for a value that
+    // is no number.
+    static int32_t parseName(const char* text, const char* key, const char* nextKey,
+                             std::string* out);
+    static int32_t parseInt(const char* text, const char* key, const char* nextKey,
+                            int32_t sentinel, int32_t* out);
+
+    // The data-source policy of a configuration component (configuration
+    // request 2), or -1 when it cannot be read.
+    static int32_t readPolicy(int32_t component, int32_t* policy);
+
+    // Runs a query whose first column is COUNT(*), then the name when named,
+    // then the eight sums; rows over no data (the count is 0, the sums NULL)
+    // are no rows. 0, or -17 for a failed query or a reply of another shape.
+    static int32_t queryPairRows(const android::String8& sql, bool named,
+                                 std::vector<pair_row>* out);
+
+    // The select list of the eight summed result columns.
+    static const char* const kPairSums;
+
+    int32_t getPolicy() const { return mPolicy; }
+
+    void addSchemaTable() override;
+    void cleanTables(int64_t time) override;
+    int32_t setConfiguration() override;
+    int32_t checkEnable() override;
+    void setupListeners(android::Parcel& out) override;
+    void setCandidateElector() override;
+    int32_t onHourlyTick(const android::Parcel& data) override;
+    int32_t onHourlyUploading(const android::Parcel& data) override;
+    int32_t onDailyUploading(const android::Parcel& data) override;
+    int32_t onDawnUploading(const android::Parcel& data) override;
+    int32_t logApplicationsAccounting(int64_t time) override;
+    int32_t logComponentAccounting(int64_t time) override;
+    int32_t handleApplicationResult(const android::Parcel& data) override;
+    int32_t handleComponentResult(const android::Parcel& data) override;
+
+protected:
+    // Stores one application result read from the parcel's position (past
+    // its header) and passes it to the applications accounting.
+    int32_t storeApplicationResult(const component_family& family, const android::Parcel& data);
+    int32_t storeComponentResult(const component_family& family, const android::Parcel& data);
+    int32_t logApplicationsAccounting(const component_family& family, int64_t time);
+    int32_t logComponentAccounting(const component_family& family, int64_t time);
+    // Sends Activate or Deactivate of an application to the accounter.
+    int32_t sendNamedAction(int32_t action, int64_t time, const android::String8& name);
+    // Forms the event's component class and top applications over the
+    // window ending at `end`, hands them over and votes for the candidate.
+    int32_t uploadPeriod(uint32_t event, int64_t end, int64_t window, float ratio,
+                         int32_t candidate);
+
+    const std::vector<const component_family*> mFamilies;
+    data_source_policy mPolicySource;
+    int32_t mPolicy;
+
+private:
+    static int32_t uploadComponent(const component_family& family, int64_t end, int64_t window,
+                                   float ratio, android::Parcel& out);
+    static int32_t uploadTopApplications(const component_family& family, int64_t end,
+                                         int64_t window, float ratio, android::Parcel& out);
+    // The hour's component sums: from the raw component table, or from the
+    // hourly application rows for a member without one.
+    static android::String8 componentSumsQuery(const component_family& family, int64_t from,
+                                               int64_t to);
+};
+
+} // namespace kelvo
