@@ -395,8 +395,15 @@ String8 ComponentHandler::componentSumsQuery(const component_family& family, int
 }
 
 int32_t ComponentHandler::logComponentAccounting(int64_t time) {
-    // The hour's application rows were only queued: the sums read them.
-    forceFlushEntries();
+    // The raw component rows of the hour were written with the application
+    // rows' flush; a member summing its hourly application rows needs those
+    // just queued.
+    for (const component_family* f : mFamilies) {
+        if (f->rawComponent == nullptr) {
+            forceFlushEntries();
+            break;
+        }
+    }
     int32_t ret = 0;
     for (const component_family* f : mFamilies) {
         ret = std::min(ret, logComponentAccounting(*f, time));
