@@ -60,12 +60,12 @@ void writePairs(const ComponentHandler::pair_row& row, Parcel& out) {
     }
 }
 
-} // namespace
+}  // namespace
 
 const char* const ComponentHandler::kPairSums =
-        "SUM(foreground_duration), SUM(foreground_energy), SUM(background_duration), "
-        "SUM(background_energy), SUM(screen_on_duration), SUM(screen_on_energy), "
-        "SUM(screen_off_duration), SUM(screen_off_energy)";
+    "SUM(foreground_duration), SUM(foreground_energy), SUM(background_duration), "
+    "SUM(background_energy), SUM(screen_on_duration), SUM(screen_on_energy), "
+    "SUM(screen_off_duration), SUM(screen_off_energy)";
 
 ComponentHandler::ComponentHandler(const char* name, int32_t accounterType, uint32_t elector,
                                    std::vector<const component_family*> families,
@@ -145,8 +145,8 @@ int32_t ComponentHandler::checkEnable() {
 
 void ComponentHandler::addSchemaTable() {
     for (const component_family* f : mFamilies) {
-        for (const table_attribute* table : {f->rawApplications, f->rawComponent,
-                                             f->hourlyApplications, f->hourlyComponent}) {
+        for (const table_attribute* table :
+             {f->rawApplications, f->rawComponent, f->hourlyApplications, f->hourlyComponent}) {
             if (table != nullptr) {
                 addSchema(*table);
             }
@@ -171,13 +171,20 @@ void ComponentHandler::cleanTables(int64_t time) {
 
 void ComponentHandler::setupListeners(Parcel& out) {
     static const int32_t kNotifications[] = {
-            NOTIFICATION_CHARGER_ONLINE_CHANGED,  NOTIFICATION_SCREEN_STATE_CHANGED,
-            NOTIFICATION_FOREGROUND_CHANGED,      NOTIFICATION_HOURLY_TICK,
-            NOTIFICATION_APPLICATIONS_ACCOUNTING, NOTIFICATION_COMPONENT_ACCOUNTING,
-            NOTIFICATION_HOURLY_UPLOADING,        NOTIFICATION_DAILY_UPLOADING,
-            NOTIFICATION_DAWN_UPLOADING,          NOTIFICATION_TIME_CHANGED,
-            NOTIFICATION_ABNORMALITY_THERMAL,     NOTIFICATION_FORCE_BALANCE,
-            NOTIFICATION_SHUT_DOWN,               NOTIFICATION_VM_DIED,
+        NOTIFICATION_CHARGER_ONLINE_CHANGED,
+        NOTIFICATION_SCREEN_STATE_CHANGED,
+        NOTIFICATION_FOREGROUND_CHANGED,
+        NOTIFICATION_HOURLY_TICK,
+        NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING,
+        NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_DAILY_UPLOADING,
+        NOTIFICATION_DAWN_UPLOADING,
+        NOTIFICATION_TIME_CHANGED,
+        NOTIFICATION_ABNORMALITY_THERMAL,
+        NOTIFICATION_FORCE_BALANCE,
+        NOTIFICATION_SHUT_DOWN,
+        NOTIFICATION_VM_DIED,
     };
     for (int32_t type : kNotifications) {
         addNotifierListener(type, out);
@@ -190,8 +197,8 @@ void ComponentHandler::setupListeners(Parcel& out) {
 void ComponentHandler::setCandidateElector() {
     Parcel candidates;
     static const int32_t kCandidates[] = {
-            CANDIDATE_HOURLY_TICK,   VOTE_APPLICATIONS_ACCOUNTING, VOTE_COMPONENT_ACCOUNTING,
-            CANDIDATE_HOURLY_UPLOAD, CANDIDATE_DAILY_UPLOAD,       CANDIDATE_DAWN_UPLOAD,
+        CANDIDATE_HOURLY_TICK,   VOTE_APPLICATIONS_ACCOUNTING, VOTE_COMPONENT_ACCOUNTING,
+        CANDIDATE_HOURLY_UPLOAD, CANDIDATE_DAILY_UPLOAD,       CANDIDATE_DAWN_UPLOAD,
     };
     for (int32_t c : kCandidates) {
         candidates.writeInt32(c);
@@ -283,16 +290,15 @@ int32_t ComponentHandler::handleComponentResult(const Parcel& data) {
     return storeComponentResult(*mFamilies[0], data);
 }
 
-int32_t ComponentHandler::storeComponentResult(const component_family& family,
-                                               const Parcel& data) {
+int32_t ComponentHandler::storeComponentResult(const component_family& family, const Parcel& data) {
     if (family.rawComponent == nullptr) {
         KLOGE("No %s component table", family.word);
         return -2;
     }
     int64_t start = 0;
     int64_t end = 0;
-    bool ok = data.readInt64(&start) == android::NO_ERROR &&
-              data.readInt64(&end) == android::NO_ERROR;
+    bool ok =
+        data.readInt64(&start) == android::NO_ERROR && data.readInt64(&end) == android::NO_ERROR;
     Parcel row;
     row.writeInt64(start);
     row.writeInt64(end);
@@ -312,8 +318,7 @@ int32_t ComponentHandler::storeComponentResult(const component_family& family,
     return insertEntries(*family.rawComponent, row, 1, false);
 }
 
-int32_t ComponentHandler::queryPairRows(const String8& sql, bool named,
-                                        std::vector<pair_row>* out) {
+int32_t ComponentHandler::queryPairRows(const String8& sql, bool named, std::vector<pair_row>* out) {
     Parcel reply;
     int32_t rows = 0;
     int32_t ret = queryEntriesSimple(sql, &reply, named ? 10 : 9, rows);
@@ -349,13 +354,12 @@ int32_t ComponentHandler::logApplicationsAccounting(int64_t time) {
     return ret;
 }
 
-int32_t ComponentHandler::logApplicationsAccounting(const component_family& family,
-                                                    int64_t time) {
+int32_t ComponentHandler::logApplicationsAccounting(const component_family& family, int64_t time) {
     String8 sql = String8::format(
-            "SELECT COUNT(*), name, %s FROM %s WHERE end_time > %lld AND end_time <= %lld "
-            "GROUP BY name",
-            kPairSums, family.rawApplications->name, static_cast<long long>(time - kHourMs),
-            static_cast<long long>(time));
+        "SELECT COUNT(*), name, %s FROM %s WHERE end_time > %lld AND end_time <= %lld "
+        "GROUP BY name",
+        kPairSums, family.rawApplications->name, static_cast<long long>(time - kHourMs),
+        static_cast<long long>(time));
     std::vector<pair_row> sums;
     int32_t ret = queryPairRows(sql, true, &sums);
     if (ret < 0) {
@@ -383,15 +387,17 @@ int32_t ComponentHandler::logApplicationsAccounting(const component_family& fami
 String8 ComponentHandler::componentSumsQuery(const component_family& family, int64_t from,
                                              int64_t to) {
     if (family.rawComponent != nullptr) {
-        return String8::format("SELECT COUNT(*), %s FROM %s WHERE end_time > %lld AND "
-                               "end_time <= %lld",
-                               kPairSums, family.rawComponent->name,
-                               static_cast<long long>(from), static_cast<long long>(to));
+        return String8::format(
+            "SELECT COUNT(*), %s FROM %s WHERE end_time > %lld AND "
+            "end_time <= %lld",
+            kPairSums, family.rawComponent->name, static_cast<long long>(from),
+            static_cast<long long>(to));
     }
-    return String8::format("SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND "
-                           "timestamp <= %lld",
-                           kPairSums, family.hourlyApplications->name,
-                           static_cast<long long>(from), static_cast<long long>(to));
+    return String8::format(
+        "SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND "
+        "timestamp <= %lld",
+        kPairSums, family.hourlyApplications->name, static_cast<long long>(from),
+        static_cast<long long>(to));
 }
 
 int32_t ComponentHandler::logComponentAccounting(int64_t time) {
@@ -434,10 +440,10 @@ int32_t ComponentHandler::logComponentAccounting(const component_family& family,
 
 int32_t ComponentHandler::uploadComponent(const component_family& family, int64_t end,
                                           int64_t window, float ratio, Parcel& out) {
-    String8 sql = String8::format(
-            "SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld", kPairSums,
-            family.hourlyComponent->name, static_cast<long long>(end - window),
-            static_cast<long long>(end));
+    String8 sql =
+        String8::format("SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld",
+                        kPairSums, family.hourlyComponent->name,
+                        static_cast<long long>(end - window), static_cast<long long>(end));
     std::vector<pair_row> sums;
     if (queryPairRows(sql, false, &sums) < 0) {
         KLOGE("Failed to query hourly component data");
@@ -457,13 +463,13 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
 int32_t ComponentHandler::uploadTopApplications(const component_family& family, int64_t end,
                                                 int64_t window, float ratio, Parcel& out) {
     String8 sql = String8::format(
-            "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld "
-            "GROUP BY name ORDER BY %s DESC LIMIT %d",
-            kPairSums, family.hourlyApplications->name, static_cast<long long>(end - window),
-            static_cast<long long>(end),
-            family.rankByLongestHour ? "MAX(foreground_duration + background_duration)"
-                                     : "SUM(foreground_duration) + SUM(background_duration)",
-            kTopApplications);
+        "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld "
+        "GROUP BY name ORDER BY %s DESC LIMIT %d",
+        kPairSums, family.hourlyApplications->name, static_cast<long long>(end - window),
+        static_cast<long long>(end),
+        family.rankByLongestHour ? "MAX(foreground_duration + background_duration)"
+                                 : "SUM(foreground_duration) + SUM(background_duration)",
+        kTopApplications);
     std::vector<pair_row> rows;
     int32_t ret = queryPairRows(sql, true, &rows);
     if (ret < 0) {
@@ -536,4 +542,4 @@ int32_t ComponentHandler::onDawnUploading(const Parcel& data) {
     return uploadPeriod(EVENT_DAILY_COMPONENTS, end, kDawnMs, ratio, CANDIDATE_DAWN_UPLOAD);
 }
 
-} // namespace kelvo
+}  // namespace kelvo

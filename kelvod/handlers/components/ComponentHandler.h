@@ -1,14 +1,13 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stddef.h>
 #include <stdint.h>
+#include <utils/String8.h>
 
 #include <initializer_list>
 #include <string>
 #include <vector>
-
-#include <binder/Parcel.h>
-#include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
 #include "storage/TableAttribute.h"
@@ -18,29 +17,37 @@ namespace kelvo {
 // Columns of the family's tables. Durations are milliseconds (int), energies
 // in the accounter's unit (long); the result pairs come in the order
 // foreground, background, screen on, screen off, then the charge pairs.
-#define KELVO_RESULT_PAIR_COLUMNS                                                     \
-    {COLUMN_INT, "foreground_duration"}, {COLUMN_LONG, "foreground_energy"},          \
-            {COLUMN_INT, "background_duration"}, {COLUMN_LONG, "background_energy"},  \
-            {COLUMN_INT, "screen_on_duration"}, {COLUMN_LONG, "screen_on_energy"},    \
-            {COLUMN_INT, "screen_off_duration"}, {COLUMN_LONG, "screen_off_energy"}
-#define KELVO_CHARGE_PAIR_COLUMNS                                                           \
-    {COLUMN_INT, "charge_foreground_duration"}, {COLUMN_LONG, "charge_foreground_energy"},  \
-            {COLUMN_INT, "charge_background_duration"},                                     \
-            {COLUMN_LONG, "charge_background_energy"}
+#define KELVO_RESULT_PAIR_COLUMNS                                                \
+    {COLUMN_INT, "foreground_duration"}, {COLUMN_LONG, "foreground_energy"},     \
+        {COLUMN_INT, "background_duration"}, {COLUMN_LONG, "background_energy"}, \
+        {COLUMN_INT, "screen_on_duration"}, {COLUMN_LONG, "screen_on_energy"},   \
+        {COLUMN_INT, "screen_off_duration"}, {                                   \
+        COLUMN_LONG, "screen_off_energy"                                         \
+    }
+#define KELVO_CHARGE_PAIR_COLUMNS                                                          \
+    {COLUMN_INT, "charge_foreground_duration"}, {COLUMN_LONG, "charge_foreground_energy"}, \
+        {COLUMN_INT, "charge_background_duration"}, {                                      \
+        COLUMN_LONG, "charge_background_energy"                                            \
+    }
 
 inline const column_attribute kFamilyRawApplicationsColumns[] = {
-        {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
-        KELVO_RESULT_PAIR_COLUMNS, KELVO_CHARGE_PAIR_COLUMNS,
+    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
+    KELVO_RESULT_PAIR_COLUMNS,   KELVO_CHARGE_PAIR_COLUMNS,
 };
 inline const column_attribute kFamilyRawComponentColumns[] = {
-        {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},
-        KELVO_RESULT_PAIR_COLUMNS, KELVO_CHARGE_PAIR_COLUMNS,
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    KELVO_RESULT_PAIR_COLUMNS,
+    KELVO_CHARGE_PAIR_COLUMNS,
 };
 inline const column_attribute kFamilyHourlyApplicationsColumns[] = {
-        {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, KELVO_RESULT_PAIR_COLUMNS,
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_TEXT, "name"},
+    KELVO_RESULT_PAIR_COLUMNS,
 };
 inline const column_attribute kFamilyHourlyComponentColumns[] = {
-        {COLUMN_TIME, "timestamp"}, KELVO_RESULT_PAIR_COLUMNS,
+    {COLUMN_TIME, "timestamp"},
+    KELVO_RESULT_PAIR_COLUMNS,
 };
 constexpr int32_t kFamilyRawApplicationsCount = 15;
 constexpr int32_t kFamilyRawComponentCount = 14;
@@ -181,4 +188,4 @@ private:
                                                int64_t to);
 };
 
-} // namespace kelvo
+}  // namespace kelvo

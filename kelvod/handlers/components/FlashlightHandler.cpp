@@ -24,20 +24,20 @@ const table_attribute kHourlyComponent = {"1.0", 1, kFamilyHourlyComponentCount,
                                           kFamilyHourlyComponentColumns,
                                           "hourly_component_flashlight"};
 const column_attribute kStateColumns[] = {
-        {COLUMN_TIME, "timestamp"},
-        {COLUMN_TEXT, "name"},
-        {COLUMN_INT, "state"},
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "state"},
 };
 const table_attribute kStateTable = {"1.0", 1, 3, kStateColumns, "raw_flashlight_state"};
 
 // No component table: the component sums are those of the hour's
 // application rows.
 const component_family kFamily = {
-        "flashlight", &kRawApplications, nullptr, &kHourlyApplications, &kHourlyComponent,
-        APPS_FLASHLIGHT, 18, 19,
+    "flashlight",      &kRawApplications, nullptr, &kHourlyApplications,
+    &kHourlyComponent, APPS_FLASHLIGHT,   18,      19,
 };
 
-} // namespace
+}  // namespace
 
 FlashlightHandler::FlashlightHandler()
     : ComponentHandler("FlashlightHandler", ACCOUNTER_FLASHLIGHT, kElector, {&kFamily}),
@@ -160,10 +160,4 @@ void FlashlightHandler::setUser(const String8& name) {
     }
 }
 
-void FlashlightHandler::dump(String8& out) {
-    out.appendFormat("Flashlight: state %d, user %s, pending %s, charged %s\n", mState,
-                     mCurrentUser.c_str(), mPendingUser.c_str(), mChargedUser.c_str());
-    ComponentHandler::dump(out);
-}
-
-} // namespace kelvo
+}  // namespace kelvo

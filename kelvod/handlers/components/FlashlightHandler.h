@@ -1,7 +1,6 @@
 #pragma once
 
 #include <stdint.h>
-
 #include <utils/String8.h>
 
 #include "handlers/components/ComponentHandler.h"
@@ -37,7 +36,6 @@ public:
     int32_t handleLogger(int64_t time, int32_t tag, const char* text) override;
     int32_t handleCustomized(int32_t code, const android::Parcel& data,
                              android::Parcel* reply) override;
-    void dump(android::String8& out) override;
 
 private:
     int32_t changeState(int64_t time, int32_t state);
@@ -53,4 +51,4 @@ private:
     android::String8 mChargedUser;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -13,25 +13,30 @@ namespace kelvo {
 namespace {
 
 const table_attribute kRawApplications = {"1.1", 1, kFamilyRawApplicationsCount,
-                                          kFamilyRawApplicationsColumns,
-                                          "raw_applications_gnss"};
+                                          kFamilyRawApplicationsColumns, "raw_applications_gnss"};
 const table_attribute kRawComponent = {"1.1", 1, kFamilyRawComponentCount,
                                        kFamilyRawComponentColumns, "raw_component_gnss"};
 const table_attribute kHourlyApplications = {"1.0", 1, kFamilyHourlyApplicationsCount,
                                              kFamilyHourlyApplicationsColumns,
                                              "hourly_applications_gnss"};
 const table_attribute kHourlyComponent = {"1.0", 1, kFamilyHourlyComponentCount,
-                                          kFamilyHourlyComponentColumns,
-                                          "hourly_component_gnss"};
+                                          kFamilyHourlyComponentColumns, "hourly_component_gnss"};
 
 const component_family kFamily = {
-        "gnss", &kRawApplications, &kRawComponent, &kHourlyApplications, &kHourlyComponent,
-        APPS_GNSS, 8, 9,
+    "gnss",
+    &kRawApplications,
+    &kRawComponent,
+    &kHourlyApplications,
+    &kHourlyComponent,
+    APPS_GNSS,
+    8,
+    9,
 };
 
-} // namespace
+}  // namespace
 
-GnssHandler::GnssHandler() : ComponentHandler("GnssHandler", ACCOUNTER_GNSS, kElector, {&kFamily}) {}
+GnssHandler::GnssHandler()
+    : ComponentHandler("GnssHandler", ACCOUNTER_GNSS, kElector, {&kFamily}) {}
 
 const component_family& GnssHandler::family() {
     return kFamily;
@@ -62,4 +67,4 @@ int32_t GnssHandler::handleLogger(int64_t time, int32_t tag, const char* text) {
     return 0;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -27,4 +27,4 @@ public:
     int32_t handleLogger(int64_t time, int32_t tag, const char* text) override;
 };
 
-} // namespace kelvo
+}  // namespace kelvo
