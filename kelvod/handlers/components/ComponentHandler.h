@@ -17,42 +17,61 @@ namespace kelvo {
 // Columns of the family's tables. Durations are milliseconds (int), energies
 // in the accounter's unit (long); the result pairs come in the order
 // foreground, background, screen on, screen off, then the charge pairs.
-#define KELVO_RESULT_PAIR_COLUMNS                                                \
-    {COLUMN_INT, "foreground_duration"}, {COLUMN_LONG, "foreground_energy"},     \
-        {COLUMN_INT, "background_duration"}, {COLUMN_LONG, "background_energy"}, \
-        {COLUMN_INT, "screen_on_duration"}, {COLUMN_LONG, "screen_on_energy"},   \
-        {COLUMN_INT, "screen_off_duration"}, {                                   \
-        COLUMN_LONG, "screen_off_energy"                                         \
-    }
-#define KELVO_CHARGE_PAIR_COLUMNS                                                          \
-    {COLUMN_INT, "charge_foreground_duration"}, {COLUMN_LONG, "charge_foreground_energy"}, \
-        {COLUMN_INT, "charge_background_duration"}, {                                      \
-        COLUMN_LONG, "charge_background_energy"                                            \
-    }
-
 inline const column_attribute kFamilyRawApplicationsColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
-    KELVO_RESULT_PAIR_COLUMNS,   KELVO_CHARGE_PAIR_COLUMNS,
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "foreground_duration"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_duration"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_duration"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_duration"},
+    {COLUMN_LONG, "screen_off_energy"},
+    {COLUMN_INT, "charge_foreground_duration"},
+    {COLUMN_LONG, "charge_foreground_energy"},
+    {COLUMN_INT, "charge_background_duration"},
+    {COLUMN_LONG, "charge_background_energy"},
 };
 inline const column_attribute kFamilyRawComponentColumns[] = {
     {COLUMN_TIME, "start_time"},
     {COLUMN_TIME, "end_time"},
-    KELVO_RESULT_PAIR_COLUMNS,
-    KELVO_CHARGE_PAIR_COLUMNS,
+    {COLUMN_INT, "foreground_duration"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_duration"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_duration"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_duration"},
+    {COLUMN_LONG, "screen_off_energy"},
+    {COLUMN_INT, "charge_foreground_duration"},
+    {COLUMN_LONG, "charge_foreground_energy"},
+    {COLUMN_INT, "charge_background_duration"},
+    {COLUMN_LONG, "charge_background_energy"},
 };
 inline const column_attribute kFamilyHourlyApplicationsColumns[] = {
-    {COLUMN_TIME, "timestamp"},
-    {COLUMN_TEXT, "name"},
-    KELVO_RESULT_PAIR_COLUMNS,
+    {COLUMN_TIME, "timestamp"},          {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "foreground_duration"}, {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_duration"}, {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_duration"},  {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_duration"}, {COLUMN_LONG, "screen_off_energy"},
 };
 inline const column_attribute kFamilyHourlyComponentColumns[] = {
-    {COLUMN_TIME, "timestamp"},
-    KELVO_RESULT_PAIR_COLUMNS,
+    {COLUMN_TIME, "timestamp"},         {COLUMN_INT, "foreground_duration"},
+    {COLUMN_LONG, "foreground_energy"}, {COLUMN_INT, "background_duration"},
+    {COLUMN_LONG, "background_energy"}, {COLUMN_INT, "screen_on_duration"},
+    {COLUMN_LONG, "screen_on_energy"},  {COLUMN_INT, "screen_off_duration"},
+    {COLUMN_LONG, "screen_off_energy"},
 };
-constexpr int32_t kFamilyRawApplicationsCount = 15;
-constexpr int32_t kFamilyRawComponentCount = 14;
-constexpr int32_t kFamilyHourlyApplicationsCount = 10;
-constexpr int32_t kFamilyHourlyComponentCount = 9;
+constexpr int32_t kFamilyRawApplicationsCount =
+    static_cast<int32_t>(sizeof(kFamilyRawApplicationsColumns) / sizeof(column_attribute));
+constexpr int32_t kFamilyRawComponentCount =
+    static_cast<int32_t>(sizeof(kFamilyRawComponentColumns) / sizeof(column_attribute));
+constexpr int32_t kFamilyHourlyApplicationsCount =
+    static_cast<int32_t>(sizeof(kFamilyHourlyApplicationsColumns) / sizeof(column_attribute));
+constexpr int32_t kFamilyHourlyComponentCount =
+    static_cast<int32_t>(sizeof(kFamilyHourlyComponentColumns) / sizeof(column_attribute));
 
 // What tells one member of the component handler family from another: its
 // tables, its word in log texts, its applications-accounting code and its
