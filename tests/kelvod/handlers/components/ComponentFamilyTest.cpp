@@ -106,6 +106,9 @@ protected:
             op->join();
         }
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
+        // The process-wide accounting keeps what it was given: into this
+        // test's database, not the next one's.
+        AppsAccounting::getInstance()->balanceAccount();
         KelvoLibAgent::getInstance()->resetAccountersForTest();
         XmlParser::resetInstance();
         WallClock::setFixedTimeMs(-1);
