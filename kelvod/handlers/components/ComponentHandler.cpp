@@ -36,36 +36,56 @@ void clearParcel(Parcel& p) {
     p.setDataPosition(0);
 }
 
+// The four result pairs: foreground, background, screen on, screen off.
+const upload_pair kResultPairs[] = {{0, 1, 5, 4}, {2, 3, 7, 6}, {4, 5, 1, 0}, {6, 7, 3, 2}};
+
 // The energy class of an upload: each (duration, energy) pair whose
 // duration is at least 1, the energy scaled by the period's ratio.
-void energyClass(const ComponentHandler::pair_row& row, float ratio, Parcel& out) {
-    // Fields (duration, energy) of the pairs foreground, background, screen
-    // on, screen off.
-    static const uint32_t kFields[4][2] = {{5, 4}, {7, 6}, {1, 0}, {3, 2}};
-    for (int i = 0; i < 4; ++i) {
-        if (row.v[2 * i] >= 1) {
-            DataUploader::formIntData(kFields[i][0], row.v[2 * i], out);
-            DataUploader::formIntData(kFields[i][1],
-                                      KelvoUtils::scaleEnergy(row.v[2 * i + 1], ratio), out);
+void energyClass(const component_family& family, const ComponentHandler::sum_row& row, float ratio,
+                 Parcel& out) {
+    const upload_pair* pairs = family.uploadPairs != nullptr ? family.uploadPairs : kResultPairs;
+    int32_t count = family.uploadPairs != nullptr ? family.uploadPairCount : 4;
+    const int32_t values = static_cast<int32_t>(row.v.size());
+    for (int32_t i = 0; i < count; ++i) {
+        const upload_pair& pair = pairs[i];
+        if (pair.duration < values && pair.energy < values && row.v[pair.duration] >= 1) {
+            DataUploader::formIntData(pair.durationField, row.v[pair.duration], out);
+            DataUploader::formIntData(pair.energyField,
+                                      KelvoUtils::scaleEnergy(row.v[pair.energy], ratio), out);
         }
     }
 }
 
-// Writes the pairs of a summed row as result columns (int duration, long
-// energy).
-void writePairs(const ComponentHandler::pair_row& row, Parcel& out) {
-    for (int i = 0; i < 4; ++i) {
-        out.writeInt32(KelvoUtils::saturateInt32(row.v[2 * i]));
-        out.writeInt64(row.v[2 * i + 1]);
+// Writes the values of a summed row in the hourly tables' column types.
+void writeValues(const component_family& family, const ComponentHandler::sum_row& row, Parcel& out) {
+    const table_attribute& table = *family.hourlyComponent;
+    for (int32_t c = 1; c < table.count && static_cast<size_t>(c - 1) < row.v.size(); ++c) {
+        if (table.columns[c].type == COLUMN_INT) {
+            out.writeInt32(KelvoUtils::saturateInt32(row.v[c - 1]));
+        } else {
+            out.writeInt64(row.v[c - 1]);
+        }
     }
 }
 
 }  // namespace
 
-const char* const ComponentHandler::kPairSums =
-    "SUM(foreground_duration), SUM(foreground_energy), SUM(background_duration), "
-    "SUM(background_energy), SUM(screen_on_duration), SUM(screen_on_energy), "
-    "SUM(screen_off_duration), SUM(screen_off_energy)";
+String8 ComponentHandler::sumList(const component_family& family) {
+    const table_attribute& table = *family.hourlyComponent;
+    String8 list;
+    for (int32_t c = 1; c < table.count; ++c) {
+        list.appendFormat(c > 1 ? ", SUM(%s)" : "SUM(%s)", table.columns[c].name);
+    }
+    return list;
+}
+
+int32_t ComponentHandler::valueCount(const component_family& family) {
+    return family.hourlyComponent->count - 1;
+}
+
+String8 ComponentHandler::filterClause(const component_family& family) {
+    return family.filter != nullptr ? String8::format(" AND (%s)", family.filter) : String8();
+}
 
 ComponentHandler::ComponentHandler(const char* name, int32_t accounterType, uint32_t elector,
                                    std::vector<const component_family*> families,
@@ -318,19 +338,21 @@ int32_t ComponentHandler::storeComponentResult(const component_family& family, c
     return insertEntries(*family.rawComponent, row, 1, false);
 }
 
-int32_t ComponentHandler::queryPairRows(const String8& sql, bool named, std::vector<pair_row>* out) {
+int32_t ComponentHandler::querySumRows(const String8& sql, bool named, int32_t values,
+                                       std::vector<sum_row>* out) {
     Parcel reply;
     int32_t rows = 0;
-    int32_t ret = queryEntriesSimple(sql, &reply, named ? 10 : 9, rows);
+    int32_t ret = queryEntriesSimple(sql, &reply, 1 + (named ? 1 : 0) + values, rows);
     if (ret < 0) {
         return -17;
     }
     for (int32_t r = 0; r < rows; ++r) {
         int64_t count = 0;
-        pair_row row;
+        sum_row row;
+        row.v.assign(values, 0);
         bool ok = reply.readInt64(&count) == android::NO_ERROR &&
                   (!named || reply.readString8(&row.name) == android::NO_ERROR);
-        for (int i = 0; ok && i < 8; ++i) {
+        for (int32_t i = 0; ok && i < values; ++i) {
             ok = reply.readInt64(&row.v[i]) == android::NO_ERROR;
         }
         if (!ok) {
@@ -356,22 +378,23 @@ int32_t ComponentHandler::logApplicationsAccounting(int64_t time) {
 
 int32_t ComponentHandler::logApplicationsAccounting(const component_family& family, int64_t time) {
     String8 sql = String8::format(
-        "SELECT COUNT(*), name, %s FROM %s WHERE end_time > %lld AND end_time <= %lld "
+        "SELECT COUNT(*), name, %s FROM %s WHERE end_time > %lld AND end_time <= %lld%s "
         "GROUP BY name",
-        kPairSums, family.rawApplications->name, static_cast<long long>(time - kHourMs),
-        static_cast<long long>(time));
-    std::vector<pair_row> sums;
-    int32_t ret = queryPairRows(sql, true, &sums);
+        sumList(family).string(), family.rawApplications->name,
+        static_cast<long long>(time - kHourMs), static_cast<long long>(time),
+        filterClause(family).string());
+    std::vector<sum_row> sums;
+    int32_t ret = querySumRows(sql, true, valueCount(family), &sums);
     if (ret < 0) {
         KLOGE("Failed to query accounting %s data: %d", family.word, ret);
         return -17;
     }
     Parcel rows;
     int32_t count = 0;
-    for (const pair_row& row : sums) {
+    for (const sum_row& row : sums) {
         rows.writeInt64(time);
         rows.writeString8(row.name);
-        writePairs(row, rows);
+        writeValues(family, row, rows);
         if (++count == kRowsPerInsert) {
             insertEntries(*family.hourlyApplications, rows, count, false);
             clearParcel(rows);
@@ -390,14 +413,14 @@ String8 ComponentHandler::componentSumsQuery(const component_family& family, int
         return String8::format(
             "SELECT COUNT(*), %s FROM %s WHERE end_time > %lld AND "
             "end_time <= %lld",
-            kPairSums, family.rawComponent->name, static_cast<long long>(from),
+            sumList(family).string(), family.rawComponent->name, static_cast<long long>(from),
             static_cast<long long>(to));
     }
     return String8::format(
         "SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND "
-        "timestamp <= %lld",
-        kPairSums, family.hourlyApplications->name, static_cast<long long>(from),
-        static_cast<long long>(to));
+        "timestamp <= %lld%s",
+        sumList(family).string(), family.hourlyApplications->name, static_cast<long long>(from),
+        static_cast<long long>(to), filterClause(family).string());
 }
 
 int32_t ComponentHandler::logComponentAccounting(int64_t time) {
@@ -418,8 +441,9 @@ int32_t ComponentHandler::logComponentAccounting(int64_t time) {
 }
 
 int32_t ComponentHandler::logComponentAccounting(const component_family& family, int64_t time) {
-    std::vector<pair_row> sums;
-    int32_t ret = queryPairRows(componentSumsQuery(family, time - kHourMs, time), false, &sums);
+    std::vector<sum_row> sums;
+    int32_t ret = querySumRows(componentSumsQuery(family, time - kHourMs, time), false,
+                               valueCount(family), &sums);
     if (ret < 0) {
         KLOGE("Failed to query component %s data: %d", family.word, ret);
         return -17;
@@ -427,14 +451,19 @@ int32_t ComponentHandler::logComponentAccounting(const component_family& family,
     if (sums.empty()) {
         return 0;
     }
-    const pair_row& row = sums[0];
-    int64_t energy = row.v[1] + row.v[3];
+    const sum_row& row = sums[0];
+    int64_t energy = 0;
+    for (int32_t value : family.compensationValues) {
+        if (value >= 0 && static_cast<size_t>(value) < row.v.size()) {
+            energy += row.v[value];
+        }
+    }
     if (energy >= 1) {
         updateCompensation(time, mElector, energy);
     }
     Parcel out;
     out.writeInt64(time);
-    writePairs(row, out);
+    writeValues(family, row, out);
     return insertEntries(*family.hourlyComponent, out, 1, false);
 }
 
@@ -442,10 +471,10 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
                                           int64_t window, float ratio, Parcel& out) {
     String8 sql =
         String8::format("SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld",
-                        kPairSums, family.hourlyComponent->name,
+                        sumList(family).string(), family.hourlyComponent->name,
                         static_cast<long long>(end - window), static_cast<long long>(end));
-    std::vector<pair_row> sums;
-    if (queryPairRows(sql, false, &sums) < 0) {
+    std::vector<sum_row> sums;
+    if (querySumRows(sql, false, valueCount(family), &sums) < 0) {
         KLOGE("Failed to query hourly component data");
         return -17;
     }
@@ -453,7 +482,7 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
         return 0;
     }
     Parcel energy;
-    energyClass(sums[0], ratio, energy);
+    energyClass(family, sums[0], ratio, energy);
     if (energy.dataSize() > 0) {
         DataUploader::formClassData(family.componentField, kClassEnergy, energy, out);
     }
@@ -463,15 +492,16 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
 int32_t ComponentHandler::uploadTopApplications(const component_family& family, int64_t end,
                                                 int64_t window, float ratio, Parcel& out) {
     String8 sql = String8::format(
-        "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld "
+        "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld%s "
         "GROUP BY name ORDER BY %s DESC LIMIT %d",
-        kPairSums, family.hourlyApplications->name, static_cast<long long>(end - window),
-        static_cast<long long>(end),
-        family.rankByLongestHour ? "MAX(foreground_duration + background_duration)"
+        sumList(family).string(), family.hourlyApplications->name,
+        static_cast<long long>(end - window), static_cast<long long>(end),
+        filterClause(family).string(),
+        family.rankBy != nullptr ? family.rankBy
                                  : "SUM(foreground_duration) + SUM(background_duration)",
         kTopApplications);
-    std::vector<pair_row> rows;
-    int32_t ret = queryPairRows(sql, true, &rows);
+    std::vector<sum_row> rows;
+    int32_t ret = querySumRows(sql, true, valueCount(family), &rows);
     if (ret < 0) {
         KLOGE("Failed to query top applications data: %d", ret);
         return -17;
@@ -480,9 +510,9 @@ int32_t ComponentHandler::uploadTopApplications(const component_family& family, 
         KLOGE("Invalid row count: %zu", rows.size());
         return -2;
     }
-    for (const pair_row& row : rows) {
+    for (const sum_row& row : rows) {
         Parcel energy;
-        energyClass(row, ratio, energy);
+        energyClass(family, row, ratio, energy);
         if (energy.dataSize() == 0) {
             continue;
         }

@@ -73,6 +73,16 @@ constexpr int32_t kFamilyHourlyApplicationsCount =
 constexpr int32_t kFamilyHourlyComponentCount =
     static_cast<int32_t>(sizeof(kFamilyHourlyComponentColumns) / sizeof(column_attribute));
 
+// One (duration, energy) pair of an energy class: indexes into a row's
+// summed values and the class fields they go to. The pair is sent when its
+// duration is at least 1, the energy scaled by the period's ratio.
+struct upload_pair {
+    int32_t duration;
+    int32_t energy;
+    uint32_t durationField;
+    uint32_t energyField;
+};
+
 // What tells one member of the component handler family from another: its
 // tables, its word in log texts, its applications-accounting code and its
 // upload fields. Every member shares the hourly cycle built on them.
@@ -84,14 +94,26 @@ struct component_family {
     // Raw component results (start_time, end_time, pairs); null for a member
     // whose component sums are those of its hourly application rows.
     const table_attribute* rawComponent;
-    const table_attribute* hourlyApplications;  // timestamp, name, result pairs
-    const table_attribute* hourlyComponent;     // timestamp, result pairs
-    int32_t appsCode;                           // code in the applications accounting
-    uint32_t componentField;                    // upload field of the component class
-    uint32_t applicationsField;                 // upload field of the top-application array
-    // Ranking of the top applications: by summed time, or by the longest
-    // single hour (members whose hourly rows overlap, like shared users).
-    bool rankByLongestHour = false;
+    // The hourly tables: timestamp (and name), then the summed values. The
+    // values summed every hour are the hourly component table's columns
+    // after its timestamp; the raw tables hold them under the same names.
+    const table_attribute* hourlyApplications;
+    const table_attribute* hourlyComponent;
+    int32_t appsCode;            // code in the applications accounting
+    uint32_t componentField;     // upload field of the component class
+    uint32_t applicationsField;  // upload field of the top-application array
+    // The pairs of the energy class; null for the four result pairs.
+    const upload_pair* uploadPairs = nullptr;
+    int32_t uploadPairCount = 0;
+    // The summed values whose total is the hour's compensation energy (-1
+    // unused): by default the foreground and background energies.
+    int32_t compensationValues[2] = {1, 3};
+    // An extra condition of every query ("name != 'screen_off'"), or null.
+    const char* filter = nullptr;
+    // The ranking of the top applications, or null for the summed
+    // foreground and background time ("MAX(foreground_duration +
+    // background_duration)" for members whose hourly rows overlap).
+    const char* rankBy = nullptr;
 };
 
 // Whether and how a member's component is governed by the data-source policy
@@ -125,11 +147,10 @@ public:
         CANDIDATE_DAWN_UPLOAD = 8,
     };
 
-    // One summed row of the result pairs (foreground, background, screen
-    // on, screen off; duration then energy), with its name when grouped.
-    struct pair_row {
+    // One summed row: the name when grouped, the family's values in order.
+    struct sum_row {
         android::String8 name;
-        int64_t v[8] = {0, 0, 0, 0, 0, 0, 0, 0};
+        std::vector<int64_t> v;
     };
 
     // A member with more than one table set (one per camera) passes them
@@ -153,13 +174,10 @@ public:
     static int32_t readPolicy(int32_t component, int32_t* policy);
 
     // Runs a query whose first column is COUNT(*), then the name when named,
-    // then the eight sums; rows over no data (the count is 0, the sums NULL)
+    // then `values` sums; rows over no data (the count is 0, the sums NULL)
     // are no rows. 0, or -17 for a failed query or a reply of another shape.
-    static int32_t queryPairRows(const android::String8& sql, bool named,
-                                 std::vector<pair_row>* out);
-
-    // The select list of the eight summed result columns.
-    static const char* const kPairSums;
+    static int32_t querySumRows(const android::String8& sql, bool named, int32_t values,
+                                std::vector<sum_row>* out);
 
     int32_t getPolicy() const { return mPolicy; }
 
@@ -205,6 +223,11 @@ private:
     // hourly application rows for a member without one.
     static android::String8 componentSumsQuery(const component_family& family, int64_t from,
                                                int64_t to);
+    // "SUM(a), SUM(b), ..." over the family's values, and their count.
+    static android::String8 sumList(const component_family& family);
+    static int32_t valueCount(const component_family& family);
+    // " AND (filter)" or nothing.
+    static android::String8 filterClause(const component_family& family);
 };
 
 }  // namespace kelvo
