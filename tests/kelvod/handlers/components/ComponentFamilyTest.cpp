@@ -10,6 +10,8 @@
 #include <chrono>
 #include <memory>
 #include <string>
+#include <tuple>
+#include <utility>
 #include <vector>
 
 #include "HealthCounters.h"
@@ -319,6 +321,91 @@ TEST(ComponentPolicyTest, PolicyAcceptedPerMember) {
         member->join();
     }
     XmlParser::resetInstance();
+}
+
+}  // namespace
+
+namespace {
+
+// A two-value member (duration, energy) without a component table: a query
+// filter, its own ranking and energy-class pairs, all as parameters.
+const column_attribute kTwoRaw[] = {{COLUMN_TIME, "start_time"},
+                                    {COLUMN_TIME, "end_time"},
+                                    {COLUMN_TEXT, "name"},
+                                    {COLUMN_INT, "duration"},
+                                    {COLUMN_LONG, "energy"}};
+const column_attribute kTwoApps[] = {{COLUMN_TIME, "timestamp"},
+                                     {COLUMN_TEXT, "name"},
+                                     {COLUMN_INT, "duration"},
+                                     {COLUMN_LONG, "energy"}};
+const column_attribute kTwoComponent[] = {
+    {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "duration"}, {COLUMN_LONG, "energy"}};
+const table_attribute kTwoRawTable = {"1.0", 1, 5, kTwoRaw, "raw_applications_two"};
+const table_attribute kTwoAppsTable = {"1.0", 1, 4, kTwoApps, "hourly_applications_two"};
+const table_attribute kTwoComponentTable = {"1.0", 1, 3, kTwoComponent, "hourly_component_two"};
+const upload_pair kTwoPairs[] = {{0, 1, 5, 4}};
+component_family twoFamily() {
+    component_family f = {
+        "two", &kTwoRawTable, nullptr, &kTwoAppsTable, &kTwoComponentTable, APPS_GPU, 12, 13};
+    f.uploadPairs = kTwoPairs;
+    f.uploadPairCount = 1;
+    f.compensationValues[0] = 1;
+    f.compensationValues[1] = -1;
+    f.filter = "name != 'screen_off'";
+    f.rankBy = "SUM(energy)";
+    return f;
+}
+const component_family kTwo = twoFamily();
+
+class TwoValueTest : public kelvo::test::AgentStorageTest {
+protected:
+    void addTables() override {
+        mMember = new ComponentHandler("TwoValueMember", -1, 0x800, {&kTwo});
+        mMember->addSchemaTable();
+        DataUploader::getInstance()->addSchemaTable();
+    }
+    void TearDown() override {
+        mMember->requestThreadExit();
+        mMember->join();
+        kelvo::test::AgentStorageTest::TearDown();
+    }
+    sp<ComponentHandler> mMember;
+};
+
+TEST_F(TwoValueTest, VariantsAreParameters) {
+    Parcel raw;
+    for (auto [name, duration, energy] :
+         {std::tuple<const char*, int32_t, int64_t>{"com.a", 100, 50},
+          {"screen_off", 1000, 500},
+          {"com.b", 200, 10}}) {
+        raw.writeInt64(kT);
+        raw.writeInt64(kT + duration);
+        raw.writeString8(String8(name));
+        raw.writeInt32(duration);
+        raw.writeInt64(energy);
+    }
+    ASSERT_EQ(0, StorageOperator::insertEntries(kTwoRawTable, raw, 3, false));
+    Parcel at, upload;
+    at.writeInt64(kH);
+    upload.writeFloat(1.0f);
+    upload.writeInt64(kH);
+    for (auto [type, body] : {std::pair<int32_t, Parcel*>{NOTIFICATION_APPLICATIONS_ACCOUNTING, &at},
+                              {NOTIFICATION_COMPONENT_ACCOUNTING, &at},
+                              {NOTIFICATION_HOURLY_UPLOADING, &upload}}) {
+        mMember->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, *body));
+    }
+    EXPECT_EQ((std::vector<std::string>{"com.a|100|50", "com.b|200|10"}),
+              rows("SELECT name, duration, energy FROM hourly_applications_two ORDER BY name"));
+    EXPECT_EQ(std::vector<std::string>{"300|60"},
+              rows("SELECT duration, energy FROM hourly_component_two"));
+    DataUploader::getInstance()->uploadEvent();
+    ASSERT_FALSE(events().empty());
+    Json::Value p = events().back()["params"];
+    EXPECT_EQ(300, p["12"]["params"]["5"].asInt64());
+    EXPECT_EQ(60, p["12"]["params"]["4"].asInt64());
+    ASSERT_EQ(2u, p["13"].size());  // ranked by energy: com.a first
+    EXPECT_EQ("com.a", p["13"][0]["params"]["3"]["params"]["0"].asString());
+    EXPECT_EQ(10, p["13"][1]["params"]["1"]["params"]["4"].asInt64());
 }
 
 }  // namespace
