@@ -323,10 +323,6 @@ TEST(ComponentPolicyTest, PolicyAcceptedPerMember) {
     XmlParser::resetInstance();
 }
 
-}  // namespace
-
-namespace {
-
 // A two-value member (duration, energy) without a component table: a query
 // filter, its own ranking and energy-class pairs, all as parameters.
 const column_attribute kTwoRaw[] = {{COLUMN_TIME, "start_time"},
@@ -349,8 +345,7 @@ component_family twoFamily() {
         "two", &kTwoRawTable, nullptr, &kTwoAppsTable, &kTwoComponentTable, APPS_GPU, 12, 13};
     f.uploadPairs = kTwoPairs;
     f.uploadPairCount = 1;
-    f.compensationValues[0] = 1;
-    f.compensationValues[1] = -1;
+    f.compensationValues[1] = -1;  // the energy alone
     f.filter = "name != 'screen_off'";
     f.rankBy = "SUM(energy)";
     return f;
