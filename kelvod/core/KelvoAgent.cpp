@@ -13,6 +13,8 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/CpuHandler.h"
+#include "handlers/components/FlashlightHandler.h"
+#include "handlers/components/GnssHandler.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
@@ -34,6 +36,14 @@ android::sp<KelvoOperator> makeCpuHandler() {
     return new CpuHandler();
 }
 
+android::sp<KelvoOperator> makeGnssHandler() {
+    return new GnssHandler();
+}
+
+android::sp<KelvoOperator> makeFlashlightHandler() {
+    return new FlashlightHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -48,6 +58,8 @@ struct Factories {
         handlers[HANDLER_CPU] = &makeCpuHandler;
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
+        handlers[HANDLER_GNSS] = &makeGnssHandler;
+        handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
     }
 
     std::mutex lock;

@@ -23,7 +23,7 @@ fi
 # for the threads.
 for _ in $(seq 1 100); do
     names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
-    case " $names " in *" BufferedLogServ "*" HourlyRoutine "*) break;; esac
+    case " $names " in *" BufferedLogServ "*" HourlyRoutine "*" PollingRoutine "*) break;; esac
     sleep 0.05
 done
 echo "threads: $names"
