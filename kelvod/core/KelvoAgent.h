@@ -9,6 +9,7 @@
 #include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
+#include "core/QueryService.h"
 #include "storage/KelvoStorage.h"
 
 namespace kelvo {
@@ -70,7 +71,12 @@ public:
     void forceFlushDatabase();
     // Hands one error row (int64 time, String8 text) to the system handler.
     void logError(const android::Parcel& data);
+    // Each present handler, then each routine, appends its text, made on its
+    // own thread; one that does not answer within kDumpWaitMs (or what is
+    // left of kDumpBudgetMs) is skipped.
     void handleDump(android::String8& out);
+    static constexpr int64_t kDumpWaitMs = 1000;
+    static constexpr int64_t kDumpBudgetMs = 5000;
     void cleanTables(int64_t time);
     int64_t getSystemBootTime() const { return mStartTime; }
 
@@ -107,6 +113,7 @@ private:
 
     int64_t mStartTime;
     android::sp<KelvoStorage> mStorage;
+    android::sp<QueryService> mQueryService;
     // Written only during start-up, but read by any thread that logs an
     // error meanwhile: every access goes through the slot lock.
     std::mutex mSlotLock;

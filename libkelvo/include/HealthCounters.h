@@ -33,6 +33,7 @@ enum class Health : uint32_t {
     SettingsRefused,         // property values refused (not a number, out of range): default used
     AccounterStateCapped,    // accounter state grown from log text refused at its cap
     RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
+    ServiceRequestsRefused,  // binder requests refused or cut (caller, path, push message, query, reply size)
     Count
 };
 
