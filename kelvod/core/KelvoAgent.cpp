@@ -123,6 +123,7 @@ void KelvoAgent::setExitHook(ExitHook hook) {
 
 KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {
     mStorage = new KelvoStorage(this);
+    mQueryService = new QueryService();
 }
 
 android::sp<KelvoOperator> KelvoAgent::getHandler(int32_t id) {
@@ -157,7 +158,6 @@ int32_t KelvoAgent::initiate() {
     startStorage();
     startHidlService();
     startLibrary();
-    mQueryService = new QueryService();
     publishService();
     startBatteryListener();
     // Listening before any operator registers for its entries.
@@ -304,8 +304,7 @@ int32_t KelvoAgent::sendToRoutine(int32_t id, int32_t code, const android::Parce
 }
 
 void KelvoAgent::requestQuery(int32_t code, const android::Parcel& data) {
-    if (mQueryService == nullptr ||
-        mQueryService->sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, code, data)) < 0) {
+    if (mQueryService->sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, code, data)) < 0) {
         KLOGE("Failed to post query: %d", code);
     }
 }
