@@ -37,4 +37,4 @@ android::status_t BnKelvoListener::onTransact(uint32_t code, const android::Parc
     return android::NO_ERROR;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

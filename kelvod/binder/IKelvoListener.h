@@ -26,4 +26,4 @@ protected:
                                  uint32_t flags = 0) override;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

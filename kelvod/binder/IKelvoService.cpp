@@ -133,4 +133,4 @@ android::status_t BnKelvoService::onTransact(uint32_t code, const android::Parce
     }
 }
 
-} // namespace kelvo
+}  // namespace kelvo

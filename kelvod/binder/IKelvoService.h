@@ -42,4 +42,4 @@ protected:
                                  uint32_t flags = 0) override;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -30,39 +30,39 @@ struct log_module {
 };
 
 const log_module kLogModules[] = {
-        {"module", LOG_MODULE_ALL},
-        {"audio", LOG_MODULE_AUDIO},
-        {"battery", LOG_MODULE_BATTERY},
-        {"bluetooth", LOG_MODULE_BLUETOOTH},
-        {"camera", LOG_MODULE_CAMERA},
-        {"cpu", LOG_MODULE_CPU},
-        {"display", LOG_MODULE_DISPLAY},
-        {"flashlight", LOG_MODULE_FLASHLIGHT},
-        {"abnormality", LOG_MODULE_ABNORMALITY},
-        {"gnss", LOG_MODULE_GNSS},
-        {"gpu", LOG_MODULE_GPU},
-        {"modem", LOG_MODULE_MODEM},
-        {"sensor", LOG_MODULE_SENSOR},
-        {"wifi", LOG_MODULE_WIFI},
-        {"dpm", LOG_MODULE_DPM},
-        {"system", LOG_MODULE_SYSTEM},
-        {"thermal", LOG_MODULE_THERMAL},
-        {"storage", LOG_MODULE_STORAGE},
-        {"dispatcher", LOG_MODULE_DISPATCHER},
-        {"bufferedlog", LOG_MODULE_BUFFEREDLOG},
+    {"module", LOG_MODULE_ALL},
+    {"audio", LOG_MODULE_AUDIO},
+    {"battery", LOG_MODULE_BATTERY},
+    {"bluetooth", LOG_MODULE_BLUETOOTH},
+    {"camera", LOG_MODULE_CAMERA},
+    {"cpu", LOG_MODULE_CPU},
+    {"display", LOG_MODULE_DISPLAY},
+    {"flashlight", LOG_MODULE_FLASHLIGHT},
+    {"abnormality", LOG_MODULE_ABNORMALITY},
+    {"gnss", LOG_MODULE_GNSS},
+    {"gpu", LOG_MODULE_GPU},
+    {"modem", LOG_MODULE_MODEM},
+    {"sensor", LOG_MODULE_SENSOR},
+    {"wifi", LOG_MODULE_WIFI},
+    {"dpm", LOG_MODULE_DPM},
+    {"system", LOG_MODULE_SYSTEM},
+    {"thermal", LOG_MODULE_THERMAL},
+    {"storage", LOG_MODULE_STORAGE},
+    {"dispatcher", LOG_MODULE_DISPATCHER},
+    {"bufferedlog", LOG_MODULE_BUFFEREDLOG},
 };
 
 const char* const kHelpLines[] = {
-        "Kelvo daemon dumpsys help information\n",
-        "command: dumpsys KelvoService [options]\n",
-        "options:\n",
-        "  --version    -v : show kelvod version\n",
-        "  --help       -h : show this help information\n",
-        "  --dump       -d : dump message for handlers and routines\n",
-        "  --log        -l : log print control\n",
-        "  --flush      -f : force flush database\n",
-        "  --balance    -b : force balance\n",
-        "  --discharge     : change charging status on/off\n",
+    "Kelvo daemon dumpsys help information\n",
+    "command: dumpsys KelvoService [options]\n",
+    "options:\n",
+    "  --version    -v : show kelvod version\n",
+    "  --help       -h : show this help information\n",
+    "  --dump       -d : dump message for handlers and routines\n",
+    "  --log        -l : log print control\n",
+    "  --flush      -f : force flush database\n",
+    "  --balance    -b : force balance\n",
+    "  --discharge     : change charging status on/off\n",
 };
 
 const char kDumpPermission[] = "android.permission.DUMP";
@@ -71,7 +71,7 @@ bool isSwitchValue(const android::String8& value) {
     return value == "1" || value == "0";
 }
 
-} // namespace
+}  // namespace
 
 KelvoService::KelvoService(const android::sp<KelvoAgent>& agent) : mAgent(agent) {}
 
@@ -180,8 +180,8 @@ android::status_t KelvoService::dump(int fd, const android::Vector<android::Stri
     pid_t pid = ipc->getCallingPid();
     uid_t uid = ipc->getCallingUid();
     android::String8 out;
-    if (uid != kShellUid && !android::PermissionCache::checkPermission(
-                                    android::String16(kDumpPermission), pid, uid)) {
+    if (uid != kShellUid &&
+        !android::PermissionCache::checkPermission(android::String16(kDumpPermission), pid, uid)) {
         out.appendFormat("Permission Denial: cannot dump KELVO information from pid=%d, uid=%d\n",
                          static_cast<int32_t>(pid), static_cast<int32_t>(uid));
     } else {
@@ -260,9 +260,10 @@ void KelvoService::switchLog(const android::String8& module, const android::Stri
             return;
         }
     }
-    out.append("Error: [module] = {module, debug, info, audio, bluetooth, camera, cpu, display, "
-               "flashlight, gnss, modem, sensor, wifi, dpm, system, thermal, storage, "
-               "dispatcher, bufferedlog}\n");
+    out.append(
+        "Error: [module] = {module, debug, info, audio, bluetooth, camera, cpu, display, "
+        "flashlight, gnss, modem, sensor, wifi, dpm, system, thermal, storage, "
+        "dispatcher, bufferedlog}\n");
 }
 
 void KelvoService::switchCharge(const android::String8& value, android::String8& out) {
@@ -286,4 +287,4 @@ void KelvoService::switchCharge(const android::String8& value, android::String8&
     Notifier::getInstance()->sendNotification(NOTIFICATION_CHARGER_ONLINE_CHANGED, body);
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -1,9 +1,8 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stdint.h>
 #include <sys/types.h>
-
-#include <binder/Parcel.h>
 #include <utils/String16.h>
 #include <utils/String8.h>
 #include <utils/Vector.h>
@@ -24,7 +23,8 @@ public:
     static constexpr uid_t kSystemUid = 1000;
     // Always allowed to dump.
     static constexpr uid_t kShellUid = 2000;
-    static constexpr const char* kChargeSwitchPath = "/sys/class/tv_power/charger/charge_data/enable_hiz";
+    static constexpr const char* kChargeSwitchPath =
+        "/sys/class/tv_power/charger/charge_data/enable_hiz";
     static constexpr const char* kCollectionRoot = "/data/log/";
 
     explicit KelvoService(const android::sp<KelvoAgent>& agent);
@@ -55,4 +55,4 @@ private:
     const android::sp<KelvoAgent> mAgent;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -46,7 +46,7 @@ int32_t check(const std::string& message, std::string* extra) {
     return 0;
 }
 
-} // namespace
+}  // namespace
 
 int32_t PushMessage::parse(const std::string& message, std::string* extra) {
     if (message.empty() || message.size() > kMaxMessageBytes || extra == nullptr) {
@@ -60,4 +60,4 @@ int32_t PushMessage::parse(const std::string& message, std::string* extra) {
     }
 }
 
-} // namespace kelvo
+}  // namespace kelvo

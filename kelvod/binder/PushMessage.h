@@ -23,4 +23,4 @@ public:
     static int32_t parse(const std::string& message, std::string* extra);
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -24,20 +24,20 @@ struct module_form {
 
 // By module id; battery and DPM have forms of their own.
 const module_form kModules[QueryService::MODULE_COUNT] = {
-        {nullptr, false, nullptr},
-        {"audio", false, "Failed to query audio data"},
-        {"bluetooth", false, "Failed to query bluetooth data"},
-        {"front_camera", false, "Failed to query front camera data"},
-        {"rear_camera", false, "Failed to query rear camera data"},
-        {"cpu", false, "Failed to query cpu data"},
-        {"backlight", true, "Failed to query dispaly data"},
-        {nullptr, false, nullptr},
-        {"flashlight", false, "Failed to query flashlight data"},
-        {"gnss", false, "Failed to query gnss data"},
-        {"gpu", true, "Failed to query gpu data"},
-        {"modem", false, "Failed to query modem data"},
-        {"sensor", false, "Failed to query sensor data"},
-        {"wifi", false, "Failed to query wifi data"},
+    {nullptr, false, nullptr},
+    {"audio", false, "Failed to query audio data"},
+    {"bluetooth", false, "Failed to query bluetooth data"},
+    {"front_camera", false, "Failed to query front camera data"},
+    {"rear_camera", false, "Failed to query rear camera data"},
+    {"cpu", false, "Failed to query cpu data"},
+    {"backlight", true, "Failed to query dispaly data"},
+    {nullptr, false, nullptr},
+    {"flashlight", false, "Failed to query flashlight data"},
+    {"gnss", false, "Failed to query gnss data"},
+    {"gpu", true, "Failed to query gpu data"},
+    {"modem", false, "Failed to query modem data"},
+    {"sensor", false, "Failed to query sensor data"},
+    {"wifi", false, "Failed to query wifi data"},
 };
 
 long long ll(int64_t value) {
@@ -48,7 +48,7 @@ long long ll(int64_t value) {
 // into no row at all, so the block says "no data".
 constexpr const char* kSomeRows = " HAVING COUNT(*) > 0";
 
-} // namespace
+}  // namespace
 
 QueryService::QueryService() : HandlerThread("QueryService", -2) {}
 
@@ -98,8 +98,7 @@ void QueryService::answer(const android::Parcel& request, const android::Parcel&
     listener->onQueryResponse(reply);
 }
 
-int32_t QueryService::handleQueryComponent(const android::Parcel& request,
-                                           android::Parcel* reply) {
+int32_t QueryService::handleQueryComponent(const android::Parcel& request, android::Parcel* reply) {
     int64_t start = 0;
     int64_t end = 0;
     int32_t mask = 0;
@@ -145,14 +144,16 @@ int32_t QueryService::queryMultiData(int64_t start, int64_t end, int32_t flag, c
                                      android::Parcel* reply) {
     android::String8 sql;
     if (flag == kFlagTotals) {
-        sql.appendFormat("SELECT SUM(foreground_energy), SUM(background_energy) FROM "
-                         "raw_applications_%s WHERE start_time >= %lld AND end_time <= %lld%s",
-                         table, ll(start), ll(end), kSomeRows);
+        sql.appendFormat(
+            "SELECT SUM(foreground_energy), SUM(background_energy) FROM "
+            "raw_applications_%s WHERE start_time >= %lld AND end_time <= %lld%s",
+            table, ll(start), ll(end), kSomeRows);
     } else {
-        sql.appendFormat("SELECT timestamp, SUM(foreground_energy + background_energy) FROM "
-                         "hourly_component_%s WHERE timestamp > %lld AND timestamp <= %lld "
-                         "GROUP BY timestamp",
-                         table, ll(start), ll(end));
+        sql.appendFormat(
+            "SELECT timestamp, SUM(foreground_energy + background_energy) FROM "
+            "hourly_component_%s WHERE timestamp > %lld AND timestamp <= %lld "
+            "GROUP BY timestamp",
+            table, ll(start), ll(end));
     }
     return doQueryData(sql, 2, reply);
 }
@@ -162,14 +163,16 @@ int32_t QueryService::querySimpleData(int64_t start, int64_t end, int32_t flag, 
     android::String8 sql;
     int32_t columns = 2;
     if (flag == kFlagTotals) {
-        sql.appendFormat("SELECT SUM(energy) FROM raw_applications_%s WHERE start_time >= %lld "
-                         "AND end_time <= %lld%s",
-                         table, ll(start), ll(end), kSomeRows);
+        sql.appendFormat(
+            "SELECT SUM(energy) FROM raw_applications_%s WHERE start_time >= %lld "
+            "AND end_time <= %lld%s",
+            table, ll(start), ll(end), kSomeRows);
         columns = 1;
     } else {
-        sql.appendFormat("SELECT timestamp, SUM(energy) FROM hourly_component_%s WHERE "
-                         "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
-                         table, ll(start), ll(end));
+        sql.appendFormat(
+            "SELECT timestamp, SUM(energy) FROM hourly_component_%s WHERE "
+            "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
+            table, ll(start), ll(end));
     }
     return doQueryData(sql, columns, reply);
 }
@@ -179,16 +182,18 @@ int32_t QueryService::queryBatteryData(int64_t start, int64_t end, int32_t flag,
     android::String8 sql;
     int32_t columns = 2;
     if (flag == kFlagTotals) {
-        sql.appendFormat("SELECT SUM(discharge_screen_on_gas_gauge + "
-                         "discharge_screen_off_gas_gauge) FROM raw_component_battery WHERE "
-                         "start_time >= %lld AND end_time <= %lld%s",
-                         ll(start), ll(end), kSomeRows);
+        sql.appendFormat(
+            "SELECT SUM(discharge_screen_on_gas_gauge + "
+            "discharge_screen_off_gas_gauge) FROM raw_component_battery WHERE "
+            "start_time >= %lld AND end_time <= %lld%s",
+            ll(start), ll(end), kSomeRows);
         columns = 1;
     } else {
-        sql.appendFormat("SELECT timestamp, SUM(discharge_screen_on_gas_gauge + "
-                         "discharge_screen_off_gas_gauge) FROM hourly_component_battery WHERE "
-                         "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
-                         ll(start), ll(end));
+        sql.appendFormat(
+            "SELECT timestamp, SUM(discharge_screen_on_gas_gauge + "
+            "discharge_screen_off_gas_gauge) FROM hourly_component_battery WHERE "
+            "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
+            ll(start), ll(end));
     }
     return doQueryData(sql, columns, reply);
 }
@@ -197,8 +202,8 @@ int32_t QueryService::queryDpmData(int64_t start, int64_t end, int32_t flag,
                                    android::Parcel* reply) {
     // The DPM handler first stores what it counted so far.
     android::Parcel dpmReply;
-    if (KelvoAgent::getInstance()->sendToHandler(HANDLER_DPM, kDpmStoreCounters,
-                                                 android::Parcel(), &dpmReply, true) < 0) {
+    if (KelvoAgent::getInstance()->sendToHandler(HANDLER_DPM, kDpmStoreCounters, android::Parcel(),
+                                                 &dpmReply, true) < 0) {
         KLOGE("Failed to send message to dpm");
         reply->writeInt32(kNoData);
         return -2;
@@ -206,15 +211,17 @@ int32_t QueryService::queryDpmData(int64_t start, int64_t end, int32_t flag,
     android::String8 sql;
     int32_t columns = 2;
     if (flag == kFlagTotals) {
-        sql.appendFormat("SELECT ip, SUM(off_time), SUM(busy_time), SUM(busy_time_low_voltage), "
-                         "SUM(idle_time), SUM(energy) FROM raw_component_dpm WHERE start_time "
-                         ">= %lld AND end_time <= %lld GROUP BY ip ORDER BY SUM(energy) DESC",
-                         ll(start), ll(end));
+        sql.appendFormat(
+            "SELECT ip, SUM(off_time), SUM(busy_time), SUM(busy_time_low_voltage), "
+            "SUM(idle_time), SUM(energy) FROM raw_component_dpm WHERE start_time "
+            ">= %lld AND end_time <= %lld GROUP BY ip ORDER BY SUM(energy) DESC",
+            ll(start), ll(end));
         columns = 6;
     } else {
-        sql.appendFormat("SELECT timestamp, SUM(energy) FROM hourly_component_dpm WHERE "
-                         "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
-                         ll(start), ll(end));
+        sql.appendFormat(
+            "SELECT timestamp, SUM(energy) FROM hourly_component_dpm WHERE "
+            "timestamp > %lld AND timestamp <= %lld GROUP BY timestamp",
+            ll(start), ll(end));
     }
     return doQueryData(sql, columns, reply);
 }
@@ -268,9 +275,10 @@ int32_t QueryService::handleQueryApplications(const android::Parcel& request,
     }
     reply->writeInt32(QUERY_APPLICATIONS);
     android::String8 sql;
-    sql.appendFormat("SELECT timestamp FROM hourly_applications_accounting WHERE timestamp > %lld "
-                     "AND timestamp <= %lld GROUP BY timestamp ORDER BY timestamp",
-                     ll(start), ll(end));
+    sql.appendFormat(
+        "SELECT timestamp FROM hourly_applications_accounting WHERE timestamp > %lld "
+        "AND timestamp <= %lld GROUP BY timestamp ORDER BY timestamp",
+        ll(start), ll(end));
     android::Parcel hours;
     if (doQueryData(sql, 1, &hours) < 0) {
         reply->writeInt32(kNoData);
@@ -294,10 +302,11 @@ int32_t QueryService::queryApplicationsData(int64_t hour, int32_t top, android::
         return 0;
     }
     android::String8 sql;
-    sql.appendFormat("SELECT timestamp, name, SUM(foreground_energy + background_energy) FROM "
-                     "hourly_applications_accounting WHERE timestamp = %lld GROUP BY name ORDER "
-                     "BY SUM(foreground_energy + background_energy) DESC LIMIT %d",
-                     ll(hour), top);
+    sql.appendFormat(
+        "SELECT timestamp, name, SUM(foreground_energy + background_energy) FROM "
+        "hourly_applications_accounting WHERE timestamp = %lld GROUP BY name ORDER "
+        "BY SUM(foreground_energy + background_energy) DESC LIMIT %d",
+        ll(hour), top);
     android::Parcel rows;
     if (doQueryData(sql, 3, &rows) < 0) {
         KLOGE("Failed to query applications");
@@ -321,4 +330,4 @@ int32_t QueryService::queryApplicationsData(int64_t hour, int32_t top, android::
     return 0;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

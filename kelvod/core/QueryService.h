@@ -1,9 +1,8 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stddef.h>
 #include <stdint.h>
-
-#include <binder/Parcel.h>
 #include <utils/String8.h>
 
 #include "storage/StorageOperator.h"
@@ -79,4 +78,4 @@ private:
     void answer(const android::Parcel& request, const android::Parcel& reply);
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -13,8 +13,8 @@ namespace kelvo {
 namespace {
 
 const char* const kModuleNames[QueryService::MODULE_COUNT] = {
-        "battery",   "audio", "bluetooth", "front_camera", "rear_camera", "cpu",    "display",
-        "dpm",       "flashlight", "gnss", "gpu",          "modem",       "sensor", "wifi",
+    "battery", "audio",      "bluetooth", "front_camera", "rear_camera", "cpu",    "display",
+    "dpm",     "flashlight", "gnss",      "gpu",          "modem",       "sensor", "wifi",
 };
 
 // Values per row of a module's block.
@@ -40,16 +40,15 @@ std::string format(const char* fmt, int64_t value) {
     return buf;
 }
 
-} // namespace
+}  // namespace
 
 android::sp<IKelvoService> KelvoQueryClient::connect() {
-    android::sp<android::IBinder> binder = android::defaultServiceManager()->getService(
-            android::String16(KelvoService::kServiceName));
+    android::sp<android::IBinder> binder =
+        android::defaultServiceManager()->getService(android::String16(KelvoService::kServiceName));
     return binder == nullptr ? nullptr : android::interface_cast<IKelvoService>(binder);
 }
 
-KelvoQueryClient::KelvoQueryClient(const android::sp<IKelvoService>& service)
-    : mService(service) {}
+KelvoQueryClient::KelvoQueryClient(const android::sp<IKelvoService>& service) : mService(service) {}
 
 bool KelvoQueryClient::queryComponent(int64_t start, int64_t end, int32_t mask, int32_t flag,
                                       android::Parcel* response, int timeoutMs) {
@@ -70,8 +69,8 @@ bool KelvoQueryClient::queryApplications(int64_t start, int64_t end, int32_t top
     return send(IKelvoService::REQUEST_QUERY_APPLICATIONS, query, response, timeoutMs);
 }
 
-bool KelvoQueryClient::send(uint32_t code, const android::Parcel& fields,
-                            android::Parcel* response, int timeoutMs) {
+bool KelvoQueryClient::send(uint32_t code, const android::Parcel& fields, android::Parcel* response,
+                            int timeoutMs) {
     if (mService == nullptr) {
         return false;
     }
@@ -129,8 +128,7 @@ std::string KelvoQueryClient::formatApplications(const android::Parcel& response
     response.setDataPosition(0);
     int32_t kind = -1;
     int32_t hours = 0;
-    if (response.readInt32(&kind) != android::NO_ERROR ||
-        kind != QueryService::QUERY_APPLICATIONS ||
+    if (response.readInt32(&kind) != android::NO_ERROR || kind != QueryService::QUERY_APPLICATIONS ||
         response.readInt32(&hours) != android::NO_ERROR) {
         return "malformed reply\n";
     }
@@ -160,4 +158,4 @@ std::string KelvoQueryClient::formatApplications(const android::Parcel& response
     return out;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -37,4 +37,4 @@ private:
     android::sp<IKelvoService> mService;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -36,7 +36,7 @@ bool parseNumber(const char* text, long long* out) {
     return true;
 }
 
-} // namespace
+}  // namespace
 
 int main(int argc, char** argv) {
     int i = 1;
@@ -52,7 +52,8 @@ int main(int argc, char** argv) {
     long long values[4] = {0, 0, 0, 0};
     int count = argc - i;
     bool component = command == "component";
-    if ((component && (count < 3 || count > 4)) || (!component && (command != "apps" || count != 3))) {
+    if ((component && (count < 3 || count > 4)) ||
+        (!component && (command != "apps" || count != 3))) {
         usage();
         return 2;
     }

@@ -23,4 +23,4 @@ bool QueryListener::waitResponse(android::Parcel* out, int timeoutMs) {
     return true;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

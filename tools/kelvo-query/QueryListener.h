@@ -23,4 +23,4 @@ private:
     android::Parcel mResponse;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

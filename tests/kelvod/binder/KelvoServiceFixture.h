@@ -34,8 +34,8 @@ protected:
         chmod(mRoot->path().c_str(), 0755);
         android::PermissionCache::purge();
         auto sm = android::defaultServiceManager();
-        ASSERT_EQ(android::NO_ERROR,
-                  sm->addService(android::String16("permission"), new FakePermissionService(mState)));
+        ASSERT_EQ(android::NO_ERROR, sm->addService(android::String16("permission"),
+                                                    new FakePermissionService(mState)));
         ASSERT_EQ(android::NO_ERROR, KelvoService::publish(KelvoAgent::getInstance()));
         chmod((mRoot->path() + "/dev/binder").c_str(), 01777);
         mService = sm->getService(android::String16(KelvoService::kServiceName));
@@ -90,7 +90,7 @@ protected:
 
     static android::sp<android::IBinder> service() {
         return android::defaultServiceManager()->getService(
-                android::String16(KelvoService::kServiceName));
+            android::String16(KelvoService::kServiceName));
     }
 
     std::shared_ptr<PlatformState> mState = std::make_shared<PlatformState>();
@@ -100,5 +100,5 @@ protected:
 #define SKIP_UNLESS_ROOT() \
     if (getuid() != 0) GTEST_SKIP() << "needs root to call as another uid"
 
-} // namespace test
-} // namespace kelvo
+}  // namespace test
+}  // namespace kelvo

@@ -48,11 +48,13 @@ TEST_F(KelvoServiceTest, OnlyTheSystemUidIsServedAndDumpNeedsThePermission) {
         bool granted;
         bool allowed;
     };
-    for (const Case& c : {Case{1001, false, false}, Case{1001, true, true}, Case{2000, false, true}}) {
+    for (const Case& c :
+         {Case{1001, false, false}, Case{1001, true, true}, Case{2000, false, true}}) {
         mState->grant("android.permission.DUMP", c.uid, c.granted);
         std::string out = asUid(c.uid, [] {
             std::string denial = "Permission Denial: cannot dump KELVO information from pid=" +
-                                 std::to_string(getpid()) + ", uid=" + std::to_string(getuid()) + "\n";
+                                 std::to_string(getpid()) + ", uid=" + std::to_string(getuid()) +
+                                 "\n";
             std::string text = dumpOf(service(), {"--version"});
             return text == denial ? std::string("denied") : text;
         });
@@ -71,23 +73,23 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
     const std::string deep = std::string(5000, '[') + std::string(5000, ']');
     const std::string sample = R"({"transactionid":"t1","fieldid":903,"extra":"2"})";
     const std::vector<Case> cases = {
-            {nullptr, "/data/log/kelvo-collect", 0},
-            {nullptr, "/data/log/a..b", 0},
-            {nullptr, "/sdcard/log", -2},
-            {nullptr, "/data/log/../../etc", -2},
-            {nullptr, "/data/log/a/..", -2},
-            {nullptr, "/tmp/data/log/x", -2},
-            {sample.c_str(), "/data/logx", -2},
-            {sample.c_str(), "/data/log/collect", 0},
-            {R"({"transactionid":7,"fieldid":903})", "/data/log/collect", 0},
-            {R"({"transactionid":"t1","fieldid":904})", "/data/log/collect", -3},
-            {R"({"transactionid":"","fieldid":903})", "/data/log/collect", -3},
-            {R"([{"transactionid":"t1","fieldid":903}])", "/data/log/collect", -3},
-            {R"({"transactionid":"t1","fieldid":1e20})", "/data/log/collect", -3},
-            {R"({"transactionid":"t1","fieldid":903,"extra":{}})", "/data/log/collect", -3},
-            {R"({"transactionid":"t1","fieldid":903} x)", "/data/log/collect", -3},
-            {deep.c_str(), "/data/log/collect", -3},
-            {"", "/data/log/collect", -3},
+        {nullptr, "/data/log/kelvo-collect", 0},
+        {nullptr, "/data/log/a..b", 0},
+        {nullptr, "/sdcard/log", -2},
+        {nullptr, "/data/log/../../etc", -2},
+        {nullptr, "/data/log/a/..", -2},
+        {nullptr, "/tmp/data/log/x", -2},
+        {sample.c_str(), "/data/logx", -2},
+        {sample.c_str(), "/data/log/collect", 0},
+        {R"({"transactionid":7,"fieldid":903})", "/data/log/collect", 0},
+        {R"({"transactionid":"t1","fieldid":904})", "/data/log/collect", -3},
+        {R"({"transactionid":"","fieldid":903})", "/data/log/collect", -3},
+        {R"([{"transactionid":"t1","fieldid":903}])", "/data/log/collect", -3},
+        {R"({"transactionid":"t1","fieldid":1e20})", "/data/log/collect", -3},
+        {R"({"transactionid":"t1","fieldid":903,"extra":{}})", "/data/log/collect", -3},
+        {R"({"transactionid":"t1","fieldid":903} x)", "/data/log/collect", -3},
+        {deep.c_str(), "/data/log/collect", -3},
+        {"", "/data/log/collect", -3},
     };
     LogCapture log;
     uint64_t refused = HealthCounters::get(Health::ServiceRequestsRefused);
@@ -96,8 +98,8 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
         std::string out;
         for (const Case& c : cases) {
             int32_t r = c.message == nullptr
-                                ? service->remoteDebugCapture(String16(c.path))
-                                : service->noteSamplingMessage(String16(c.message), String16(c.path));
+                            ? service->remoteDebugCapture(String16(c.path))
+                            : service->noteSamplingMessage(String16(c.message), String16(c.path));
             out += std::to_string(r) + " ";
         }
         // Still serving after all that.
@@ -120,55 +122,57 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
 
 TEST_F(KelvoServiceTest, DumpsysOptionsPrintTheirExactTexts) {
     const std::string help =
-            "Kelvo daemon dumpsys help information\ncommand: dumpsys KelvoService [options]\n"
-            "options:\n  --version    -v : show kelvod version\n"
-            "  --help       -h : show this help information\n"
-            "  --dump       -d : dump message for handlers and routines\n"
-            "  --log        -l : log print control\n  --flush      -f : force flush database\n"
-            "  --balance    -b : force balance\n  --discharge     : change charging status on/off\n";
+        "Kelvo daemon dumpsys help information\ncommand: dumpsys KelvoService [options]\n"
+        "options:\n  --version    -v : show kelvod version\n"
+        "  --help       -h : show this help information\n"
+        "  --dump       -d : dump message for handlers and routines\n"
+        "  --log        -l : log print control\n  --flush      -f : force flush database\n"
+        "  --balance    -b : force balance\n  --discharge     : change charging status on/off\n";
     const std::string logUsage = "Usage: dumpsys KelvoService --log [module] [enable]\n";
     const std::string enableError = "Error: [enable] = {0, 1}\n";
     const std::string chargeUsage =
-            "Usage: dumpsys KelvoService --discharge [1/0]  1:discharge 0:charge\n";
+        "Usage: dumpsys KelvoService --discharge [1/0]  1:discharge 0:charge\n";
     const std::string mismatch = "Error: wrong parameter or inconsistent with file\n";
     const char* kSwitch = KelvoService::kChargeSwitchPath;
     struct Case {
         std::vector<std::string> args;
         const char* switchFile;  // null: absent
         std::string output;
-        uint32_t mask;           // module mask afterwards
-        int32_t online;          // charger notification sent: 1 / 0, -1 none
+        uint32_t mask;   // module mask afterwards
+        int32_t online;  // charger notification sent: 1 / 0, -1 none
     };
     const std::vector<Case> cases = {
-            {{}, nullptr, "", 0, -1},
-            {{"--version"}, nullptr, kVersionLine, 0, -1},
-            {{"-v"}, nullptr, kVersionLine, 0, -1},
-            {{"--help"}, nullptr, help, 0, -1},
-            {{"-h"}, nullptr, help, 0, -1},
-            {{"--bogus"}, nullptr, "Unknown argument: --bogus\n", 0, -1},
-            {{"--log"}, nullptr, logUsage, 0, -1},
-            {{"-l", "cpu"}, nullptr, logUsage, 0, -1},
-            {{"--log", "cpu", "2"}, nullptr, enableError, 0, -1},
-            {{"--log", "cpu", ""}, nullptr, enableError, 0, -1},
-            {{"--log", "cpu", "1"}, nullptr, "", LOG_MODULE_CPU, -1},
-            {{"--log", "gpu", "1"}, nullptr, "", LOG_MODULE_CPU | LOG_MODULE_GPU, -1},
-            {{"--log", "foo", "1"}, nullptr,
-             "Error: [module] = {module, debug, info, audio, bluetooth, camera, cpu, display, "
-             "flashlight, gnss, modem, sensor, wifi, dpm, system, thermal, storage, dispatcher, "
-             "bufferedlog}\n",
-             LOG_MODULE_CPU | LOG_MODULE_GPU, -1},
-            {{"--log", "module", "1"}, nullptr, "", LOG_MODULE_ALL, -1},
-            {{"--log", "module", "0"}, nullptr, "", 0, -1},
-            {{"--flush"}, nullptr, "", 0, -1},
-            {{"-b"}, nullptr, "", 0, -1},
-            {{"--discharge"}, nullptr, chargeUsage, 0, -1},
-            {{"--discharge", "1"}, nullptr, std::string("Error: Failed to open ") + kSwitch + "\n", 0, -1},
-            {{"--discharge", "1"}, "1\n", "", 0, 0},
-            {{"--discharge", "0"}, "0", "", 0, 1},
-            {{"--discharge", "1"}, "0\n", mismatch, 0, -1},
-            {{"--discharge", "0"}, "", mismatch, 0, -1},
-            {{"--discharge", "11"}, "1\n", mismatch, 0, -1},
-            {{"--discharge", ""}, "1\n", mismatch, 0, -1},
+        {{}, nullptr, "", 0, -1},
+        {{"--version"}, nullptr, kVersionLine, 0, -1},
+        {{"-v"}, nullptr, kVersionLine, 0, -1},
+        {{"--help"}, nullptr, help, 0, -1},
+        {{"-h"}, nullptr, help, 0, -1},
+        {{"--bogus"}, nullptr, "Unknown argument: --bogus\n", 0, -1},
+        {{"--log"}, nullptr, logUsage, 0, -1},
+        {{"-l", "cpu"}, nullptr, logUsage, 0, -1},
+        {{"--log", "cpu", "2"}, nullptr, enableError, 0, -1},
+        {{"--log", "cpu", ""}, nullptr, enableError, 0, -1},
+        {{"--log", "cpu", "1"}, nullptr, "", LOG_MODULE_CPU, -1},
+        {{"--log", "gpu", "1"}, nullptr, "", LOG_MODULE_CPU | LOG_MODULE_GPU, -1},
+        {{"--log", "foo", "1"},
+         nullptr,
+         "Error: [module] = {module, debug, info, audio, bluetooth, camera, cpu, display, "
+         "flashlight, gnss, modem, sensor, wifi, dpm, system, thermal, storage, dispatcher, "
+         "bufferedlog}\n",
+         LOG_MODULE_CPU | LOG_MODULE_GPU,
+         -1},
+        {{"--log", "module", "1"}, nullptr, "", LOG_MODULE_ALL, -1},
+        {{"--log", "module", "0"}, nullptr, "", 0, -1},
+        {{"--flush"}, nullptr, "", 0, -1},
+        {{"-b"}, nullptr, "", 0, -1},
+        {{"--discharge"}, nullptr, chargeUsage, 0, -1},
+        {{"--discharge", "1"}, nullptr, std::string("Error: Failed to open ") + kSwitch + "\n", 0, -1},
+        {{"--discharge", "1"}, "1\n", "", 0, 0},
+        {{"--discharge", "0"}, "0", "", 0, 1},
+        {{"--discharge", "1"}, "0\n", mismatch, 0, -1},
+        {{"--discharge", "0"}, "", mismatch, 0, -1},
+        {{"--discharge", "11"}, "1\n", mismatch, 0, -1},
+        {{"--discharge", ""}, "1\n", mismatch, 0, -1},
     };
     sp<kelvo::test::RecordingHandler> charger = new kelvo::test::RecordingHandler("ChargerWatch");
     NotifierListener listener(charger.get());
@@ -176,7 +180,9 @@ TEST_F(KelvoServiceTest, DumpsysOptionsPrintTheirExactTexts) {
     Notifier::getInstance()->registerListener(NOTIFICATION_FORCE_BALANCE, &listener);
     gLogModuleMask = 0;
     for (const Case& c : cases) {
-        std::string where = c.args.empty() ? "(none)" : c.args[0] + " " + std::string(c.switchFile ? c.switchFile : "-");
+        std::string where = c.args.empty()
+                                ? "(none)"
+                                : c.args[0] + " " + std::string(c.switchFile ? c.switchFile : "-");
         unlink((mRoot->path() + kSwitch).c_str());
         if (c.switchFile != nullptr) mRoot->writeFile(kSwitch, c.switchFile);
         charger->clear();
@@ -184,15 +190,19 @@ TEST_F(KelvoServiceTest, DumpsysOptionsPrintTheirExactTexts) {
         EXPECT_EQ(c.mask, gLogModuleMask.load()) << where;
         // One marker round trip through the notifier thread, then the count.
         Notifier::getInstance()->sendNotification(NOTIFICATION_FORCE_BALANCE, android::Parcel());
-        ASSERT_TRUE(kelvo::test::waitFor([&] { return charger->count(MESSAGE_NOTIFICATION, NOTIFICATION_FORCE_BALANCE) >= (c.args.size() == 1 && c.args[0] == "-b" ? 2u : 1u); }));
+        ASSERT_TRUE(kelvo::test::waitFor([&] {
+            return charger->count(MESSAGE_NOTIFICATION, NOTIFICATION_FORCE_BALANCE) >=
+                   (c.args.size() == 1 && c.args[0] == "-b" ? 2u : 1u);
+        }));
         std::vector<int32_t> online;
         for (const auto& g : charger->got()) {
             if (g.what == NOTIFICATION_CHARGER_ONLINE_CHANGED) online.push_back(g.value);
         }
-        EXPECT_EQ(c.online < 0 ? std::vector<int32_t>{} : std::vector<int32_t>{c.online}, online) << where;
+        EXPECT_EQ(c.online < 0 ? std::vector<int32_t>{} : std::vector<int32_t>{c.online}, online)
+            << where;
     }
     Notifier::getInstance()->unregisterAll(&listener);
     charger->requestThreadExit();
 }
 
-} // namespace
+}  // namespace

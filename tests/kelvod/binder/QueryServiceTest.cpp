@@ -31,38 +31,40 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
     SKIP_UNLESS_ROOT();
     kelvo::test::DirectDb db(dbPath());
     std::string sql =
-            "CREATE TABLE hourly_component_cpu (timestamp INTEGER, foreground_energy INTEGER, "
-            "background_energy INTEGER);"
-            "INSERT INTO hourly_component_cpu VALUES (3600000, 10, 5), (3600000, 1, 1), "
-            "(7200000, 20, 0);"
-            "CREATE TABLE raw_applications_backlight (start_time INTEGER, end_time INTEGER, "
-            "energy INTEGER);"
-            "INSERT INTO raw_applications_backlight VALUES (0, 1000, 7), (1000, 2000, 8);"
-            "CREATE TABLE hourly_applications_accounting (timestamp INTEGER, name TEXT, "
-            "foreground_energy INTEGER, background_energy INTEGER);"
-            "INSERT INTO hourly_applications_accounting VALUES (3600000, 'a', 5, 0), "
-            "(3600000, 'b', 9, 1), (3600000, 'c', 1, 0);";
+        "CREATE TABLE hourly_component_cpu (timestamp INTEGER, foreground_energy INTEGER, "
+        "background_energy INTEGER);"
+        "INSERT INTO hourly_component_cpu VALUES (3600000, 10, 5), (3600000, 1, 1), "
+        "(7200000, 20, 0);"
+        "CREATE TABLE raw_applications_backlight (start_time INTEGER, end_time INTEGER, "
+        "energy INTEGER);"
+        "INSERT INTO raw_applications_backlight VALUES (0, 1000, 7), (1000, 2000, 8);"
+        "CREATE TABLE hourly_applications_accounting (timestamp INTEGER, name TEXT, "
+        "foreground_energy INTEGER, background_energy INTEGER);"
+        "INSERT INTO hourly_applications_accounting VALUES (3600000, 'a', 5, 0), "
+        "(3600000, 'b', 9, 1), (3600000, 'c', 1, 0);";
     std::string top100 = "hour 1:\n";
     for (int i = 0; i < 120; ++i) {
         sql += "INSERT INTO hourly_applications_accounting VALUES (7200000, 'app" +
                std::to_string(i + 100) + "', " + std::to_string(i) + ", 0);";
-        if (i >= 20) top100 = top100 + "  7200000 app" + std::to_string(239 - i) + " " + std::to_string(139 - i) + "\n";
+        if (i >= 20)
+            top100 = top100 + "  7200000 app" + std::to_string(239 - i) + " " +
+                     std::to_string(139 - i) + "\n";
     }
     ASSERT_EQ(0, db.exec(sql));
     // Modules whose tables are missing, and the absent DPM handler, give -1
     // blocks; totals over no rows too; top is capped, and below 1 is empty.
     const std::vector<Query> queries = {
-            {false, 0, 7200000, 0, 0, ""},
-            {false, 0, 7200000, 1 << 14, 0, ""},
-            {false, 0, 7200000, (1 << 1) | (1 << 5) | (1 << 6), 0,
-             "audio: no data\ncpu:\n  3600000 17\n  7200000 20\ndisplay: no data\n"},
-            {false, 0, 5000, (1 << 0) | (1 << 6), 1, "battery: no data\ndisplay:\n  15\n"},
-            {false, 10000, 20000, 1 << 6, 1, "display: no data\n"},
-            {false, 0, 7200000, 1 << 7, 0, "dpm: no data\n"},
-            {true, 0, 3600000, 2, 0, "hour 1:\n  3600000 b 10\n  3600000 a 5\n"},
-            {true, 0, 7200000, -1, 0, "hour 1: no data\nhour 2: no data\n"},
-            {true, 3600000, 7200000, 1000000, 0, top100},
-            {true, 1000000000, 2000000000, 3, 0, "no data\n"},
+        {false, 0, 7200000, 0, 0, ""},
+        {false, 0, 7200000, 1 << 14, 0, ""},
+        {false, 0, 7200000, (1 << 1) | (1 << 5) | (1 << 6), 0,
+         "audio: no data\ncpu:\n  3600000 17\n  7200000 20\ndisplay: no data\n"},
+        {false, 0, 5000, (1 << 0) | (1 << 6), 1, "battery: no data\ndisplay:\n  15\n"},
+        {false, 10000, 20000, 1 << 6, 1, "display: no data\n"},
+        {false, 0, 7200000, 1 << 7, 0, "dpm: no data\n"},
+        {true, 0, 3600000, 2, 0, "hour 1:\n  3600000 b 10\n  3600000 a 5\n"},
+        {true, 0, 7200000, -1, 0, "hour 1: no data\nhour 2: no data\n"},
+        {true, 3600000, 7200000, 1000000, 0, top100},
+        {true, 1000000000, 2000000000, 3, 0, "no data\n"},
     };
     std::string got = asUid(1000, [&queries] {
         KelvoQueryClient client(KelvoQueryClient::connect());
@@ -114,7 +116,8 @@ TEST_F(QueryServiceTest, DumpIsMadeOnEachOperatorsThreadAndSkipsABusyOne) {
     busy->sendCustomizedMessage(1, android::Parcel(), nullptr, false);
     std::atomic<bool> stop{false};
     std::thread flood([&] {
-        for (int i = 0; i < 2000 && !stop; ++i) flooded->sendCustomizedMessage(2, android::Parcel(), nullptr, false);
+        for (int i = 0; i < 2000 && !stop; ++i)
+            flooded->sendCustomizedMessage(2, android::Parcel(), nullptr, false);
     });
     auto start = std::chrono::steady_clock::now();
     std::string out = dumpOf(mService, {"--dump"});
@@ -129,4 +132,4 @@ TEST_F(QueryServiceTest, DumpIsMadeOnEachOperatorsThreadAndSkipsABusyOne) {
     flooded->requestThreadExit();
 }
 
-} // namespace
+}  // namespace
