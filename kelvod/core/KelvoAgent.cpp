@@ -117,6 +117,12 @@ void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>&
     }
 }
 
+void KelvoAgent::setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < HANDLER_COUNT) {
+        setHandler(id, op);
+    }
+}
+
 void KelvoAgent::setExitHook(ExitHook hook) {
     gExitHook = hook != nullptr ? hook : &_exit;
 }

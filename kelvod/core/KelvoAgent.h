@@ -93,6 +93,7 @@ public:
     // Puts an operator into a routine slot without start-up, so requests to
     // the routine reach it (tests); a null operator empties the slot.
     void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
+    void setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();
 
