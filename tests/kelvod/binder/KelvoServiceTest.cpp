@@ -91,6 +91,9 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
         {deep.c_str(), "/data/log/collect", -3},
         {"", "/data/log/collect", -3},
     };
+    const std::string collect = mRoot->path() + "/data/log/collect";
+    kelvo::test::makeHostDirs(collect);
+    chmod(collect.c_str(), 0777);
     LogCapture log;
     uint64_t refused = HealthCounters::get(Health::ServiceRequestsRefused);
     std::string got = asUid(1000, [&cases] {
@@ -116,7 +119,8 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
     EXPECT_TRUE(log.contains("Invalid field id: 904", ANDROID_LOG_ERROR));
     EXPECT_TRUE(log.contains("Failed to parse transaction id", ANDROID_LOG_ERROR));
     EXPECT_EQ(8u, log.count("Invalid push message", ANDROID_LOG_ERROR));
-    // Refused paths never reached the storage.
+    // Accepted messages reached the storage, refused paths never did.
+    EXPECT_FALSE(kelvo::test::listDir(collect).empty());
     EXPECT_FALSE(log.contains("Refuse upload path: /data/log/../../etc"));
 }
 
