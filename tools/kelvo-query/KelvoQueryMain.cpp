@@ -11,6 +11,7 @@
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
+#include <unistd.h>
 
 #include <string>
 
@@ -78,7 +79,8 @@ int main(int argc, char** argv) {
         text = answered ? kelvo::KelvoQueryClient::formatApplications(response) : "";
     }
     if (!answered) {
-        fprintf(stderr, "kelvo-query: no answer\n");
+        fprintf(stderr, "kelvo-query: no answer (only uid 1000 is answered; this is uid %d)\n",
+                static_cast<int>(getuid()));
         return 1;
     }
     fputs(text.c_str(), stdout);
