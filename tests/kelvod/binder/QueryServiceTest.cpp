@@ -7,6 +7,7 @@
 #include <chrono>
 #include <thread>
 
+#include "HealthCounters.h"
 #include "KelvoQueryClient.h"
 #include "core/KelvoOperator.h"
 #include "kelvod/binder/KelvoServiceFixture.h"
@@ -41,7 +42,11 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
         "CREATE TABLE hourly_applications_accounting (timestamp INTEGER, name TEXT, "
         "foreground_energy INTEGER, background_energy INTEGER);"
         "INSERT INTO hourly_applications_accounting VALUES (3600000, 'a', 5, 0), "
-        "(3600000, 'b', 9, 1), (3600000, 'c', 1, 0);";
+        "(3600000, 'b', 9, 1), (3600000, 'c', 1, 0);"
+        // 70000 rows of 16 bytes: past the reply's size budget.
+        "CREATE TABLE hourly_component_gpu (timestamp INTEGER, energy INTEGER);"
+        "WITH RECURSIVE n(x) AS (SELECT 1 UNION ALL SELECT x + 1 FROM n WHERE x < 70000) "
+        "INSERT INTO hourly_component_gpu SELECT x, 1 FROM n;";
     std::string top100 = "hour 1:\n";
     for (int i = 0; i < 120; ++i) {
         sql += "INSERT INTO hourly_applications_accounting VALUES (7200000, 'app" +
@@ -61,11 +66,13 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
         {false, 0, 5000, (1 << 0) | (1 << 6), 1, "battery: no data\ndisplay:\n  15\n"},
         {false, 10000, 20000, 1 << 6, 1, "display: no data\n"},
         {false, 0, 7200000, 1 << 7, 0, "dpm: no data\n"},
+        {false, 0, 7200000, (1 << 10) | (1 << 13), 0, "gpu: no data\nwifi: no data\n"},
         {true, 0, 3600000, 2, 0, "hour 1:\n  3600000 b 10\n  3600000 a 5\n"},
         {true, 0, 7200000, -1, 0, "hour 1: no data\nhour 2: no data\n"},
         {true, 3600000, 7200000, 1000000, 0, top100},
         {true, 1000000000, 2000000000, 3, 0, "no data\n"},
     };
+    uint64_t refused = HealthCounters::get(Health::ServiceRequestsRefused);
     std::string got = asUid(1000, [&queries] {
         KelvoQueryClient client(KelvoQueryClient::connect());
         std::string out;
@@ -83,6 +90,8 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
     std::string expected;
     for (const Query& q : queries) expected += q.expected + "--\n";
     EXPECT_EQ(expected, got);
+    // The oversized block and the capped top.
+    EXPECT_EQ(refused + 2, HealthCounters::get(Health::ServiceRequestsRefused));
 }
 
 // Says whether it dumps on its own thread (noted by any request); code 1
