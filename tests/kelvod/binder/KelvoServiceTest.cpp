@@ -120,7 +120,7 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
     EXPECT_TRUE(log.contains("Failed to parse transaction id", ANDROID_LOG_ERROR));
     EXPECT_EQ(8u, log.count("Invalid push message", ANDROID_LOG_ERROR));
     // Accepted messages reached the storage, refused paths never did.
-    EXPECT_FALSE(kelvo::test::listDir(collect).empty());
+    EXPECT_TRUE(kelvo::test::waitFor([&] { return !kelvo::test::listDir(collect).empty(); }));
     EXPECT_FALSE(log.contains("Refuse upload path: /data/log/../../etc"));
 }
 

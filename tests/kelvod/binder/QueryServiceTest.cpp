@@ -100,7 +100,8 @@ class DumpingOperator : public KelvoOperator {
 public:
     explicit DumpingOperator(const char* name) : KelvoOperator(name, -1, 0) {}
     void dump(android::String8& out) override {
-        out.appendFormat("%s on its thread: %d\n", getName(), std::this_thread::get_id() == mThread);
+        bool own = std::this_thread::get_id() == mThread;
+        out.appendFormat("%s on its thread: %d\n", getName(), own);
     }
     int32_t handleCustomized(int32_t code, const android::Parcel&, android::Parcel*) override {
         mThread = std::this_thread::get_id();
