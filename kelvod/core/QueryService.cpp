@@ -96,6 +96,7 @@ void QueryService::answer(const android::Parcel& request, const android::Parcel&
         return;
     }
     listener->onQueryResponse(reply);
+    mLastListener = binder;
 }
 
 int32_t QueryService::handleQueryComponent(const android::Parcel& request, android::Parcel* reply) {

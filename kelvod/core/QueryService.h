@@ -1,5 +1,6 @@
 #pragma once
 
+#include <binder/IBinder.h>
 #include <binder/Parcel.h>
 #include <stddef.h>
 #include <stdint.h>
@@ -76,6 +77,11 @@ private:
     // Appends a block unless it would take the reply past kMaxReplyBytes.
     static void appendBlock(const android::Parcel& block, android::Parcel* reply);
     void answer(const android::Parcel& request, const android::Parcel& reply);
+
+    // The listener answered last, kept until the next answer: its proxy is
+    // then let go on this thread, well after the binder thread that carried
+    // the request dropped its own reference.
+    android::sp<android::IBinder> mLastListener;
 };
 
 }  // namespace kelvo
