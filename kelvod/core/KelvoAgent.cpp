@@ -2,12 +2,15 @@
 
 #include <unistd.h>
 
+#include <algorithm>
 #include <atomic>
+#include <vector>
 #include <cstdlib>
 
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
 #include "KelvoLog.h"
+#include "binder/KelvoService.h"
 #include "binder/managers/BatteryManager.h"
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
@@ -132,12 +135,19 @@ void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>&
     }
 }
 
+void KelvoAgent::setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < HANDLER_COUNT) {
+        setHandler(id, op);
+    }
+}
+
 void KelvoAgent::setExitHook(ExitHook hook) {
     gExitHook = hook != nullptr ? hook : &_exit;
 }
 
 KelvoAgent::KelvoAgent() : mStartTime(TimeProvider::getCurrentTime(TIME_TYPE_WALL)) {
     mStorage = new KelvoStorage(this);
+    mQueryService = new QueryService();
 }
 
 android::sp<KelvoOperator> KelvoAgent::getHandler(int32_t id) {
@@ -255,7 +265,12 @@ void KelvoAgent::startLibrary() {
     kelvo::startLibrary(mStartTime);
 }
 
-void KelvoAgent::publishService() {}
+void KelvoAgent::publishService() {
+    android::status_t err = KelvoService::publish(this);
+    if (err != android::NO_ERROR) {
+        KLOGE("Failed to publish %s: %d", KelvoService::kServiceName, err);
+    }
+}
 
 void KelvoAgent::startBatteryListener() {
     // The registrar may come up after the daemon: registration goes on in
@@ -312,7 +327,11 @@ int32_t KelvoAgent::sendToRoutine(int32_t id, int32_t code, const android::Parce
     return routine->sendCustomizedMessage(code, data, reply, sync);
 }
 
-void KelvoAgent::requestQuery(int32_t code, const android::Parcel& data) {}
+void KelvoAgent::requestQuery(int32_t code, const android::Parcel& data) {
+    if (mQueryService->sendMessage(ParcelMessage(MESSAGE_CUSTOMIZED, code, data)) < 0) {
+        KLOGE("Failed to post query: %d", code);
+    }
+}
 
 int32_t KelvoAgent::noteSamplingUpload(const android::String8& a, const android::String8& b) {
     return mStorage == nullptr ? -1 : mStorage->samplingUpload(a, b);
@@ -336,17 +355,22 @@ void KelvoAgent::logError(const android::Parcel& data) {
 }
 
 void KelvoAgent::handleDump(android::String8& out) {
+    std::vector<android::sp<KelvoOperator>> operators;
     for (int32_t id = 0; id < HANDLER_COUNT; ++id) {
-        android::sp<KelvoOperator> handler = getHandler(id);
-        if (handler != nullptr) {
-            handler->dump(out);
-        }
+        operators.push_back(getHandler(id));
     }
     for (int32_t id = 0; id < ROUTINE_COUNT; ++id) {
-        android::sp<KelvoOperator> routine = getRoutine(id);
-        if (routine != nullptr) {
-            routine->dump(out);
+        operators.push_back(getRoutine(id));
+    }
+    // A busy or stuck operator costs its own wait once, never the whole
+    // dump: the waits share one budget.
+    int64_t start = TimeProvider::getCurrentTime(TIME_TYPE_MONOTONIC);
+    for (const android::sp<KelvoOperator>& op : operators) {
+        if (op == nullptr) {
+            continue;
         }
+        int64_t left = kDumpBudgetMs - (TimeProvider::getCurrentTime(TIME_TYPE_MONOTONIC) - start);
+        op->requestDump(out, std::max<int64_t>(std::min(kDumpWaitMs, left), 1));
     }
 }
 

@@ -9,6 +9,7 @@
 #include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
+#include "core/QueryService.h"
 #include "storage/KelvoStorage.h"
 
 namespace kelvo {
@@ -70,7 +71,12 @@ public:
     void forceFlushDatabase();
     // Hands one error row (int64 time, String8 text) to the system handler.
     void logError(const android::Parcel& data);
+    // Each present handler, then each routine, appends its text, made on its
+    // own thread; one that does not answer within kDumpWaitMs (or what is
+    // left of kDumpBudgetMs) is skipped.
     void handleDump(android::String8& out);
+    static constexpr int64_t kDumpWaitMs = 1000;
+    static constexpr int64_t kDumpBudgetMs = 5000;
     void cleanTables(int64_t time);
     int64_t getSystemBootTime() const { return mStartTime; }
 
@@ -87,6 +93,7 @@ public:
     // Puts an operator into a routine slot without start-up, so requests to
     // the routine reach it (tests); a null operator empties the slot.
     void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
+    void setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();
 
@@ -107,6 +114,7 @@ private:
 
     int64_t mStartTime;
     android::sp<KelvoStorage> mStorage;
+    android::sp<QueryService> mQueryService;
     // Written only during start-up, but read by any thread that logs an
     // error meanwhile: every access goes through the slot lock.
     std::mutex mSlotLock;

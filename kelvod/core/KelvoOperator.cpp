@@ -20,6 +20,8 @@ namespace {
 constexpr int32_t kLateInitializeMessage = 100;
 // what: timer id; sent to itself when a timer could not be re-armed.
 constexpr int32_t kTimerRearmMessage = 101;
+// Reply: String8 the operator's dump text, made on its own thread.
+constexpr int32_t kDumpMessage = 102;
 
 // Request codes of the hourly routine.
 constexpr int32_t kHourlyVote = 0;
@@ -201,6 +203,28 @@ int32_t KelvoOperator::sendCustomizedMessage(int32_t code, const android::Parcel
     return sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, code, data, reply));
 }
 
+int32_t KelvoOperator::sendCustomizedMessageDelayed(int32_t code, const android::Parcel& data,
+                                                    int64_t delayMs) {
+    if (delayMs < 0 || delayMs > INT64_MAX / 1000000) {
+        KLOGE("Invalid parameter");
+        return -5;
+    }
+    return sendMessageDelayed(delayMs * 1000000LL, ParcelMessage(MESSAGE_CUSTOMIZED, code, data));
+}
+
+int32_t KelvoOperator::requestDump(android::String8& out, int64_t timeoutMs) {
+    android::Parcel reply;
+    int32_t ret = sendMessageSync(ParcelMessage(kDumpMessage, 0, android::Parcel(), &reply),
+                                  timeoutMs);
+    if (ret < 0) {
+        KLOGE("No dump from %s: %d", getName(), ret);
+        return ret;
+    }
+    reply.setDataPosition(0);
+    out.append(reply.readString8());
+    return ret;
+}
+
 int32_t KelvoOperator::voteCandidate(int64_t time, int32_t kind, uint32_t elector) {
     android::Parcel vote;
     vote.writeInt64(time);
@@ -309,6 +333,14 @@ int32_t KelvoOperator::handleParcelMessage(const ParcelMessage& msg) {
             return handleCustomized(msg.what, body, msg.getReply());
         case kTimerRearmMessage:
             return handleTimerRearm(msg.what);
+        case kDumpMessage: {
+            android::String8 text;
+            dump(text);
+            if (msg.getReply() != nullptr) {
+                msg.getReply()->writeString8(text);
+            }
+            return 0;
+        }
         case kLateInitializeMessage:
             if (mLateInitialized) {
                 KLOGE("Late initialization already done: %s", getName());

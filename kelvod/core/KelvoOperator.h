@@ -73,6 +73,13 @@ public:
     int32_t sendNotification(int32_t type, const android::Parcel& data);
     int32_t sendCustomizedMessage(int32_t code, const android::Parcel& data,
                                   android::Parcel* reply, bool sync);
+    // Posts (code, data) to be handled delayMs from now; returns the message
+    // id (for removeMessage) or a negative code.
+    int32_t sendCustomizedMessageDelayed(int32_t code, const android::Parcel& data,
+                                         int64_t delayMs);
+    // Collects dump() on the operator's own thread, waiting at most
+    // timeoutMs; the result of the wait (negative: nothing appended).
+    int32_t requestDump(android::String8& out, int64_t timeoutMs);
     int32_t voteCandidate(int64_t time, int32_t kind, uint32_t elector);
     int32_t setElector(uint32_t elector, const android::Parcel& candidates);
     int32_t updateCompensation(int64_t time, uint32_t kind, int64_t value);

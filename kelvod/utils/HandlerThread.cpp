@@ -122,6 +122,10 @@ int32_t HandlerThread::sendMessageAtTime(nsecs_t when, const ParcelMessage& msg)
 }
 
 int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
+    return sendMessageSync(msg, 0);
+}
+
+int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg, int64_t waitMs) {
     if (!isAccepting()) {
         HealthCounters::add(Health::MessagesRefused);
         KLOGE("%s is not running or is pending to exit", mName.string());
@@ -150,7 +154,7 @@ int32_t HandlerThread::sendMessageSync(const ParcelMessage& msg) {
     postMessage(id, systemTime(SYSTEM_TIME_MONOTONIC));
 
     using Clock = std::chrono::steady_clock;
-    int64_t timeoutMs = sSyncTimeoutMs.load();
+    int64_t timeoutMs = waitMs > 0 ? waitMs : sSyncTimeoutMs.load();
     Clock::time_point now = Clock::now();
     Clock::time_point deadline = Clock::time_point::max();
     if (std::chrono::duration_cast<std::chrono::milliseconds>(Clock::time_point::max() - now)

@@ -42,6 +42,9 @@ public:
     // Waits for the handler. Returns its status, -1 on time-out, -13 when the
     // id is already waited for, -2 when the thread is not running.
     int32_t sendMessageSync(const ParcelMessage& msg);
+    // The same with a wait of its own (at most timeoutMs; the default when
+    // 0 or less). A message the caller gave up on is still handled.
+    int32_t sendMessageSync(const ParcelMessage& msg, int64_t timeoutMs);
 
     int32_t removeMessage(int32_t id);
     void removeAllMessages();

@@ -132,6 +132,10 @@ public:
         note("component:" + std::to_string(d.readInt32()));
         return 0;
     }
+    int32_t handleCustomized(int32_t code, const Parcel&, Parcel*) override {
+        if (code != 99) note("customized:" + std::to_string(code));
+        return 0;
+    }
     void release() { readyToDestroy(); }
 
     pid_t mLateTid = 0;
@@ -318,4 +322,19 @@ TEST_F(KelvoOperatorTest, RegistrationsDoNotKeepAnOperatorAlive) {
     kelvo::Notifier::getInstance()->sendNotification(kelvo::NOTIFICATION_HOURLY_TICK,
                                                      TimeBody(44));
     EXPECT_TRUE(waitFor([] { return sendBuffered(0, 6, "") == -4; }));
+}
+
+TEST_F(KelvoOperatorTest, DelayedCustomizedMessagesComeLateOrNotAtAllOnceRemoved) {
+    sp<TestOperator> op = make(-1, {});
+    auto start = std::chrono::steady_clock::now();
+    int32_t kept = op->sendCustomizedMessageDelayed(5, Parcel(), 100);
+    int32_t removed = op->sendCustomizedMessageDelayed(6, Parcel(), 50);
+    ASSERT_GE(kept, 0);
+    ASSERT_GE(removed, 0);
+    EXPECT_EQ(0, op->removeMessage(removed));
+    EXPECT_EQ(-5, op->sendCustomizedMessageDelayed(7, Parcel(), -1));
+    ASSERT_TRUE(kelvo::test::waitFor([] { return !calls().empty(); }));
+    EXPECT_GE(std::chrono::steady_clock::now() - start, std::chrono::milliseconds(100));
+    std::this_thread::sleep_for(std::chrono::milliseconds(100));
+    EXPECT_EQ(std::vector<std::string>{"customized:5"}, calls());
 }
