@@ -1,5 +1,6 @@
 #include "handlers/components/DisplayHandler.h"
 
+#include <algorithm>
 #include <chrono>
 #include <limits>
 #include <string>
@@ -360,7 +361,8 @@ void DisplayHandler::reportAdvanced(int64_t time) {
         return;
     }
     if (mAdvancedReportTime < 0) {
-        mAdvancedReportTime = KelvoAgent::getInstance()->getSystemBootTime();
+        // The first span runs from the boot; it cannot start after it ends.
+        mAdvancedReportTime = std::min(KelvoAgent::getInstance()->getSystemBootTime(), time);
     }
     // A failed read keeps the span's start: the next read covers it too.
     uint32_t value = 0;
