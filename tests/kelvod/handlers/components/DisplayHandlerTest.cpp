@@ -211,7 +211,7 @@ TEST_F(DisplayTest, ScreenForegroundAndBacklightThroughTheHour) {
               rows("SELECT duration, energy FROM hourly_component_backlight"));
     EXPECT_EQ((std::vector<std::string>{"com.a|1|6960", "com.tovaro.android.launcher|1|6960"}),
               rows("SELECT name, component, foreground_energy FROM "
-                   "hourly_applications_accounting ORDER BY name"));
+                   "hourly_applications_accounting WHERE component = 1 ORDER BY name"));
     Json::Value p = lastEvent(EVENT_HOURLY_COMPONENTS);
     EXPECT_EQ(120000, p["4"]["params"]["5"].asInt64());
     EXPECT_EQ(13920, p["4"]["params"]["0"].asInt64());
