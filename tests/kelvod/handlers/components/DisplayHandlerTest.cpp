@@ -47,10 +47,9 @@ public:
     Heard() : HandlerThread("Heard", 11) {}
     int32_t handleParcelMessage(const ParcelMessage& m) override {
         const Parcel& p = m.getParcel();
-        std::string line = (m.what == NOTIFICATION_FOREGROUND_CHANGED ? "f " : "s ") +
-                           std::to_string(p.readInt64()) + " ";
-        line += m.what == NOTIFICATION_FOREGROUND_CHANGED ? p.readString8().string()
-                                                          : std::to_string(p.readBool());
+        bool f = m.what == NOTIFICATION_FOREGROUND_CHANGED;
+        std::string line = (f ? "f " : "s ") + std::to_string(p.readInt64()) + " ";
+        line += f ? p.readString8().string() : std::to_string(p.readBool());
         std::lock_guard<std::mutex> guard(mLock);
         mLines.push_back(line);
         return 0;
@@ -59,8 +58,6 @@ public:
         std::lock_guard<std::mutex> guard(mLock);
         return mLines;
     }
-
-private:
     std::mutex mLock;
     std::vector<std::string> mLines;
 };
@@ -131,19 +128,13 @@ protected:
     void log(const char* tag, const std::string& text, int64_t time) {
         ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, tag, text.c_str(), time));
     }
-    // A notification handled to its end: its time, and a second int64.
-    void notify(int32_t type, int64_t time, int64_t second = -1) {
+    // A notification handled to its end: its time, then an int64 or a flag.
+    void notify(int32_t type, int64_t time, int64_t second = -1, int flag = -1) {
         Parcel p;
         p.writeInt64(time);
         if (second >= 0) p.writeInt64(second);
+        if (flag >= 0) p.writeBool(flag == 1);
         mDisplay->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, p));
-    }
-    void charger(int64_t time, bool online) {
-        Parcel p;
-        p.writeInt64(time);
-        p.writeBool(online);
-        mDisplay->sendMessageSync(
-            ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_CHARGER_ONLINE_CHANGED, p));
     }
     // Waits for the rows the records written so far end with: the display
     // takes them in order.
@@ -161,9 +152,7 @@ protected:
     Json::Value lastEvent(uint32_t id) {
         DataUploader::getInstance()->uploadEvent();
         Json::Value found;
-        for (const Json::Value& e : events()) {
-            if (e["event"].asUInt() == id) found = e["params"];
-        }
+        for (const Json::Value& e : events()) found = e["event"].asUInt() == id ? e["params"] : found;
         return found;
     }
 
@@ -189,8 +178,8 @@ TEST_F(DisplayTest, ScreenForegroundAndBacklightThroughTheHour) {
     log("KELVO_TAG_FOREGROUND_CHANGED", "name=com.a", kT + 90000);  // no change
     log("KELVO_TAG_BRIGHTNESS", "brightness=0", kT + 120000);
     waitRows("SELECT id FROM raw_screen_state", 2);
-    const std::string t = std::to_string(kT), a = std::to_string(kT + 60000),
-                      off = std::to_string(kT + 120000);
+    const std::string t = std::to_string(kT), a = std::to_string(kT + 60000);
+    const std::string off = std::to_string(kT + 120000);
     EXPECT_EQ(refused + 3, HealthCounters::get(Health::LoggerMessageRefused));
     ASSERT_TRUE(waitFor([&] { return mHeard->lines().size() >= 5; }));
     EXPECT_EQ((std::vector<std::string>{"f " + t + " com.tovaro.android.launcher", "s " + t + " 1",
@@ -229,21 +218,27 @@ TEST_F(DisplayTest, MidnightStatisticsWithChargerSplitAndClosingSpan) {
     log("KELVO_TAG_AUTO_AMBIENT_LIGHT", "d0=0 d1=5000 d2=0 d3=0 d4=0 d5=0", m - 500000);
     log("KELVO_TAG_FRONT_AMBIENT_LIGHT", "d0=1000 d1=0 d2=0 d3=0 d4=0 d5=0", m - 500000);
     waitRows("SELECT id FROM raw_ambient_light", 2);
-    charger(m - 300000, true);
-    charger(m - 120000, false);
+    notify(NOTIFICATION_CHARGER_ONLINE_CHANGED, m - 300000, -1, 1);
+    notify(NOTIFICATION_CHARGER_ONLINE_CHANGED, m - 120000, -1, 0);
+    // The clock goes back 30 s: the span ends at the old time, the next
+    // starts at the new one; a record from before that start is an empty span.
+    notify(NOTIFICATION_TIME_CHANGED, m - 60000, m - 90000);
+    log("KELVO_TAG_BRIGHTNESS", "brightness=40", m - 100000);
+    waitRows("SELECT id FROM raw_screen_brightness", 5);
     notify(NOTIFICATION_DAILY_TICK, m - kHour, m);
     Parcel upload;
     upload.writeFloat(1.0f);
     upload.writeInt64(m);
     mDisplay->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_DAILY_UPLOADING,
                                             upload));
-    EXPECT_EQ((std::vector<std::string>{"40|300000|0", "40|180000|1", "40|120000|0"}),
+    EXPECT_EQ((std::vector<std::string>{"40|300000|0", "40|180000|1", "40|60000|0", "40|0|0",
+                                        "40|90000|0"}),
               rows("SELECT brightness, duration, charge FROM raw_screen_brightness WHERE "
                    "timestamp > " + std::to_string(m - 400000)));
     Json::Value p = lastEvent(EVENT_DAILY_SYSTEM);
     ASSERT_EQ(1u, p["10"].size());
     EXPECT_EQ(3, p["10"][0]["params"]["0"].asInt64());  // 40 / 16 + 1
-    EXPECT_EQ(420000, p["10"][0]["params"]["1"].asInt64());
+    EXPECT_EQ(450000, p["10"][0]["params"]["1"].asInt64());
     ASSERT_EQ(2u, p["11"].size());
     EXPECT_EQ("1 5000 6 1000", p["11"][0]["params"]["0"].asString() + " " +
                                    p["11"][0]["params"]["1"].asString() + " " +
@@ -252,9 +247,9 @@ TEST_F(DisplayTest, MidnightStatisticsWithChargerSplitAndClosingSpan) {
 }
 
 // Policy 2: the backlight follows the device's value per span, scaled by
-// 10000 (45 per second at 5000); a value above 10000 is ignored, and a
-// charger change first closes the span on the old charge state. A device
-// that refuses the statistics leaves policy 1: levels, scaled by 100.
+// 10000 (45 per second at 5000); a value above 10000 is ignored; a charger
+// or clock change first closes the span. A device that refuses the
+// statistics leaves policy 1: levels, scaled by 100 (116 per second).
 struct PolicyCase {
     const char* name;
     bool enableFails;
@@ -266,7 +261,10 @@ class DisplayPolicyTest : public DisplayTest, public ::testing::WithParamInterfa
 protected:
     int32_t policy() override { return 2; }
     void SetUp() override {
-        mDriver.update([](fake::FakeKernelDriver::State& s) { s.spanBrightness = {0, 10001, 5000}; });
+        mDriver.update([](fake::FakeKernelDriver::State& s) {
+            s.spanBrightness = {0, 10001};
+            s.brightness = 5000;
+        });
         if (GetParam().enableFails) {
             mDriver.failRequest(fake::FakeKernelDriver::Device::Kelvo,
                                 KelvoDevice::kSetBrightnessInfoEnable, EIO);
@@ -279,15 +277,17 @@ TEST_P(DisplayPolicyTest, BacklightFollowsTheEffectivePolicy) {
     log("KELVO_TAG_BRIGHTNESS", "brightness=120", kT);
     waitRows("SELECT id FROM raw_screen_state", 1);
     notify(NOTIFICATION_FORCE_BALANCE, kT + 60000);
-    charger(kT + 120000, true);
-    notify(NOTIFICATION_FORCE_BALANCE, kT + 180000);
+    notify(NOTIFICATION_CHARGER_ONLINE_CHANGED, kT + 120000, -1, 1);
+    // Back 90 s: charged up to the old time, then from the new one.
+    notify(NOTIFICATION_TIME_CHANGED, kT + 150000, kT + 60000);
+    notify(NOTIFICATION_FORCE_BALANCE, kT + 120000);
     EXPECT_EQ(std::vector<std::string>{GetParam().energies},
               rows("SELECT SUM(energy), SUM(charge_energy) FROM raw_applications_backlight"));
 }
 
 INSTANTIATE_TEST_SUITE_P(Policies, DisplayPolicyTest,
-                         ::testing::Values(PolicyCase{"advanced", false, "2700|0"},
-                                           PolicyCase{"enable_fails", true, "13920|6960"}),
+                         ::testing::Values(PolicyCase{"advanced", false, "2700|4050"},
+                                           PolicyCase{"enable_fails", true, "13920|10440"}),
                          [](const ::testing::TestParamInfo<PolicyCase>& i) { return i.param.name; });
 
 }  // namespace
