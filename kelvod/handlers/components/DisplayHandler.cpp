@@ -61,9 +61,8 @@ const column_attribute kAmbientColumns[] = {
     {COLUMN_INT, "duration"},
 };
 const column_attribute kRawApplicationsColumns[] = {
-    {COLUMN_TIME, "start_time"},   {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "name"},         {COLUMN_INT, "duration"},
-    {COLUMN_LONG, "energy"},       {COLUMN_INT, "charge_duration"},
+    {COLUMN_TIME, "start_time"},    {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "duration"},       {COLUMN_LONG, "energy"},   {COLUMN_INT, "charge_duration"},
     {COLUMN_LONG, "charge_energy"},
 };
 const column_attribute kHourlyApplicationsColumns[] = {
@@ -80,8 +79,7 @@ const column_attribute kHourlyComponentColumns[] = {
 
 const table_attribute kForegroundTable = {"1.0", 1, 2, kForegroundColumns, "raw_foreground"};
 const table_attribute kScreenStateTable = {"1.0", 1, 2, kScreenStateColumns, "raw_screen_state"};
-const table_attribute kBrightnessTable = {"1.1", 1, 4, kBrightnessColumns,
-                                          "raw_screen_brightness"};
+const table_attribute kBrightnessTable = {"1.1", 1, 4, kBrightnessColumns, "raw_screen_brightness"};
 const table_attribute kAmbientTable = {"1.0", 1, 4, kAmbientColumns, "raw_ambient_light"};
 const table_attribute kRawApplications = {"1.1", 1, 7, kRawApplicationsColumns,
                                           "raw_applications_backlight"};
@@ -95,8 +93,8 @@ const upload_pair kUploadPairs[] = {{0, 1, 5, 4}, {0, 1, 1, 0}};
 
 component_family makeFamily() {
     component_family f = {
-        "display",           &kRawApplications, nullptr, &kHourlyApplications,
-        &kHourlyComponent,   APPS_DISPLAY,      4,       5,
+        "display",         &kRawApplications, nullptr, &kHourlyApplications,
+        &kHourlyComponent, APPS_DISPLAY,      4,       5,
     };
     f.uploadPairs = kUploadPairs;
     f.uploadPairCount = 2;

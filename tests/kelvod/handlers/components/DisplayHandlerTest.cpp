@@ -1,16 +1,12 @@
-// The display handler end to end: records written to the log device, the
-// accounting library with the sample profile (backlight (800 + 90 x level) /
-// 100 per second), the real hourly routine, rows from the database,
-// foreground and screen notifications as other operators get them, uploads
-// from the events file.
+// The display handler end to end: log-device records and notifications in;
+// the sample profile (backlight (800 + 90 x level) / 100 per second); rows,
+// the foreground and screen notifications others hear, and uploads out.
 
 #include <gtest/gtest.h>
 #include <json/json.h>
 
 #include <memory>
 #include <mutex>
-#include <string>
-#include <vector>
 
 #include "FakeKernelDriver.h"
 #include "HealthCounters.h"
@@ -24,7 +20,6 @@
 #include "kelvo/RootPath.h"
 #include "kelvo/WallClock.h"
 #include "kelvod/storage/StorageTestUtil.h"
-#include "routines/HourlyRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/XmlParser.h"
 #include "utils/devices/KelvoDevice.h"
@@ -67,8 +62,6 @@ protected:
     // The sample configuration with the display's policy.
     virtual int32_t policy() { return 1; }
     void addTables() override {
-        setenv("TZ", "UTC", 1);
-        tzset();
         WallClock::setFixedTimeMs(kT);
         std::string config = kelvo::test::readHostFile(KELVO_SAMPLE_CONFIG);
         size_t at = config.find("<parameter>1</parameter>", config.find("<element id=\"2\">"));
@@ -77,11 +70,8 @@ protected:
         XmlParser::resetInstance();
         KelvoLibAgent::getInstance()->resetAccountersForTest();
         Dispatcher::resetForTest();
-        HourlyRoutine::setVoteTimeoutMs(0);
         DisplayHandler::setForegroundNotificationDelayMs(0);
-        mRoutine = new HourlyRoutine();
         mDisplay = new DisplayHandler();
-        mRoutine->addSchemaTable();
         mDisplay->addSchemaTable();
         AppsAccounting::getInstance()->addSchemaTable();
         DataUploader::getInstance()->addSchemaTable();
@@ -89,9 +79,6 @@ protected:
     void SetUp() override {
         kelvo::test::AgentStorageTest::SetUp();
         ASSERT_TRUE(mDriver.start());
-        mRoutine->earlyInitialize();
-        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
-        mRoutine->initialize();
         ASSERT_EQ(0, mDisplay->earlyInitialize());
         mDisplay->initialize();
         mHeard = new Heard();
@@ -106,15 +93,12 @@ protected:
         mWriter.reset();
         Dispatcher::resetForTest();
         Notifier::getInstance()->unregisterAll(mListener.get());
-        for (const sp<KelvoOperator>& op : {sp<KelvoOperator>(mRoutine.get()),
-                                            sp<KelvoOperator>(mDisplay.get())}) {
-            op->readyToDestroy();
-            op->requestThreadExit();
-            op->join();
+        mDisplay->readyToDestroy();
+        for (const sp<HandlerThread>& t :
+             {sp<HandlerThread>(mDisplay.get()), sp<HandlerThread>(mHeard.get())}) {
+            t->requestThreadExit();
+            t->join();
         }
-        mHeard->requestThreadExit();
-        mHeard->join();
-        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
         AppsAccounting::getInstance()->balanceAccount();
         KelvoLibAgent::getInstance()->resetAccountersForTest();
         DisplayHandler::setForegroundNotificationDelayMs(-1);
@@ -122,42 +106,35 @@ protected:
         WallClock::setFixedTimeMs(-1);
         mDriver.stop();
         kelvo::test::AgentStorageTest::TearDown();
-        unsetenv("TZ");
-        tzset();
     }
     void log(const char* tag, const std::string& text, int64_t time) {
         ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, tag, text.c_str(), time));
     }
-    // A notification handled to its end: its time, then an int64 or a flag.
+    // A notification handled to its end: (an upload's ratio 1), its time,
+    // then an int64 or a flag.
     void notify(int32_t type, int64_t time, int64_t second = -1, int flag = -1) {
         Parcel p;
+        if (type >= NOTIFICATION_HOURLY_UPLOADING && type <= NOTIFICATION_DAWN_UPLOADING) {
+            p.writeFloat(1.0f);
+        }
         p.writeInt64(time);
         if (second >= 0) p.writeInt64(second);
         if (flag >= 0) p.writeBool(flag == 1);
         mDisplay->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, p));
     }
-    // Waits for the rows the records written so far end with: the display
-    // takes them in order.
+    // Records are taken in order: waits for the rows the last ones write.
     void waitRows(const std::string& select, size_t n) {
         ASSERT_TRUE(waitFor([&] { return rows(select).size() >= n; }));
-    }
-    void tick(int64_t hour) {
-        const std::string ticks = "SELECT id FROM debug_hourly_tick";
-        size_t before = rows(ticks).size();
-        WallClock::setFixedTimeMs(hour + 500);
-        mRoutine->sendMessage(ParcelMessage(MESSAGE_TIMER, HourlyRoutine::kHourlyTimerId));
-        ASSERT_TRUE(waitFor([&] { return rows(ticks).size() > before; },
-                            std::chrono::milliseconds(15000)));
     }
     Json::Value lastEvent(uint32_t id) {
         DataUploader::getInstance()->uploadEvent();
         Json::Value found;
-        for (const Json::Value& e : events()) found = e["event"].asUInt() == id ? e["params"] : found;
+        for (const Json::Value& e : events())
+            found = e["event"].asUInt() == id ? e["params"] : found;
         return found;
     }
 
     fake::FakeKernelDriver mDriver;
-    sp<HourlyRoutine> mRoutine;
     sp<DisplayHandler> mDisplay;
     sp<Heard> mHeard;
     std::unique_ptr<NotifierListener> mListener;
@@ -178,8 +155,8 @@ TEST_F(DisplayTest, ScreenForegroundAndBacklightThroughTheHour) {
     log("KELVO_TAG_FOREGROUND_CHANGED", "name=com.a", kT + 90000);  // no change
     log("KELVO_TAG_BRIGHTNESS", "brightness=0", kT + 120000);
     waitRows("SELECT id FROM raw_screen_state", 2);
-    const std::string t = std::to_string(kT), a = std::to_string(kT + 60000);
-    const std::string off = std::to_string(kT + 120000);
+    const std::string t = std::to_string(kT), a = std::to_string(kT + 60000),
+                      off = std::to_string(kT + 120000);
     EXPECT_EQ(refused + 3, HealthCounters::get(Health::LoggerMessageRefused));
     ASSERT_TRUE(waitFor([&] { return mHeard->lines().size() >= 5; }));
     EXPECT_EQ((std::vector<std::string>{"f " + t + " com.tovaro.android.launcher", "s " + t + " 1",
@@ -191,7 +168,11 @@ TEST_F(DisplayTest, ScreenForegroundAndBacklightThroughTheHour) {
     EXPECT_EQ((std::vector<std::string>{t + "|0|0|0", off + "|120|120000|0"}),
               rows("SELECT timestamp, brightness, duration, charge FROM raw_screen_brightness"));
 
-    tick(kH);
+    notify(NOTIFICATION_HOURLY_TICK, kH - kHour, kH);
+    notify(NOTIFICATION_APPLICATIONS_ACCOUNTING, kH);
+    notify(NOTIFICATION_COMPONENT_ACCOUNTING, kH);
+    notify(NOTIFICATION_HOURLY_UPLOADING, kH);
+    AppsAccounting::getInstance()->balanceAccount();
     EXPECT_EQ((std::vector<std::string>{"com.a|60000|6960", "com.tovaro.android.launcher|60000|6960",
                                         "screen_off|1080000|0"}),
               rows("SELECT name, SUM(duration), SUM(energy) FROM hourly_applications_backlight "
@@ -226,24 +207,17 @@ TEST_F(DisplayTest, MidnightStatisticsWithChargerSplitAndClosingSpan) {
     log("KELVO_TAG_BRIGHTNESS", "brightness=40", m - 100000);
     waitRows("SELECT id FROM raw_screen_brightness", 5);
     notify(NOTIFICATION_DAILY_TICK, m - kHour, m);
-    Parcel upload;
-    upload.writeFloat(1.0f);
-    upload.writeInt64(m);
-    mDisplay->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_DAILY_UPLOADING,
-                                            upload));
+    notify(NOTIFICATION_DAILY_UPLOADING, m);
     EXPECT_EQ((std::vector<std::string>{"40|300000|0", "40|180000|1", "40|60000|0", "40|0|0",
                                         "40|90000|0"}),
-              rows("SELECT brightness, duration, charge FROM raw_screen_brightness WHERE "
-                   "timestamp > " + std::to_string(m - 400000)));
+              rows("SELECT brightness, duration, charge FROM raw_screen_brightness WHERE id > 1"));
     Json::Value p = lastEvent(EVENT_DAILY_SYSTEM);
     ASSERT_EQ(1u, p["10"].size());
     EXPECT_EQ(3, p["10"][0]["params"]["0"].asInt64());  // 40 / 16 + 1
     EXPECT_EQ(450000, p["10"][0]["params"]["1"].asInt64());
-    ASSERT_EQ(2u, p["11"].size());
-    EXPECT_EQ("1 5000 6 1000", p["11"][0]["params"]["0"].asString() + " " +
-                                   p["11"][0]["params"]["1"].asString() + " " +
-                                   p["11"][1]["params"]["0"].asString() + " " +
-                                   p["11"][1]["params"]["1"].asString());
+    ASSERT_EQ(2u, p["11"].size());  // auto level 1, front level 0 (6)
+    EXPECT_EQ(5000, p["11"][0]["params"]["1"].asInt64());
+    EXPECT_EQ(6, p["11"][1]["params"]["0"].asInt64());
 }
 
 // Policy 2: the backlight follows the device's value per span, scaled by
