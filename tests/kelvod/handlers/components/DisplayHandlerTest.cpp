@@ -6,10 +6,10 @@
 #include <json/json.h>
 
 #include <memory>
-#include <mutex>
 
 #include "FakeKernelDriver.h"
 #include "HealthCounters.h"
+#include "common/RecordingHandler.h"
 #include "core/AppsAccounting.h"
 #include "core/Dispatcher.h"
 #include "core/KelvoAgent.h"
@@ -36,27 +36,6 @@ constexpr int64_t kMidnight = 1796515200000LL;  // 2026-12-06 00:00 UTC
 constexpr int64_t kH = kMidnight + 10 * kHour;
 constexpr int64_t kT = kH - 20 * 60000;
 
-// What another operator hears: "f <time> <name>" and "s <time> <0|1>".
-class Heard : public HandlerThread {
-public:
-    Heard() : HandlerThread("Heard", 11) {}
-    int32_t handleParcelMessage(const ParcelMessage& m) override {
-        const Parcel& p = m.getParcel();
-        bool f = m.what == NOTIFICATION_FOREGROUND_CHANGED;
-        std::string line = (f ? "f " : "s ") + std::to_string(p.readInt64()) + " ";
-        line += f ? p.readString8().string() : std::to_string(p.readBool());
-        std::lock_guard<std::mutex> guard(mLock);
-        mLines.push_back(line);
-        return 0;
-    }
-    std::vector<std::string> lines() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mLines;
-    }
-    std::mutex mLock;
-    std::vector<std::string> mLines;
-};
-
 class DisplayTest : public kelvo::test::AgentStorageTest {
 protected:
     // The sample configuration with the display's policy.
@@ -81,7 +60,7 @@ protected:
         ASSERT_TRUE(mDriver.start());
         ASSERT_EQ(0, mDisplay->earlyInitialize());
         mDisplay->initialize();
-        mHeard = new Heard();
+        mHeard = new kelvo::test::RecordingHandler("Heard");
         mListener.reset(new NotifierListener(mHeard.get()));
         for (int32_t type : {NOTIFICATION_FOREGROUND_CHANGED, NOTIFICATION_SCREEN_STATE_CHANGED}) {
             Notifier::getInstance()->registerListener(type, mListener.get());
@@ -136,7 +115,7 @@ protected:
 
     fake::FakeKernelDriver mDriver;
     sp<DisplayHandler> mDisplay;
-    sp<Heard> mHeard;
+    sp<kelvo::test::RecordingHandler> mHeard;
     std::unique_ptr<NotifierListener> mListener;
     std::unique_ptr<LogWriter> mWriter;
 };
@@ -155,14 +134,17 @@ TEST_F(DisplayTest, ScreenForegroundAndBacklightThroughTheHour) {
     log("KELVO_TAG_FOREGROUND_CHANGED", "name=com.a", kT + 90000);  // no change
     log("KELVO_TAG_BRIGHTNESS", "brightness=0", kT + 120000);
     waitRows("SELECT id FROM raw_screen_state", 2);
-    const std::string t = std::to_string(kT), a = std::to_string(kT + 60000),
-                      off = std::to_string(kT + 120000);
+    const std::string t = std::to_string(kT), off = std::to_string(kT + 120000);
     EXPECT_EQ(refused + 3, HealthCounters::get(Health::LoggerMessageRefused));
-    ASSERT_TRUE(waitFor([&] { return mHeard->lines().size() >= 5; }));
-    EXPECT_EQ((std::vector<std::string>{"f " + t + " com.tovaro.android.launcher", "s " + t + " 1",
-                                        "f " + a + " com.a", "f " + off + " screen_off",
-                                        "s " + off + " 0"}),
-              mHeard->lines());
+    // What the others hear: foreground changes (0), screen on and off (1).
+    ASSERT_TRUE(waitFor([&] { return mHeard->got().size() >= 5; }));
+    std::string heard;
+    for (const auto& g : mHeard->got())
+        heard += std::to_string(g.what) + "@" + std::to_string(g.time - kT) +
+                 (g.what == 1 ? ":" + std::to_string(g.value) + " " : " ");
+    EXPECT_EQ("0@0 1@0:1 0@60000 0@120000 1@120000:0 ", heard);
+    EXPECT_EQ((std::vector<std::string>{"com.tovaro.android.launcher", "com.a", "screen_off"}),
+              rows("SELECT foreground FROM raw_foreground"));
     EXPECT_EQ((std::vector<std::string>{t + "|1", off + "|0"}),
               rows("SELECT timestamp, state FROM raw_screen_state"));
     EXPECT_EQ((std::vector<std::string>{t + "|0|0|0", off + "|120|120000|0"}),
