@@ -16,6 +16,7 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/CpuHandler.h"
+#include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
 #include "routines/HourlyRoutine.h"
@@ -37,6 +38,10 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
 
 android::sp<KelvoOperator> makeCpuHandler() {
     return new CpuHandler();
+}
+
+android::sp<KelvoOperator> makeDisplayHandler() {
+    return new DisplayHandler();
 }
 
 android::sp<KelvoOperator> makeGnssHandler() {
@@ -63,6 +68,7 @@ struct Factories {
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
         handlers[HANDLER_GNSS] = &makeGnssHandler;
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
+        handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
     }
 
     std::mutex lock;

@@ -289,7 +289,11 @@ int32_t CpuAccounter::onActionForeground(const Parcel& action) {
         }
         mEvents[timestamp] = polling_event{mScreenOn, mForeground};
     }
-    mScreenOn = name != String8(kScreenOffName);
+    // Screen state comes from its own action; a foreground change tells only
+    // that the screen went off. Any other name leaves the state as it is.
+    if (name == String8(kScreenOffName)) {
+        mScreenOn = false;
+    }
     mForeground = name;
     if (known) {
         LLOGE("Invalid event");

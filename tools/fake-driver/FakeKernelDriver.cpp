@@ -304,9 +304,15 @@ FakeKernelDriver::Answer FakeKernelDriver::answerKelvo(uint32_t request,
                      std::min(name->second.size(), cleared.size()));
             return Answer();
         }
-        case KelvoDevice::kGetBrightnessInfo:
-            putBytes(argument, 0, &mState.brightness, sizeof(mState.brightness));
+        case KelvoDevice::kGetBrightnessInfo: {
+            uint32_t value = mState.brightness;
+            if (!mState.spanBrightness.empty()) {
+                value = mState.spanBrightness.front();
+                mState.spanBrightness.pop_front();
+            }
+            putBytes(argument, 0, &value, sizeof(value));
             return Answer();
+        }
         case KelvoDevice::kRequestPidCpuTime:
         case KelvoDevice::kRequestKworkerInfo:
         case KelvoDevice::kRequestUeventInfo:

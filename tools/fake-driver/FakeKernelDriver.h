@@ -3,6 +3,7 @@
 #include <stdint.h>
 
 #include <array>
+#include <deque>
 #include <functional>
 #include <map>
 #include <mutex>
@@ -39,6 +40,10 @@ public:
         std::map<uint32_t, bool> flags;  // the switch requests, by number
         std::vector<GpuStep> gpuSteps;
         std::optional<int32_t> gpuCount;  // reported instead of the steps' number
+        // The advanced brightness of the span since the previous read: each
+        // read takes the next of spanBrightness, and `brightness` once they
+        // are used up (a level that has not changed since).
+        std::deque<uint32_t> spanBrightness;
         uint32_t brightness = 0;
         // Process names by pid; a name of 48 bytes or more fills the field
         // without a terminator.

@@ -382,7 +382,7 @@ int32_t ComponentHandler::logApplicationsAccounting(const component_family& fami
         "GROUP BY name",
         sumList(family).string(), family.rawApplications->name,
         static_cast<long long>(time - kHourMs), static_cast<long long>(time),
-        filterClause(family).string());
+        family.filterAccounting ? filterClause(family).string() : "");
     std::vector<sum_row> sums;
     int32_t ret = querySumRows(sql, true, valueCount(family), &sums);
     if (ret < 0) {
@@ -536,6 +536,13 @@ int32_t ComponentHandler::uploadTopApplications(const component_family& family, 
 
 int32_t ComponentHandler::uploadPeriod(uint32_t event, int64_t end, int64_t window, float ratio,
                                        int32_t candidate) {
+    int32_t ret = setPeriodData(event, end, window, ratio);
+    // Whatever failed, the round goes on.
+    voteCandidate(end, candidate, mElector);
+    return ret;
+}
+
+int32_t ComponentHandler::setPeriodData(uint32_t event, int64_t end, int64_t window, float ratio) {
     forceFlushEntries();
     Parcel out;
     for (const component_family* f : mFamilies) {
@@ -546,8 +553,6 @@ int32_t ComponentHandler::uploadPeriod(uint32_t event, int64_t end, int64_t wind
     if (ret < 0) {
         KLOGE("Failed to set %s upload data", mFamilies[0]->word);
     }
-    // Whatever failed, the round goes on.
-    voteCandidate(end, candidate, mElector);
     return ret < 0 ? -23 : 0;
 }
 

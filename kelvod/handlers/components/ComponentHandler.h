@@ -110,6 +110,11 @@ struct component_family {
     int32_t compensationValues[2] = {1, 3};
     // An extra condition of every query ("name != 'screen_off'"), or null.
     const char* filter = nullptr;
+    // Whether the applications accounting applies the filter too. A member
+    // that keeps the filtered names in its hourly application rows (the
+    // display's screen-off time, uploaded on its own) leaves it off there;
+    // the component sums and the uploads still apply it.
+    bool filterAccounting = true;
     // The ranking of the top applications, or null for the summed
     // foreground and background time ("MAX(foreground_duration +
     // background_duration)" for members whose hourly rows overlap).
@@ -209,6 +214,9 @@ protected:
     // window ending at `end`, hands them over and votes for the candidate.
     int32_t uploadPeriod(uint32_t event, int64_t end, int64_t window, float ratio,
                          int32_t candidate);
+    // The same without the vote, for a member that adds an event of its own
+    // before voting. 0, or -23 when the event could not be handed over.
+    int32_t setPeriodData(uint32_t event, int64_t end, int64_t window, float ratio);
 
     const std::vector<const component_family*> mFamilies;
     data_source_policy mPolicySource;

@@ -160,6 +160,9 @@ TEST_F(CpuAccounterTest, ForegroundTimeline) {
     // Events a pass or a balance has left behind are dropped: the same
     // millisecond is free again (and, being past, not recorded).
     ASSERT_EQ(0, foreground(800, "com.b"));
+    // Only the screen-state action turns the screen on again: an application
+    // in front after "screen_off" does not.
+    ASSERT_EQ(0, Fields(kCpu, ACTION_SCREEN_STATE).i64(800).flag(true).send());
     ASSERT_EQ(0, Fields(kCpu, ACTION_SET_VALUE).i64(900).i32(1).flag(false).send());
     EXPECT_EQ(0, foreground(800, "com.b"));
     ASSERT_EQ(0, foreground(1000, "com.a"));
