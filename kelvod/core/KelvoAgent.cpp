@@ -13,6 +13,7 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/CpuHandler.h"
+#include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
@@ -42,12 +43,17 @@ android::sp<KelvoOperator> makeHourlyRoutine() {
     return new HourlyRoutine();
 }
 
+android::sp<KelvoOperator> makeAbnormalityRoutine() {
+    return new AbnormalityRoutine();
+}
+
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
         handlers[HANDLER_CPU] = &makeCpuHandler;
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
+        routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
     }
 
     std::mutex lock;
@@ -117,6 +123,12 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
 void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
     if (id >= 0 && id < ROUTINE_COUNT) {
         setRoutine(id, op);
+    }
+}
+
+void KelvoAgent::setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < HANDLER_COUNT) {
+        setHandler(id, op);
     }
 }
 

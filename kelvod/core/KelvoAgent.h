@@ -87,6 +87,8 @@ public:
     // Puts an operator into a routine slot without start-up, so requests to
     // the routine reach it (tests); a null operator empties the slot.
     void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
+    // The same for a handler slot.
+    void setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();
 
