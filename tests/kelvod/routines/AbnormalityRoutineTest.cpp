@@ -73,7 +73,7 @@ protected:
                          "<kelvo_config><element id=\"1\"><component id=\"0\">"
                          "<parameter id=\"0\"><value>1000</value><value>500</value></parameter>"
                          "<parameter id=\"3\"></parameter>" +
-                             param(1, 2) + param(4, 3) + param(5, 2) + param(6, 1000) +
+                             param(1, 2) + param(2, 1) + param(4, 3) + param(5, 2) + param(6, 1000) +
                              param(8, 4) + param(9, 10) +
                              "</component></element><element id=\"3\"><component id=\"0\">"
                              "<parameter>42</parameter></component></element></kelvo_config>");
@@ -252,9 +252,8 @@ TEST_F(AbnormalityRoutineTest, WindowsFollowEachOtherSoABoundaryRowCountsOnce) {
     EXPECT_EQ(std::vector<std::string>{std::to_string(kT - 30 * kMin) + "|" + std::to_string(kT) +
                                        "|irq|4"},
               rows("SELECT start_time, end_time, source, count FROM debug_abnormal_wakeup"));
-    // Keys 2 and 7 are missing, key 3 is listed without values: each
-    // check logs all three.
-    EXPECT_EQ(9u, log.count("Failed to find abnormality threshold"));
+    // Key 7 is missing, key 3 is listed without values: each check logs both.
+    EXPECT_EQ(6u, log.count("Failed to find abnormality threshold"));
     gLogModuleMask &= ~LOG_MODULE_ABNORMALITY;
 }
 
@@ -316,6 +315,9 @@ INSTANTIATE_TEST_SUITE_P(
                     "type=21 package=com.w reason=Sync Tag#x count=900000", 0, "", "903002053 5x1",
                     "SELECT start_time, app, version, tag, duration FROM debug_abnormal_wakelock",
                     {std::to_string(kT - 900000) + "|com.w|1.2|Sync Tag|900000"}},
+        PelmoraCase{"NegativeDurationShiftsNothing",
+                    "type=21 package=com.w reason=Sync Tag#x count=-5", 0, "", "903002053 5x1",
+                    "SELECT start_time, duration FROM debug_abnormal_wakelock", {kTs + "|-5"}},
         PelmoraCase{"WakelockWithoutHash", "type=21 package=com.w reason=Sync count=900000", -19,
                     "", "", nullptr, {}}),
     [](const ::testing::TestParamInfo<PelmoraCase>& info) { return info.param.name; });
@@ -363,6 +365,21 @@ TEST_F(AbnormalityRoutineTest, HourlyApplicationsRankByEnergyAndQuoteNames) {
     EXPECT_EQ(600, list[1]["params"]["11"]["params"]["6"].asInt());
     EXPECT_EQ(3u, list[0]["params"].size());
     EXPECT_FALSE(log.contains("", ANDROID_LOG_ERROR));
+}
+
+TEST_F(AbnormalityRoutineTest, LargestBatteryReportAboveTheThresholdIsSentOnce) {
+    for (int32_t severity : {2, 1}) {
+        Parcel data;
+        for (int32_t v : {severity, 4000, -300, 7, 35}) data.writeInt32(v);
+        data.writeString8(android::String8("a-very-long-battery-version-text-0123456789"));
+        ASSERT_EQ(0, request(AbnormalityRoutine::REQUEST_BATTERY_CAPACITY, data));
+    }
+    checkAt(kT + 30 * kMin);
+    checkAt(kT + 60 * kMin);
+    EXPECT_EQ("903002051", sent());
+    EXPECT_EQ(std::vector<std::string>{"4000|-300|7|35|a-very-long-battery-version-tex"},
+              rows("SELECT full_capacity, diff_capacity, charge_count, temperature, version "
+                   "FROM debug_abnormal_battery_capacity"));
 }
 
 TEST_F(AbnormalityRoutineTest, CpuHandlerReportPushesUsagesAboveTheLimit) {
