@@ -38,10 +38,8 @@ constexpr int64_t kHalfHourMs = 1800000;
 // The system handler's tables the checks read.
 const kelvo::column_attribute kIrqColumns[] = {{COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}};
 const kelvo::table_attribute kIrq = {"1.0", 1, 2, kIrqColumns, "raw_ap_wake_irq"};
-const kelvo::column_attribute kAlarmColumns[] = {{COLUMN_TIME, "timestamp"},
-                                                 {COLUMN_TEXT, "name"},
-                                                 {COLUMN_TEXT, "tag"},
-                                                 {COLUMN_INT, "count"}};
+const kelvo::column_attribute kAlarmColumns[] = {
+    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, {COLUMN_TEXT, "tag"}, {COLUMN_INT, "count"}};
 const kelvo::table_attribute kAlarm = {"1.0", 1, 4, kAlarmColumns, "raw_applications_alarm"};
 const kelvo::column_attribute kPartialColumns[] = {{COLUMN_TIME, "timestamp"},
                                                    {COLUMN_INT, "uid"},
@@ -90,10 +88,8 @@ void BM_AbnormalityCheck(benchmark::State& state) {
     }
     sqlite3* db = nullptr;
     std::string seed =
-        "BEGIN;" +
-        spread("raw_ap_wake_irq", "name", "'irq' || (i % 4)", 50000) +
-        spread("raw_applications_alarm", "name, tag, count", "'app' || (i % 5), 'tag', 1",
-               10000) +
+        "BEGIN;" + spread("raw_ap_wake_irq", "name", "'irq' || (i % 4)", 50000) +
+        spread("raw_applications_alarm", "name, tag, count", "'app' || (i % 5), 'tag', 1", 10000) +
         spread("raw_partial_wakelock", "uid, name, tag, duration",
                "1000 + i % 3, 'proc' || (i % 5), 'tag', 20000", 10000) +
         spread("raw_kernel_wakelock", "name, duration", "'kwl' || (i % 3), 20000", 10000) +

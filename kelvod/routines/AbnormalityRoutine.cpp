@@ -1,10 +1,10 @@
 #include "routines/AbnormalityRoutine.h"
 
+#include <powerlog/powerlog.h>
+
 #include <cinttypes>
 #include <cstdio>
 #include <cstring>
-
-#include <powerlog/powerlog.h>
 
 #include "HealthCounters.h"
 #include "KelvoLibEntry.h"
@@ -79,23 +79,25 @@ const table_attribute kPelmoraAbnormalTable = {"1.0", 1, 5, kPelmoraAbnormalColu
                                                "raw_pelmora_abnormal"};
 
 const column_attribute kCapacityColumns[] = {
-    {COLUMN_TIME, "start_time"},    {COLUMN_TIME, "end_time"},     {COLUMN_INT, "full_capacity"},
-    {COLUMN_INT, "diff_capacity"},  {COLUMN_INT, "charge_count"},  {COLUMN_INT, "temperature"},
+    {COLUMN_TIME, "start_time"},   {COLUMN_TIME, "end_time"},    {COLUMN_INT, "full_capacity"},
+    {COLUMN_INT, "diff_capacity"}, {COLUMN_INT, "charge_count"}, {COLUMN_INT, "temperature"},
     {COLUMN_TEXT, "version"},
 };
 const table_attribute kCapacityTable = {"1.0", 1, 7, kCapacityColumns,
                                         "debug_abnormal_battery_capacity"};
 
 const column_attribute kLevelColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},    {COLUMN_INT, "diff_level"},
-    {COLUMN_INT, "gas_gauge"},   {COLUMN_INT, "temperature"},  {COLUMN_INT, "current"},
+    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},   {COLUMN_INT, "diff_level"},
+    {COLUMN_INT, "gas_gauge"},   {COLUMN_INT, "temperature"}, {COLUMN_INT, "current"},
     {COLUMN_INT, "voltage"},     {COLUMN_TEXT, "version"},
 };
 const table_attribute kLevelTable = {"1.0", 1, 8, kLevelColumns, "debug_abnormal_battery_level"};
 
 const column_attribute kSourceCountColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "source"},     {COLUMN_INT, "count"},
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_TEXT, "source"},
+    {COLUMN_INT, "count"},
 };
 const table_attribute kWakeupTable = {"1.0", 1, 4, kSourceCountColumns, "debug_abnormal_wakeup"};
 const table_attribute kModemTable = {"1.0", 1, 4, kSourceCountColumns, "debug_abnormal_modem"};
@@ -116,8 +118,7 @@ const column_attribute kSensorhubColumns[] = {
     {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_INT, "source"},
     {COLUMN_INT, "reason"},      {COLUMN_INT, "count"},
 };
-const table_attribute kSensorhubTable = {"1.0", 1, 5, kSensorhubColumns,
-                                         "debug_abnormal_sensorhub"};
+const table_attribute kSensorhubTable = {"1.0", 1, 5, kSensorhubColumns, "debug_abnormal_sensorhub"};
 
 const column_attribute kCpuColumns[] = {
     {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "app"},
@@ -126,21 +127,25 @@ const column_attribute kCpuColumns[] = {
 const table_attribute kCpuTable = {"1.0", 1, 6, kCpuColumns, "debug_abnormal_cpu"};
 
 const column_attribute kFreezeColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "process"},    {COLUMN_INT, "count"},
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_TEXT, "process"},
+    {COLUMN_INT, "count"},
 };
 const table_attribute kFreezeTable = {"1.0", 1, 4, kFreezeColumns, "debug_abnormal_freeze_fail"};
 
 const column_attribute kLocationColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "name"},       {COLUMN_INT, "count"},
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "count"},
 };
 const table_attribute kLocationTable = {"1.0", 1, 4, kLocationColumns,
                                         "debug_abnormal_location_counter"};
 
 const table_attribute* const kDebugTables[] = {
-    &kCapacityTable, &kLevelTable,    &kWakeupTable, &kModemTable,  &kAlarmTable,
-    &kWakelockTable, &kSensorhubTable, &kCpuTable,   &kFreezeTable, &kLocationTable,
+    &kCapacityTable, &kLevelTable,     &kWakeupTable, &kModemTable,  &kAlarmTable,
+    &kWakelockTable, &kSensorhubTable, &kCpuTable,    &kFreezeTable, &kLocationTable,
 };
 
 const dispatcher_tag kPelmoraDispatcherTag = {"KELVO_TAG_PM_POWER_CONTROL",
@@ -186,8 +191,7 @@ bool readLong(const android::Parcel& reply, int64_t& out) {
 
 std::string packageVersion(const std::string& name) {
     android::Parcel out;
-    if (PackageManager::getInstance()->getPackageVersion(android::String8(name.c_str()), &out) <
-        0) {
+    if (PackageManager::getInstance()->getPackageVersion(android::String8(name.c_str()), &out) < 0) {
         return "";
     }
     out.setDataPosition(0);
@@ -579,7 +583,7 @@ void AbnormalityRoutine::checkAlarm(const window& w, android::Parcel& p) {
         DataUploader::formIntData(2, count, element);
         DataUploader::formClassArray(4, kClassAlarm, element, p);
         ABNLOGD("Alarm: %s tag: %s count: %lld", name.c_str(), tag.c_str(),
-              static_cast<long long>(count));
+                static_cast<long long>(count));
         android::Parcel row;
         row.writeInt64(w.start);
         row.writeInt64(w.end);
@@ -652,7 +656,8 @@ void AbnormalityRoutine::checkKernelWakelock(const window& w, android::Parcel& p
             continue;
         }
         ++uploaded;
-        ABNLOGD("Kernel wakelock: %s duration: %lld", name.c_str(), static_cast<long long>(duration));
+        ABNLOGD("Kernel wakelock: %s duration: %lld", name.c_str(),
+                static_cast<long long>(duration));
         if (name != "GPSD") {
             uploadWakelock(w, name, "", "", duration, p);
             continue;
@@ -711,16 +716,15 @@ void AbnormalityRoutine::checkPartialWakelock(const window& w, android::Parcel& 
             continue;
         }
         char item[768];
-        snprintf(item, sizeof(item), "%d:%s:%s:%lld:%lld#", static_cast<int32_t>(uid),
-                 name.c_str(), tag.c_str(), static_cast<long long>(duration),
-                 static_cast<long long>(period));
+        snprintf(item, sizeof(item), "%d:%s:%s:%lld:%lld#", static_cast<int32_t>(uid), name.c_str(),
+                 tag.c_str(), static_cast<long long>(duration), static_cast<long long>(period));
         push += item;
         if (uploaded >= kTopRows) {
             continue;
         }
         ++uploaded;
         ABNLOGD("Partial wakelock: %s tag: %s duration: %lld", name.c_str(), tag.c_str(),
-              static_cast<long long>(duration));
+                static_cast<long long>(duration));
         uploadWakelock(w, name, "", tag, duration, p);
     }
 }
@@ -732,8 +736,7 @@ void AbnormalityRoutine::checkSensorhub(const window& w, android::Parcel& p) {
     }
     android::String8 sql = android::String8::format(
         "SELECT source, reason, COUNT(*) FROM raw_sensorhub_wake WHERE timestamp >= %" PRId64
-        " AND timestamp < %" PRId64
-        " GROUP BY source, reason ORDER BY COUNT(*) DESC LIMIT %d",
+        " AND timestamp < %" PRId64 " GROUP BY source, reason ORDER BY COUNT(*) DESC LIMIT %d",
         w.start, w.end, kTopRows);
     android::Parcel reply;
     int32_t rows = 0;
@@ -757,7 +760,7 @@ void AbnormalityRoutine::checkSensorhub(const window& w, android::Parcel& p) {
         DataUploader::formIntData(2, count, element);
         DataUploader::formClassArray(6, kClassSensorhub, element, p);
         ABNLOGD("Sensorhub source: %lld reason: %lld wake: %lld", static_cast<long long>(source),
-              static_cast<long long>(reason), static_cast<long long>(count));
+                static_cast<long long>(reason), static_cast<long long>(count));
         android::Parcel row;
         row.writeInt64(w.start);
         row.writeInt64(w.end);
@@ -807,7 +810,7 @@ void AbnormalityRoutine::checkLocation(const window& w, android::Parcel& p) {
         DataUploader::formIntData(1, entry.second, element);
         DataUploader::formClassArray(7, kClassCount, element, p);
         ABNLOGD("Location abnormalty: %s count: %lld", entry.first.c_str(),
-              static_cast<long long>(entry.second));
+                static_cast<long long>(entry.second));
         android::Parcel row;
         row.writeInt64(w.start);
         row.writeInt64(w.end);
@@ -845,14 +848,13 @@ void AbnormalityRoutine::checkScreenOffDrain(const window& w) {
     std::string gauge;
     std::string reason;
     int64_t count = 0;
-    if (rows < 1 || !readText(reply, gauge) || !readText(reply, reason) ||
-        !readLong(reply, count)) {
+    if (rows < 1 || !readText(reply, gauge) || !readText(reply, reason) || !readLong(reply, count)) {
         return;
     }
     int32_t modemLog = 0;
     int32_t wifiSpot = 0;
-    int32_t ret = parseMessage(reason.c_str(), "modem_log=", "wifi_spot=", "%d", &modemLog,
-                               sizeof(modemLog));
+    int32_t ret =
+        parseMessage(reason.c_str(), "modem_log=", "wifi_spot=", "%d", &modemLog, sizeof(modemLog));
     if (ret < 0) {
         KLOGE("Failed to parse modem log switch, ret: %d", ret);
         return;
@@ -1005,8 +1007,22 @@ int32_t AbnormalityRoutine::onPelmoraMessage(int64_t time, const char* text) {
         case kTypeWakelock:
             ret = onWakelockAbnormality(time, text);
             break;
-        case 0: case 1: case 2: case 3: case 5: case 6: case 8: case 9: case 10:
-        case 11: case 12: case 13: case 14: case 18: case 19: case 10000:
+        case 0:
+        case 1:
+        case 2:
+        case 3:
+        case 5:
+        case 6:
+        case 8:
+        case 9:
+        case 10:
+        case 11:
+        case 12:
+        case 13:
+        case 14:
+        case 18:
+        case 19:
+        case 10000:
             break;
         default:
             KLOGE("Unkown type: %d", type);
@@ -1032,8 +1048,8 @@ int32_t AbnormalityRoutine::onPelmoraMessage(int64_t time, const char* text) {
             int32_t modemLog = 0;
             int32_t wifiSpot = 0;
             char tail = 0;
-            if (sscanf(report.reason.c_str(), "modem_log:%d|wifi_spot:%d%c", &modemLog,
-                       &wifiSpot, &tail) != 2) {
+            if (sscanf(report.reason.c_str(), "modem_log:%d|wifi_spot:%d%c", &modemLog, &wifiSpot,
+                       &tail) != 2) {
                 KLOGE("Failed to get modem log and wifi spot switch");
                 refused();
                 return -2;
@@ -1178,7 +1194,7 @@ void AbnormalityRoutine::reportGnss(const window& w, const pelmora_report& repor
 void AbnormalityRoutine::reportCpu(const window& w, const std::string& package, int32_t usage,
                                    int64_t cpuTime, int64_t energy) {
     ABNLOGD("Cpu: %s usage: %d time: %ld", package.c_str(), usage,
-          static_cast<long>(cpuTime / 1000));
+            static_cast<long>(cpuTime / 1000));
     if (!takeReport(mCpu, package)) {
         return;
     }

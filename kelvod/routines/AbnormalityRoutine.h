@@ -1,15 +1,14 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stdint.h>
+#include <utils/String8.h>
 
 #include <atomic>
 #include <map>
 #include <set>
 #include <string>
 #include <vector>
-
-#include <binder/Parcel.h>
-#include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
 #include "utils/TimerCallback.h"

@@ -29,10 +29,9 @@ constexpr int64_t kT = 1796515200000LL + 10 * 3600000LL;  // 2026-12-06 10:00 UT
 constexpr int64_t kMin = 60000;
 
 // The other operators' tables the checks read (only the columns they need).
-#define RAW_TABLE(var, name, ...)                                       \
-    const column_attribute var##Columns[] = {__VA_ARGS__};             \
-    const table_attribute var = {"1.0", 1,                              \
-                                 sizeof(var##Columns) / sizeof(column_attribute), \
+#define RAW_TABLE(var, name, ...)                                                           \
+    const column_attribute var##Columns[] = {__VA_ARGS__};                                  \
+    const table_attribute var = {"1.0", 1, sizeof(var##Columns) / sizeof(column_attribute), \
                                  var##Columns, name}
 RAW_TABLE(kIrq, "raw_ap_wake_irq", {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"});
 RAW_TABLE(kModem, "raw_modem_wakeup_source", {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "type"});
@@ -73,8 +72,8 @@ protected:
                          "<kelvo_config><element id=\"1\"><component id=\"0\">"
                          "<parameter id=\"0\"><value>1000</value><value>500</value></parameter>"
                          "<parameter id=\"3\"></parameter>" +
-                             param(1, 2) + param(2, 1) + param(4, 3) + param(5, 2) + param(6, 1000) +
-                             param(8, 4) + param(9, 10) +
+                             param(1, 2) + param(2, 1) + param(4, 3) + param(5, 2) +
+                             param(6, 1000) + param(8, 4) + param(9, 10) +
                              "</component></element><element id=\"3\"><component id=\"0\">"
                              "<parameter>42</parameter></component></element></kelvo_config>");
         mRoot->writeFile("/sys/devices/system/cpu/possible", "0-3\n");
@@ -198,44 +197,59 @@ INSTANTIATE_TEST_SUITE_P(
                    "INSERT INTO raw_ap_wake_irq(timestamp, name) SELECT @T, 'irqA' FROM n "
                    "UNION ALL SELECT @T, 'GPIO42' FROM n UNION ALL SELECT @T, 'irqB' FROM n "
                    "WHERE i<4",
-                   "SELECT source, count FROM debug_abnormal_wakeup", {"irqA|5"},
-                   "903002053 2x1", ""},
+                   "SELECT source, count FROM debug_abnormal_wakeup",
+                   {"irqA|5"},
+                   "903002053 2x1",
+                   ""},
         WindowCase{"AlarmsButNotTheLocationAlarm",
                    "INSERT INTO raw_applications_alarm(timestamp, name, tag, count) VALUES "
                    "(@T,'com.a','t',1),(@T,'com.a','t',1),(@T,'com.a','t',1),(@T,'com.a','t',2),"
                    "(@T,'android','com.android.internal.location.ALARM_WAKEUP',1),"
                    "(@T,'android','com.android.internal.location.ALARM_WAKEUP',1),"
                    "(@T,'android','com.android.internal.location.ALARM_WAKEUP',1)",
-                   "SELECT app, tag, count FROM debug_abnormal_alarm", {"com.a|t|3"},
-                   "903002053 4x1", ""},
+                   "SELECT app, tag, count FROM debug_abnormal_alarm",
+                   {"com.a|t|3"},
+                   "903002053 4x1",
+                   ""},
         WindowCase{"ModemListsEveryTypeOnceTheSumPasses",
                    "INSERT INTO raw_modem_wakeup_source(timestamp, type) VALUES (@T,1),(@T,1),"
                    "(@T,0),(@T,0),(@T,0),(@T,5),(@T,6)",
                    "SELECT source, count FROM debug_abnormal_modem",
-                   {"0|3", "1|2", "5|1", "6|1"}, "903002053 3x4", ""},
+                   {"0|3", "1|2", "5|1", "6|1"},
+                   "903002053 3x4",
+                   ""},
         WindowCase{"ModemOtherTypesAloneAreNoAbnormality",
                    "INSERT INTO raw_modem_wakeup_source(timestamp, type) VALUES (@T,1),(@T,2),"
                    "(@T,3),(@T,4),(@T,4),(@T,4),(@T,4)",
-                   "SELECT source, count FROM debug_abnormal_modem", {}, "", ""},
+                   "SELECT source, count FROM debug_abnormal_modem",
+                   {},
+                   "",
+                   ""},
         WindowCase{"LocationTopThreeAndTotal",
                    "INSERT INTO raw_location_counter(timestamp, name, count) VALUES "
                    "(@T,'a',5),(@T,'b',4),(@T,'c',2),(@T,'d',1)",
                    "SELECT name, count FROM debug_abnormal_location_counter",
-                   {"a|5", "b|4", "c|2", "total|12"}, "903002053 7x4", ""},
-        WindowCase{"WakelocksWithOnePowerLogLine",
-                   "INSERT INTO raw_kernel_wakelock(timestamp, name, duration) VALUES "
-                   "(@T,'kwl',5000),(@T,'charge_wakelock',9000),(@T,'small',900);"
-                   "INSERT INTO raw_partial_wakelock(timestamp, uid, name, tag, duration) "
-                   "VALUES (@T,1000,'system','tagA',3000),(@T,10050,'app','tagB',8000),"
-                   "(@T,1000,'system','*alarm*',8000)",
-                   "SELECT app, tag, duration FROM debug_abnormal_wakelock",
-                   {"kwl||5000", "system|tagA|3000"}, "903002053 5x2",
-                   "\t5\t207\t\twakelock\t0:kernel:kwl:5000:1800000#1000:system:tagA:3000:1800000\n"},
+                   {"a|5", "b|4", "c|2", "total|12"},
+                   "903002053 7x4",
+                   ""},
+        WindowCase{
+            "WakelocksWithOnePowerLogLine",
+            "INSERT INTO raw_kernel_wakelock(timestamp, name, duration) VALUES "
+            "(@T,'kwl',5000),(@T,'charge_wakelock',9000),(@T,'small',900);"
+            "INSERT INTO raw_partial_wakelock(timestamp, uid, name, tag, duration) "
+            "VALUES (@T,1000,'system','tagA',3000),(@T,10050,'app','tagB',8000),"
+            "(@T,1000,'system','*alarm*',8000)",
+            "SELECT app, tag, duration FROM debug_abnormal_wakelock",
+            {"kwl||5000", "system|tagA|3000"},
+            "903002053 5x2",
+            "\t5\t207\t\twakelock\t0:kernel:kwl:5000:1800000#1000:system:tagA:3000:1800000\n"},
         WindowCase{"FreezeFailedProcesses",
                    "INSERT INTO raw_freezing_failed(timestamp, name) VALUES (@T,'p'),(@T,'p'),"
                    "(@T,'p'),(@T,'q')",
-                   "SELECT process, count FROM debug_abnormal_freeze_fail", {"p|3"},
-                   "903002056 4x1", ""}),
+                   "SELECT process, count FROM debug_abnormal_freeze_fail",
+                   {"p|3"},
+                   "903002056 4x1",
+                   ""}),
     [](const ::testing::TestParamInfo<WindowCase>& info) { return info.param.name; });
 
 TEST_F(AbnormalityRoutineTest, WindowsFollowEachOtherSoABoundaryRowCountsOnce) {
@@ -296,30 +310,66 @@ const std::string kTs = std::to_string(kT);
 INSTANTIATE_TEST_SUITE_P(
     Types, PelmoraMessageTest,
     ::testing::Values(
-        PelmoraCase{"FreezeFailure", "type=4 package=com.f count=3 reason=1:binder", 0,
-                    "4|com.f|binder|3", "", nullptr, {}},
-        PelmoraCase{"FreezeFailureNotKept", "type=4 package=com.f count=3 reason=2:binder", 0,
-                    "", "", nullptr, {}},
+        PelmoraCase{"FreezeFailure",
+                    "type=4 package=com.f count=3 reason=1:binder",
+                    0,
+                    "4|com.f|binder|3",
+                    "",
+                    nullptr,
+                    {}},
+        PelmoraCase{"FreezeFailureNotKept",
+                    "type=4 package=com.f count=3 reason=2:binder",
+                    0,
+                    "",
+                    "",
+                    nullptr,
+                    {}},
         PelmoraCase{"Refused", "type=7 package=com.x", -3, "", "", nullptr, {}},
-        PelmoraCase{"Gnss", "type=15 package=com.g count=60000 reason=gps", 0,
-                    "15|com.g|gps|60000", "903002055 4x1", nullptr, {}},
-        PelmoraCase{"ScreenOffDrain", "type=17 package=3500 count=2 reason=modem_log:1|wifi_spot:0",
-                    0, "17|3500|modem_log=1 wifi_spot=0|2", "", nullptr, {}},
+        PelmoraCase{"Gnss",
+                    "type=15 package=com.g count=60000 reason=gps",
+                    0,
+                    "15|com.g|gps|60000",
+                    "903002055 4x1",
+                    nullptr,
+                    {}},
+        PelmoraCase{"ScreenOffDrain",
+                    "type=17 package=3500 count=2 reason=modem_log:1|wifi_spot:0",
+                    0,
+                    "17|3500|modem_log=1 wifi_spot=0|2",
+                    "",
+                    nullptr,
+                    {}},
         // 120 s of CPU over four processors: the window starts 30 s earlier.
-        PelmoraCase{"CpuWithTrace", "type=20 package=com.c usage=80 time=120000 energy=5000", 0, "",
-                    "903002055 3x1",
-                    "SELECT start_time, app, usage_rate, bg_usage, bg_energy FROM debug_abnormal_cpu "
-                    "UNION ALL SELECT timestamp, name, value, '', '' FROM daily_misc_data",
-                    {std::to_string(kT - 30000) + "|com.c|80|120|5000", kTs + "|systrace|0||"}},
+        PelmoraCase{
+            "CpuWithTrace",
+            "type=20 package=com.c usage=80 time=120000 energy=5000",
+            0,
+            "",
+            "903002055 3x1",
+            "SELECT start_time, app, usage_rate, bg_usage, bg_energy FROM debug_abnormal_cpu "
+            "UNION ALL SELECT timestamp, name, value, '', '' FROM daily_misc_data",
+            {std::to_string(kT - 30000) + "|com.c|80|120|5000", kTs + "|systrace|0||"}},
         PelmoraCase{"ApplicationWakelock",
-                    "type=21 package=com.w reason=Sync Tag#x count=900000", 0, "", "903002053 5x1",
+                    "type=21 package=com.w reason=Sync Tag#x count=900000",
+                    0,
+                    "",
+                    "903002053 5x1",
                     "SELECT start_time, app, version, tag, duration FROM debug_abnormal_wakelock",
                     {std::to_string(kT - 900000) + "|com.w|1.2|Sync Tag|900000"}},
         PelmoraCase{"NegativeDurationShiftsNothing",
-                    "type=21 package=com.w reason=Sync Tag#x count=-5", 0, "", "903002053 5x1",
-                    "SELECT start_time, duration FROM debug_abnormal_wakelock", {kTs + "|-5"}},
-        PelmoraCase{"WakelockWithoutHash", "type=21 package=com.w reason=Sync count=900000", -19,
-                    "", "", nullptr, {}}),
+                    "type=21 package=com.w reason=Sync Tag#x count=-5",
+                    0,
+                    "",
+                    "903002053 5x1",
+                    "SELECT start_time, duration FROM debug_abnormal_wakelock",
+                    {kTs + "|-5"}},
+        PelmoraCase{"WakelockWithoutHash",
+                    "type=21 package=com.w reason=Sync count=900000",
+                    -19,
+                    "",
+                    "",
+                    nullptr,
+                    {}}),
     [](const ::testing::TestParamInfo<PelmoraCase>& info) { return info.param.name; });
 
 TEST_F(AbnormalityRoutineTest, CpuTraceIsAttachedToItsEvent) {
@@ -338,8 +388,9 @@ TEST_F(AbnormalityRoutineTest, CpuTraceIsAttachedToItsEvent) {
 
 TEST_F(AbnormalityRoutineTest, HourlyApplicationsRankByEnergyAndQuoteNames) {
     std::string hour = std::to_string(kT - 5 * kMin);
-    std::string sql = "INSERT INTO hourly_applications_accounting(timestamp, name, component, "
-                      "foreground_energy, background_energy) VALUES ";
+    std::string sql =
+        "INSERT INTO hourly_applications_accounting(timestamp, name, component, "
+        "foreground_energy, background_energy) VALUES ";
     for (int app = 0; app < 5; ++app) {
         for (int c = 0; c < 3; ++c) {
             sql += "(" + hour + ",'small" + std::to_string(app) + "'," + std::to_string(c) +

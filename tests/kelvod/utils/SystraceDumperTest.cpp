@@ -1,8 +1,7 @@
+#include <binder/ServiceControl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <unistd.h>
-
-#include <binder/ServiceControl.h>
 
 #include <atomic>
 #include <memory>
