@@ -7,6 +7,8 @@
 #include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "PlatformServices.h"
+#include "binder/managers/PackageManager.h"
+#include "binder/managers/SysinfoManager.h"
 #include "core/AppsAccounting.h"
 #include "core/Dispatcher.h"
 #include "core/KelvoAgent.h"
@@ -108,6 +110,10 @@ protected:
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_ABNORMALITY, nullptr);
         Dispatcher::resetForTest();
         mServices.reset();
+        // The clients are process-wide: they see their services go before
+        // the next test starts new ones.
+        EXPECT_TRUE(waitFor([] { return !PackageManager::getInstance()->isConnected(); }));
+        EXPECT_TRUE(waitFor([] { return !SysinfoManager::getInstance()->isConnected(); }));
         ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
         WallClock::setFixedTimeMs(-1);
         AgentStorageTest::TearDown();

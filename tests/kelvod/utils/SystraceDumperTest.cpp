@@ -8,6 +8,7 @@
 
 #include "KelvoLog.h"
 #include "PlatformServices.h"
+#include "binder/managers/SysinfoManager.h"
 #include "common/TestEnv.h"
 #include "core/KelvoAgent.h"
 #include "utils/SystraceDumper.h"
@@ -37,6 +38,7 @@ protected:
     }
     void TearDown() override {
         mServices.reset();
+        EXPECT_TRUE(waitFor([] { return !SysinfoManager::getInstance()->isConnected(); }));
         SystraceDumper::setClockForTest(nullptr);
         gLogUserType = mSavedUserType;
         ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
