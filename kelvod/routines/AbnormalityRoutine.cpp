@@ -298,6 +298,9 @@ int32_t AbnormalityRoutine::readThresholds() {
         }
         if (!values.empty()) {
             mThresholds[key] = values;
+        } else {
+            // A key without values has no limit: its check stays off.
+            refused();
         }
         if (ended) {
             break;
