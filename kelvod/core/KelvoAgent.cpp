@@ -19,6 +19,7 @@
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
@@ -60,6 +61,10 @@ android::sp<KelvoOperator> makeHourlyRoutine() {
     return new HourlyRoutine();
 }
 
+android::sp<KelvoOperator> makeAbnormalityRoutine() {
+    return new AbnormalityRoutine();
+}
+
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
@@ -69,6 +74,7 @@ struct Factories {
         handlers[HANDLER_GNSS] = &makeGnssHandler;
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
+        routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
     }
 
     std::mutex lock;

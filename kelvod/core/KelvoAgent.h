@@ -85,14 +85,15 @@ public:
     android::sp<KelvoOperator> getRoutine(int32_t id);
 
     // Replaces what start-up creates for a slot (tests and the simulator);
-    // a null factory leaves the slot empty. By default start-up creates the
-    // polling routine only.
+    // a null factory leaves the slot empty. By default start-up creates the CPU handler
+    // and the polling, hourly and abnormality routines.
     static void setHandlerFactory(int32_t id, OperatorFactory factory);
     static void setRoutineFactory(int32_t id, OperatorFactory factory);
     static void setExitHook(ExitHook hook);
     // Puts an operator into a routine slot without start-up, so requests to
     // the routine reach it (tests); a null operator empties the slot.
     void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
+    // The same for a handler slot.
     void setHandlerForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();

@@ -38,6 +38,7 @@ enum class Health : uint32_t {
     CpuEntriesCapped,        // processes or uids not followed: their maps were full
     CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
     ServiceRequestsRefused,  // binder requests refused or cut (caller, path, push message, query, reply size)
+    AbnormalityInputRefused, // abnormality reports, records or rows refused or over their cap
     Count
 };
 
