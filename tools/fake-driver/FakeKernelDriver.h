@@ -55,8 +55,8 @@ public:
     };
 
     // Report requests (per-process CPU time, kernel workers, uevents, binder
-    // statistics) are handed to this after they are answered; the device
-    // simulator answers them as the buffered-log client of the driver.
+    // statistics) are handed to this after they are answered (FakeDriverReporter
+    // answers them as the buffered-log client of the driver).
     using RequestListener = std::function<void(const Request&)>;
 
     FakeKernelDriver() = default;

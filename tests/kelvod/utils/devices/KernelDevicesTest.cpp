@@ -8,13 +8,16 @@
 #include <string>
 #include <vector>
 
+#include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
 #include "HealthCounters.h"
 #include "common/TestEnv.h"
+#include "core/BufferedLogServer.h"
 #include "utils/devices/DpmDevice.h"
 #include "utils/devices/KelvoDevice.h"
 
 using namespace kelvo;
+using kelvo::fake::FakeDriverReporter;
 using kelvo::fake::FakeKernelDriver;
 using kelvo::test::LogCapture;
 using kelvo::test::TempRoot;
@@ -26,6 +29,31 @@ std::vector<uint8_t> bytesOf(const void* data, size_t size) {
     const uint8_t* p = static_cast<const uint8_t*>(data);
     return std::vector<uint8_t>(p, p + size);
 }
+
+// Records "name:magic:data" of every buffered-log entry it gets.
+class EntryRecorder : public HandlerThread {
+public:
+    EntryRecorder() : HandlerThread("EntryRecorder", 11) {}
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        const android::Parcel& p = msg.getParcel();
+        p.readInt64();
+        std::string entry = std::string(p.readString8().string()) + ":";
+        entry += std::to_string(p.readInt32()) + ":";
+        std::string data(static_cast<size_t>(p.readInt32()), '\0');
+        p.read(&data[0], data.size());
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.push_back(entry + data);
+        return 0;
+    }
+    std::vector<std::string> got() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mGot;
+    }
+
+private:
+    std::mutex mLock;
+    std::vector<std::string> mGot;
+};
 
 class KernelDevicesTest : public ::testing::Test {
 protected:
@@ -242,24 +270,48 @@ TEST_F(KernelDevicesTest, FailedRequests) {
     EXPECT_TRUE(log.contains("getVersion# Failed to get version"));
     EXPECT_TRUE(DpmDevice::isReady());
 
-    // Report requests are handed on once answered.
-    std::mutex lock;
-    std::vector<FakeKernelDriver::Request> reports;
-    mDriver.setRequestListener([&](const FakeKernelDriver::Request& r) {
-        std::lock_guard<std::mutex> guard(lock);
-        reports.push_back(r);
-    });
-    dev_transmit_t transmit = KelvoDevice::makeTransmit(5000, 2);
-    EXPECT_EQ(0, KelvoDevice::requestPidCpuTime(&transmit));
-    ASSERT_TRUE(kelvo::test::waitFor([&] {
-        std::lock_guard<std::mutex> guard(lock);
-        return !reports.empty();
-    }));
-    std::lock_guard<std::mutex> guard(lock);
-    EXPECT_EQ(bytesOf(&transmit, sizeof(transmit)), reports[0].argument);
-
     mDriver.stop();
     ASSERT_EQ(0, symlink("/dev/null", (mRoot.path() + "/dev/kelvo").c_str()));
     EXPECT_EQ(-2, KelvoDevice::getBrightnessInfo(&brightness));
     EXPECT_TRUE(log.contains("Failed to ioctl: -1(" + std::string(strerror(ENOTTY)) + ")"));
+}
+
+// Every served report request comes back later from "kelvo_driver" with its
+// report's magic, the request's time and reason, then the supplied body; a
+// failed request gets no report.
+TEST_F(KernelDevicesTest, ReportRequestsAnsweredAsTheDriversBufferedLogClient) {
+    android::sp<BufferedLogServer> server = new BufferedLogServer("ReportServer", 2000);
+    ASSERT_EQ(0, server->start());
+    android::sp<EntryRecorder> recorder = new EntryRecorder();
+    android::sp<LogReceiver> receiver = new LogReceiver(recorder);
+    for (int32_t magic = 0; magic < 4; ++magic) {
+        ASSERT_EQ(0, server->registerLogReceiver(receiver, android::String8("kelvo_driver"), magic));
+    }
+    FakeDriverReporter reporter(mDriver);
+    reporter.setBodyProvider([](const FakeDriverReporter::Report& r) {
+        return r.magic == FakeDriverReporter::MAGIC_BINDER_STATS ? std::string("\x00\xff", 2) : "";
+    });
+    reporter.start();
+    mDriver.failRequest(Device::Kelvo, KelvoDevice::kRequestUeventInfo, EIO);
+    auto echo = [](int32_t magic, int64_t time, int32_t reason) {
+        std::string bytes(12, '\0');
+        memcpy(&bytes[0], &time, 8);
+        memcpy(&bytes[8], &reason, 4);
+        return "kelvo_driver:" + std::to_string(magic) + ":" + bytes;
+    };
+    dev_transmit_t cpu = KelvoDevice::makeTransmit(-5, 3);
+    dev_transmit_t binder = KelvoDevice::makeTransmit(0x0102030405060708LL, 4);
+    EXPECT_EQ(0, KelvoDevice::requestPidCpuTime(&cpu));
+    EXPECT_EQ(0, KelvoDevice::requestKworkerInfo(3600000));
+    EXPECT_EQ(-2, KelvoDevice::requestUeventInfo(3600000));
+    EXPECT_EQ(0, KelvoDevice::requestBinderStats(&binder));
+    std::vector<std::string> expected = {echo(0, -5, 3), echo(1, 3600000, 0),
+                                         echo(3, 0x0102030405060708LL, 4) + std::string("\x00\xff", 2)};
+    ASSERT_TRUE(kelvo::test::waitFor([&] { return recorder->got().size() >= expected.size(); }));
+    EXPECT_EQ(expected, recorder->got());
+    EXPECT_EQ(3u, reporter.sent());
+    reporter.stop();
+    server->stop();
+    recorder->requestThreadExit();
+    recorder->join();
 }
