@@ -164,12 +164,14 @@ bool Scenario::parse(const std::string& text, const std::string& name, std::stri
         }
         if (!words.empty() && !parseLine(words, &reason)) {
             *error = name + ":" + std::to_string(mLine) + ": " + reason;
+            *this = Scenario();
             return false;
         }
     }
     int32_t at = mLine;
     if (!check(&reason, &at)) {
         *error = name + ":" + std::to_string(at) + ": " + reason;
+        *this = Scenario();
         return false;
     }
     std::stable_sort(mSteps.begin(), mSteps.end(),
