@@ -12,6 +12,7 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "handlers/components/CpuHandler.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -27,7 +28,12 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
 
+android::sp<KelvoOperator> makeCpuHandler() {
+    return new CpuHandler();
+}
+
 struct Factories {
+    Factories() { handlers[HANDLER_CPU] = makeCpuHandler; }
     std::mutex lock;
     KelvoAgent::OperatorFactory handlers[HANDLER_COUNT] = {};
     KelvoAgent::OperatorFactory routines[ROUTINE_COUNT] = {};
@@ -124,6 +130,12 @@ void KelvoAgent::setHandler(int32_t id, const android::sp<KelvoOperator>& op) {
 void KelvoAgent::setRoutine(int32_t id, const android::sp<KelvoOperator>& op) {
     std::lock_guard<std::mutex> guard(mSlotLock);
     mRoutines[id] = op;
+}
+
+void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < ROUTINE_COUNT) {
+        setRoutine(id, op);
+    }
 }
 
 int32_t KelvoAgent::initiate() {

@@ -83,6 +83,9 @@ public:
     static void setHandlerFactory(int32_t id, OperatorFactory factory);
     static void setRoutineFactory(int32_t id, OperatorFactory factory);
     static void setExitHook(ExitHook hook);
+    // Puts an operator into a routine slot outside start-up (tests of one
+    // operator that need a stand-in routine); null empties the slot.
+    void setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op);
 
     KelvoAgent();
 

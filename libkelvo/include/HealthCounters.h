@@ -30,6 +30,10 @@ enum class Health : uint32_t {
     AccounterEventsDropped,  // oldest timeline events dropped by an accounter at its cap
     TimerRearmRetries,       // timers that could not be re-armed at once (retried later)
     ValuesSaturated,         // values clamped to their stored or sent width
+    CpuReportsRefused,       // per-process CPU reports dropped (bad length or count)
+    CpuReportsLate,          // CPU passes run without their per-process report
+    CpuEntriesCapped,        // processes or uids not followed: their maps were full
+    CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
     Count
 };
 

@@ -16,7 +16,8 @@ const char* const kHealthNames[] = {
         "inserts_deferred",          "upload_failures",         "upload_records_refused",
         "messages_dropped",          "messages_refused",        "files_deleted",
         "buffered_client_refused",   "device_answers_refused",  "accounter_events_dropped",
-        "timer_rearm_retries",       "values_saturated",
+        "timer_rearm_retries",       "values_saturated",        "cpu_reports_refused",
+        "cpu_reports_late",          "cpu_entries_capped",      "cpu_counter_lines_ignored",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

@@ -38,7 +38,9 @@ rc=$?
 elapsed=$(( ($(date +%s%N) - start) / 1000000 ))
 echo "exit status $rc after ${elapsed} ms"
 [ $rc -eq 0 ] || { echo "FAIL: exit status $rc"; cat "$log"; exit 1; }
-# A first start on an empty root raises no error line.
-errors=$(grep '^kelvod E ' "$log" | grep -v 'batteryproperties\|registerListener' || true)
+# A first start on an empty root raises no error line, but for the CPU
+# handler, which stands down on a root without CPU counters or kernel device.
+errors=$(grep '^kelvod E ' "$log" | grep -v 'batteryproperties\|registerListener' |
+         grep -v '\[CpuHandler.cpp\]\|disable module: 3\|CpuHandler exit' || true)
 [ -z "$errors" ] || { echo "FAIL: error lines on a first start:"; echo "$errors"; exit 1; }
 echo "PASS"

@@ -24,11 +24,12 @@ std::string coreDir(int32_t core) {
 std::vector<CpuTree::Cluster> CpuTree::phoneClusters() {
     Cluster little;
     little.cores = {0, 1, 2, 3};
-    little.frequencies = {300000, 576000, 1017600, 1324800, 1747200};
+    little.frequencies = {300000, 576000, 768000, 1017600, 1248000, 1324800, 1516800, 1747200};
     little.idleStates = 2;
     Cluster big;
     big.cores = {4, 5, 6, 7};
-    big.frequencies = {300000, 806400, 1344000, 1804800, 2208000, 2457600};
+    big.frequencies = {300000,  652800,  806400,  1094400, 1344000,
+                       1574400, 1804800, 2208000, 2457600};
     big.idleStates = 2;
     return {little, big};
 }

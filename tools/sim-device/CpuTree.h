@@ -33,7 +33,8 @@ public:
 
     explicit CpuTree(std::string root) : mRoot(std::move(root)) {}
 
-    // Two clusters of four cores: 0-3 little, 4-7 big.
+    // Two clusters of four cores, as the sample power profile has them:
+    // 0-3 little with 8 steps, 4-7 big with 9 steps.
     static std::vector<Cluster> phoneClusters();
 
     // Lays out the clusters' folders and fixed files and zeroes every
