@@ -13,6 +13,7 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/CpuHandler.h"
+#include "routines/HourlyRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -32,8 +33,17 @@ android::sp<KelvoOperator> makeCpuHandler() {
     return new CpuHandler();
 }
 
+android::sp<KelvoOperator> makeHourlyRoutine() {
+    return new HourlyRoutine();
+}
+
+// What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
-    Factories() { handlers[HANDLER_CPU] = makeCpuHandler; }
+    Factories() {
+        handlers[HANDLER_CPU] = &makeCpuHandler;
+        routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
+    }
+
     std::mutex lock;
     KelvoAgent::OperatorFactory handlers[HANDLER_COUNT] = {};
     KelvoAgent::OperatorFactory routines[ROUTINE_COUNT] = {};
@@ -98,6 +108,12 @@ void KelvoAgent::setRoutineFactory(int32_t id, OperatorFactory factory) {
     factories().routines[id] = factory;
 }
 
+void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
+    if (id >= 0 && id < ROUTINE_COUNT) {
+        setRoutine(id, op);
+    }
+}
+
 void KelvoAgent::setExitHook(ExitHook hook) {
     gExitHook = hook != nullptr ? hook : &_exit;
 }
@@ -130,12 +146,6 @@ void KelvoAgent::setHandler(int32_t id, const android::sp<KelvoOperator>& op) {
 void KelvoAgent::setRoutine(int32_t id, const android::sp<KelvoOperator>& op) {
     std::lock_guard<std::mutex> guard(mSlotLock);
     mRoutines[id] = op;
-}
-
-void KelvoAgent::setRoutineForTest(int32_t id, const android::sp<KelvoOperator>& op) {
-    if (id >= 0 && id < ROUTINE_COUNT) {
-        setRoutine(id, op);
-    }
 }
 
 int32_t KelvoAgent::initiate() {

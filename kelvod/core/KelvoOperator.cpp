@@ -464,10 +464,17 @@ int32_t KelvoOperator::rearmTimer(const android::sp<TimerCallback>& callback, in
     }
     HealthCounters::add(Health::TimerRearmRetries);
     int32_t id = callback != nullptr ? callback->getId() : -1;
+    int64_t delay = sTimerRetryDelayMs.load(std::memory_order_relaxed);
     KLOGE("Failed to re-arm timer %d of %s: %d, retrying in %lld ms", id, getName(), ret,
-          static_cast<long long>(kTimerRetryDelayMs));
-    sendMessageDelayed(kTimerRetryDelayMs * 1000000LL, ParcelMessage(kTimerRearmMessage, id));
+          static_cast<long long>(delay));
+    sendMessageDelayed(delay * 1000000LL, ParcelMessage(kTimerRearmMessage, id));
     return ret;
+}
+
+std::atomic<int64_t> KelvoOperator::sTimerRetryDelayMs{KelvoOperator::kTimerRetryDelayMs};
+
+void KelvoOperator::setTimerRetryDelayMs(int64_t ms) {
+    sTimerRetryDelayMs.store(ms > 0 ? ms : kTimerRetryDelayMs, std::memory_order_relaxed);
 }
 
 int32_t KelvoOperator::handleTimerRearm(int32_t id) {

@@ -2,6 +2,7 @@
 
 #include <stdint.h>
 
+#include <atomic>
 #include <functional>
 #include <memory>
 #include <utility>
@@ -134,6 +135,8 @@ public:
     int32_t handleParcelMessage(const ParcelMessage& msg) override;
 
     static constexpr int64_t kTimerRetryDelayMs = 10000;
+    // Shortens the delay of that retry (tests); 0 or less restores it.
+    static void setTimerRetryDelayMs(int64_t ms);
 
 protected:
     // Re-arms one of this operator's timers (TimerManager::rearmTimer); when
@@ -164,6 +167,8 @@ private:
     android::sp<LogReceiver> mLogReceiver;
     // Sender names and entry types registered with the buffered log server.
     std::vector<std::pair<android::String8, int32_t>> mBufferedLogKeys;
+
+    static std::atomic<int64_t> sTimerRetryDelayMs;
 };
 
 } // namespace kelvo

@@ -34,6 +34,7 @@ enum class Health : uint32_t {
     CpuReportsLate,          // CPU passes run without their per-process report
     CpuEntriesCapped,        // processes or uids not followed: their maps were full
     CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
+    RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
     Count
 };
 

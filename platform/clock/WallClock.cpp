@@ -11,6 +11,8 @@ namespace {
 
 std::atomic<int64_t> gOffsetMs{0};
 std::atomic<bool> gLoaded{false};
+// Negative while the clock runs.
+std::atomic<int64_t> gFixedMs{-1};
 
 int64_t parseOffset() {
     const char* text = getenv("KELVO_CLOCK_OFFSET_MS");
@@ -33,10 +35,20 @@ void WallClock::reloadOffset() {
     gLoaded.store(true, std::memory_order_release);
 }
 
+void WallClock::setFixedTimeMs(int64_t ms) {
+    gFixedMs.store(ms < 0 ? -1 : ms, std::memory_order_release);
+}
+
 int WallClock::getTime(struct timespec* ts) {
     if (ts == nullptr) {
         errno = EINVAL;
         return -1;
+    }
+    int64_t fixed = gFixedMs.load(std::memory_order_acquire);
+    if (fixed >= 0) {
+        ts->tv_sec = static_cast<time_t>(fixed / 1000);
+        ts->tv_nsec = static_cast<long>((fixed % 1000) * 1000000);
+        return 0;
     }
     if (!gLoaded.load(std::memory_order_acquire)) {
         reloadOffset();

@@ -112,7 +112,7 @@ TEST(DeviceModelTest, CountersAndTruthFollowTheLoad) {
     EXPECT_NE(std::string::npos,
               readFile(std::string(dir) + "/" + CpuTree::timeInStatePath(0)).find("576000 100\n"));
     EXPECT_NE(std::string::npos,
-              readFile(std::string(dir) + "/" + CpuTree::timeInStatePath(4)).find("1996800 100\n"));
+              readFile(std::string(dir) + "/" + CpuTree::timeInStatePath(4)).find("2457600 100\n"));
     std::string rm = std::string("rm -rf ") + dir;
     ASSERT_EQ(0, system(rm.c_str()));
 }

@@ -1,5 +1,7 @@
 #include "Scenario.h"
 
+#include "CpuTree.h"
+
 #include <errno.h>
 #include <stdlib.h>
 
@@ -105,15 +107,13 @@ std::vector<std::string> splitList(const std::string& text) {
 }  // namespace
 
 const std::vector<int32_t>& Scenario::clusterFrequencies(int32_t cluster) {
-    static const std::vector<int32_t> kLittle = {300000,  576000,  768000,  1017600,
-                                                 1248000, 1324800, 1516800, 1612800};
-    static const std::vector<int32_t> kBig = {300000,  652800,  825600,  979200, 1132800,
-                                              1363200, 1536000, 1747200, 1996800};
-    return cluster == 0 ? kLittle : kBig;
+    static const std::vector<CpuTree::Cluster> kClusters = CpuTree::phoneClusters();
+    return kClusters[cluster == 0 ? 0 : 1].frequencies;
 }
 
 int32_t Scenario::clusterCores(int32_t cluster) {
-    return 4;
+    static const std::vector<CpuTree::Cluster> kClusters = CpuTree::phoneClusters();
+    return static_cast<int32_t>(kClusters[cluster == 0 ? 0 : 1].cores.size());
 }
 
 const Scenario::App* Scenario::findApp(int32_t uid) const {

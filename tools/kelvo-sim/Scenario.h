@@ -72,7 +72,8 @@ public:
     const App* findApp(int32_t uid) const;
     const Process* findProcess(int32_t pid) const;
 
-    // Cluster layout of the simulated phone: cores and frequency steps (kHz).
+    // Cluster layout of the simulated phone (CpuTree::phoneClusters): cores
+    // and frequency steps (kHz).
     static constexpr int32_t kClusterCount = 2;
     static const std::vector<int32_t>& clusterFrequencies(int32_t cluster);
     static int32_t clusterCores(int32_t cluster);

@@ -1,5 +1,6 @@
 #pragma once
 
+#include <stdint.h>
 #include <time.h>
 
 namespace kelvo {
@@ -13,6 +14,9 @@ public:
     static int getTime(struct timespec* ts);
     // Re-reads KELVO_CLOCK_OFFSET_MS (tests).
     static void reloadOffset();
+    // Stops the clock at ms (the offset is not added); a negative value
+    // lets it run again (tests).
+    static void setFixedTimeMs(int64_t ms);
 };
 
 } // namespace kelvo
