@@ -446,6 +446,10 @@ int DeviceSimulator::finish(bool completed) {
         for (const auto& seen : mLastSeenMs) {
             truth[seen.first] = seen.second - mBaselineMs[seen.first];
         }
+        // Without a report the daemon could account nothing: every truth is 0.
+        for (const auto& name : mModel.nameUids()) {
+            truth.emplace(name.first, 0);
+        }
     }
     SimReport report(header, truth, mModel.nameUids());
     std::string text;

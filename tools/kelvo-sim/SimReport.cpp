@@ -199,6 +199,10 @@ bool SimReport::build(std::string* text) {
         "records written, %d of them not read\n\n",
         mHeader.daemonStatus, mHeader.reportsAnswered, mHeader.logRecordsWritten,
         mHeader.logRecordsUnread);
+    if (mHeader.reportsAnswered == 0) {
+        out += "No per-process report was asked for: the daemon ran no CPU pass with its\n"
+               "processes, so nothing it attributed can be compared with the scenario.\n\n";
+    }
     std::string error;
     if (!readDatabase(&error)) {
         out += "The database could not be read: " + error + "\n";
