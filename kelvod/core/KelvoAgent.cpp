@@ -14,6 +14,7 @@
 #include "core/AppsAccounting.h"
 #include "handlers/components/CpuHandler.h"
 #include "routines/HourlyRoutine.h"
+#include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/KelvoUtils.h"
 #include "utils/TimeProvider.h"
@@ -37,10 +38,15 @@ android::sp<KelvoOperator> makeHourlyRoutine() {
     return new HourlyRoutine();
 }
 
+android::sp<KelvoOperator> makePollingRoutine() {
+    return new PollingRoutine();
+}
+
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
         handlers[HANDLER_CPU] = &makeCpuHandler;
+        routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;
     }
 

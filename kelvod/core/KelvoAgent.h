@@ -79,7 +79,8 @@ public:
     android::sp<KelvoOperator> getRoutine(int32_t id);
 
     // Replaces what start-up creates for a slot (tests and the simulator);
-    // a null factory leaves the slot empty.
+    // a null factory leaves the slot empty. By default start-up creates the
+    // polling routine only.
     static void setHandlerFactory(int32_t id, OperatorFactory factory);
     static void setRoutineFactory(int32_t id, OperatorFactory factory);
     static void setExitHook(ExitHook hook);

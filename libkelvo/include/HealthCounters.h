@@ -35,6 +35,7 @@ enum class Health : uint32_t {
     CpuEntriesCapped,        // processes or uids not followed: their maps were full
     CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
     RoutineRequestsRefused,  // hourly-round requests refused (bad parcel, elector, candidate, round)
+    SettingsRefused,         // property values refused (not a number, out of range): default used
     Count
 };
 

@@ -18,7 +18,7 @@ const char* const kHealthNames[] = {
         "buffered_client_refused",   "device_answers_refused",  "accounter_events_dropped",
         "timer_rearm_retries",       "values_saturated",        "cpu_reports_refused",
         "cpu_reports_late",          "cpu_entries_capped",      "cpu_counter_lines_ignored",
-        "routine_requests_refused",
+        "routine_requests_refused",  "settings_refused",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

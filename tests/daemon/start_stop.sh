@@ -19,7 +19,7 @@ fi
 sleep 0.3
 names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
 echo "threads: $names"
-for expected in kelvod KelvoStorage BufferedLogServ; do
+for expected in kelvod KelvoStorage BufferedLogServ PollingRoutine; do
     case " $names " in *" $expected "*) ;; *) echo "FAIL: no thread $expected"; kill -9 $pid; exit 1;; esac
 done
 # The buffered log socket lies below the root.

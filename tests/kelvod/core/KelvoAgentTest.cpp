@@ -120,6 +120,9 @@ protected:
             std::lock_guard<std::mutex> guard(gEventsLock);
             gEvents.clear();
         }
+        // Only the operators a test installs (start-up has defaults).
+        for (int i = 0; i < kelvo::HANDLER_COUNT; ++i) KelvoAgent::setHandlerFactory(i, nullptr);
+        for (int i = 0; i < kelvo::ROUTINE_COUNT; ++i) KelvoAgent::setRoutineFactory(i, nullptr);
         mRoot.reset(new kelvo::test::TempRoot());
         gExitStatus = -1;
         KelvoAgent::setExitHook(recordExit);
@@ -252,6 +255,7 @@ void runProcessWideAgent() {
     // A hang (a thread stuck on its own lock) ends the process with a signal.
     alarm(60);
     kelvo::test::TempRoot root;
+    KelvoAgent::setRoutineFactory(kelvo::ROUTINE_POLLING, nullptr);
     KelvoAgent::setHandlerFactory(0, makeHandler<0>);
     KelvoAgent::setHandlerFactory(2, makeHandler<2>);
     KelvoAgent::setRoutineFactory(kelvo::ROUTINE_HOURLY, makeRoutine<1>);

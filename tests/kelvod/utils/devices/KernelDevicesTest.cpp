@@ -25,11 +25,6 @@ using Device = FakeKernelDriver::Device;
 
 namespace {
 
-std::vector<uint8_t> bytesOf(const void* data, size_t size) {
-    const uint8_t* p = static_cast<const uint8_t*>(data);
-    return std::vector<uint8_t>(p, p + size);
-}
-
 // Records "name:magic:data" of every buffered-log entry it gets.
 class EntryRecorder : public HandlerThread {
 public:
