@@ -52,13 +52,13 @@ others=$(q "SELECT COUNT(*) FROM raw_applications_cpu WHERE name NOT IN
              'system_server', 'kernel_kworker')")
 [ "$others" = 0 ] || fail "$others rows for names the scenario never ran"
 
-# The applications share the component's energy: each record rounds by at
-# most 1.
-read -r appEnergy appRows <<<"$(q "SELECT SUM(foreground_energy + background_energy +
-    charge_foreground_energy + charge_background_energy), COUNT(*) FROM raw_applications_cpu" |
-    tr '|' ' ')"
-componentEnergy=$(q "SELECT SUM(foreground_energy + background_energy + charge_foreground_energy
-                     + charge_background_energy) FROM raw_component_cpu")
+# In every pass the applications share the component's energy, each record
+# rounding by at most 1 (a pass without application time keeps its idle
+# energy to the component).
+sums="SUM(foreground_energy + background_energy + charge_foreground_energy + charge_background_energy)"
+read -r appEnergy appRows <<<"$(q "SELECT $sums, COUNT(*) FROM raw_applications_cpu" | tr '|' ' ')"
+componentEnergy=$(q "SELECT $sums FROM raw_component_cpu
+                     WHERE end_time IN (SELECT end_time FROM raw_applications_cpu)")
 [ "${componentEnergy:-0}" -gt 0 ] || fail "no component energy"
 diff=$(( appEnergy - componentEnergy ))
 (( diff <= appRows && -diff <= appRows )) ||

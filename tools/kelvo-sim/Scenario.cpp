@@ -1,7 +1,5 @@
 #include "Scenario.h"
 
-#include "CpuTree.h"
-
 #include <errno.h>
 #include <stdlib.h>
 
@@ -9,6 +7,8 @@
 #include <fstream>
 #include <set>
 #include <sstream>
+
+#include "CpuTree.h"
 
 namespace kelvo {
 namespace sim {

@@ -200,8 +200,9 @@ bool SimReport::build(std::string* text) {
         mHeader.daemonStatus, mHeader.reportsAnswered, mHeader.logRecordsWritten,
         mHeader.logRecordsUnread);
     if (mHeader.reportsAnswered == 0) {
-        out += "No per-process report was asked for: the daemon ran no CPU pass with its\n"
-               "processes, so nothing it attributed can be compared with the scenario.\n\n";
+        out +=
+            "No per-process report was asked for: the daemon ran no CPU pass with its\n"
+            "processes, so nothing it attributed can be compared with the scenario.\n\n";
     }
     std::string error;
     if (!readDatabase(&error)) {
