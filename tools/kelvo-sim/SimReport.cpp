@@ -104,45 +104,53 @@ bool SimReport::readDatabase(std::string* error) {
             out->energy[i] = sqlite3_column_int64(stmt, first + 2 * i + 1);
         }
     };
-    bool ok = query(
-                  db, "SELECT name, MIN(uid)" + sums + " FROM raw_applications_cpu GROUP BY name",
-                  [&](sqlite3_stmt* stmt) {
-                      const unsigned char* name = sqlite3_column_text(stmt, 0);
-                      Sums& app = mApps[name != nullptr ? reinterpret_cast<const char*>(name) : ""];
-                      app.uid = sqlite3_column_int(stmt, 1);
-                      app.stored = true;
-                      readSums(stmt, 2, &app);
-                  },
-                  error) &&
-              query(
-                  db,
-                  "SELECT name, SUM(foreground_time + background_time), "
-                  "SUM(foreground_energy + background_energy) FROM hourly_applications_cpu "
-                  "GROUP BY name",
-                  [&](sqlite3_stmt* stmt) {
-                      const unsigned char* name = sqlite3_column_text(stmt, 0);
-                      Sums& app = mApps[name != nullptr ? reinterpret_cast<const char*>(name) : ""];
-                      app.hourlyTime = sqlite3_column_int64(stmt, 1);
-                      app.hourlyEnergy = sqlite3_column_int64(stmt, 2);
-                  },
-                  error) &&
-              query(
-                  db, "SELECT COUNT(*)" + sums + " FROM raw_component_cpu",
-                  [&](sqlite3_stmt* stmt) {
-                      mComponentRows = sqlite3_column_int64(stmt, 0);
-                      readSums(stmt, 1, &mComponent);
-                  },
-                  error) &&
-              query(
-                  db,
-                  "SELECT COUNT(*), SUM(foreground_time + background_time), "
-                  "SUM(foreground_energy + background_energy) FROM hourly_component_cpu",
-                  [&](sqlite3_stmt* stmt) {
-                      mHourlyComponentRows = sqlite3_column_int64(stmt, 0);
-                      mHourlyComponentTime = sqlite3_column_int64(stmt, 1);
-                      mHourlyComponentEnergy = sqlite3_column_int64(stmt, 2);
-                  },
-                  error);
+    bool ok =
+        query(
+            db, "SELECT name, MIN(uid)" + sums + " FROM raw_applications_cpu GROUP BY name",
+            [&](sqlite3_stmt* stmt) {
+                const unsigned char* name = sqlite3_column_text(stmt, 0);
+                Sums& app = mApps[name != nullptr ? reinterpret_cast<const char*>(name) : ""];
+                app.uid = sqlite3_column_int(stmt, 1);
+                app.stored = true;
+                readSums(stmt, 2, &app);
+            },
+            error) &&
+        query(
+            db,
+            "SELECT name, SUM(foreground_time + background_time), "
+            "SUM(foreground_energy + background_energy) FROM hourly_applications_cpu "
+            "GROUP BY name",
+            [&](sqlite3_stmt* stmt) {
+                const unsigned char* name = sqlite3_column_text(stmt, 0);
+                Sums& app = mApps[name != nullptr ? reinterpret_cast<const char*>(name) : ""];
+                app.hourlyTime = sqlite3_column_int64(stmt, 1);
+                app.hourlyEnergy = sqlite3_column_int64(stmt, 2);
+            },
+            error) &&
+        query(
+            db, "SELECT COUNT(*)" + sums + " FROM raw_component_cpu",
+            [&](sqlite3_stmt* stmt) {
+                mComponentRows = sqlite3_column_int64(stmt, 0);
+                readSums(stmt, 1, &mComponent);
+            },
+            error) &&
+        query(
+            db,
+            "SELECT SUM(foreground_energy + background_energy + charge_foreground_energy + "
+            "charge_background_energy) FROM raw_component_cpu WHERE end_time IN "
+            "(SELECT end_time FROM raw_applications_cpu)",
+            [&](sqlite3_stmt* stmt) { mComponentSharedEnergy = sqlite3_column_int64(stmt, 0); },
+            error) &&
+        query(
+            db,
+            "SELECT COUNT(*), SUM(foreground_time + background_time), "
+            "SUM(foreground_energy + background_energy) FROM hourly_component_cpu",
+            [&](sqlite3_stmt* stmt) {
+                mHourlyComponentRows = sqlite3_column_int64(stmt, 0);
+                mHourlyComponentTime = sqlite3_column_int64(stmt, 1);
+                mHourlyComponentEnergy = sqlite3_column_int64(stmt, 2);
+            },
+            error);
     sqlite3_close(db);
     return ok;
 }
@@ -244,10 +252,11 @@ bool SimReport::build(std::string* text) {
     out += format("%-44s %6s %8" PRId64 " %10" PRId64 " %6" PRId64 " %10" PRId64 "\n",
                   "sum over applications", "", truthSum, timeSum, timeSum - truthSum, energySum);
     out += format("\nCPU component (raw_component_cpu, %" PRId64 " rows): %" PRId64
-                  " ms of core time, energy %" PRId64 " (applications: %" PRId64
-                  ", difference %" PRId64 ")\n",
-                  mComponentRows, mComponent.total(), mComponent.totalEnergy(), energySum,
-                  energySum - mComponent.totalEnergy());
+                  " ms of core time, energy %" PRId64
+                  "\n  in the passes with application time: %" PRId64
+                  " (sum over applications: %" PRId64 ", difference %" PRId64 ")\n",
+                  mComponentRows, mComponent.total(), mComponent.totalEnergy(),
+                  mComponentSharedEnergy, energySum, energySum - mComponentSharedEnergy);
     out += format("  foreground %" PRId64 " ms/%" PRId64 ", background %" PRId64 " ms/%" PRId64
                   ", screen on %" PRId64 " ms/%" PRId64 ", screen off %" PRId64 " ms/%" PRId64
                   ", charging %" PRId64 " ms/%" PRId64 "\n",

@@ -63,6 +63,9 @@ private:
     std::map<std::string, Sums> mApps;
     Sums mComponent;
     int64_t mComponentRows = 0;
+    // Energy of the passes that gave application time (the rest is idle
+    // energy no application shares).
+    int64_t mComponentSharedEnergy = 0;
     int64_t mHourlyComponentTime = 0;
     int64_t mHourlyComponentEnergy = 0;
     int64_t mHourlyComponentRows = 0;
