@@ -463,6 +463,9 @@ int DeviceSimulator::finish(bool completed) {
     }
     if (mOptions.idleFigures) {
         if (switchesAtEnd >= 0 && endMono > mSwitchesAtStartMs) {
+            fprintf(stderr,
+                    "kelvo-sim: %" PRId64 " context switches of the daemon in %" PRId64 " ms\n",
+                    switchesAtEnd - mSwitchesAtStart, endMono - mSwitchesAtStartMs);
             printf("daemon_idle_rss_kb %" PRId64 "\n", mRssKb);
             printf("daemon_idle_wakeups_per_min %.1f\n",
                    static_cast<double>(switchesAtEnd - mSwitchesAtStart) * 60000.0 /
