@@ -315,8 +315,7 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
     }
     ++mLogWritten;
     if (result != 0) {
-        // Nothing in the daemon reads the log device yet (no operator has
-        // registered a tag), or its queue stayed full.
+        // No reader on the device, or its queue stayed full.
         ++mLogUnread;
     }
 }

@@ -204,7 +204,7 @@ bool SimReport::build(std::string* text) {
                   localTime(mHeader.endMs).c_str(), mHeader.timeZone.c_str());
     out += format(
         "  daemon exit status %d; %d per-process reports answered; %d log-device "
-        "records written, %d of them not read\n\n",
+        "records written, %d refused by the device\n\n",
         mHeader.daemonStatus, mHeader.reportsAnswered, mHeader.logRecordsWritten,
         mHeader.logRecordsUnread);
     if (mHeader.reportsAnswered == 0) {
@@ -227,12 +227,15 @@ bool SimReport::build(std::string* text) {
         "last per-process report; attributed = raw_applications_cpu (all buckets); hourly =\n"
         "hourly_applications_cpu (foreground + background). Times in ms, energy in the\n"
         "power profile's unit x ms / 1000.\n";
-    out += format("%-44s %6s %8s %10s %6s %10s %9s %9s %9s %9s %9s %10s\n", "application", "uid",
-                  "truth", "attributed", "diff", "energy", "fg ms", "bg ms", "scr-on ms",
-                  "scr-off ms", "hourly ms", "hourly en.");
+    out += format("%-30s %6s %7s %10s %5s %7s %13s %13s %13s %13s %13s\n", "application", "uid",
+                  "truth", "attributed", "diff", "energy", "fg ms/en", "bg ms/en", "scr-on ms/en",
+                  "scr-off ms/en", "hourly ms/en");
     int64_t truthSum = 0;
     int64_t timeSum = 0;
     int64_t energySum = 0;
+    auto pair = [](int64_t time, int64_t energy) {
+        return std::to_string(time) + "/" + std::to_string(energy);
+    };
     for (const auto& entry : mApps) {
         const Sums& app = entry.second;
         auto truth = mTruth.find(entry.first);
@@ -243,13 +246,17 @@ bool SimReport::build(std::string* text) {
         }
         timeSum += app.total();
         energySum += app.totalEnergy();
-        out += format("%-44s %6d %8s %10" PRId64 " %6s %10" PRId64 " %9" PRId64 " %9" PRId64
-                      " %9" PRId64 " %9" PRId64 " %9" PRId64 " %10" PRId64 "\n",
+        // Charging time counts with foreground and background only.
+        out += format("%-30s %6d %7s %10" PRId64 " %5s %7" PRId64 " %13s %13s %13s %13s %13s\n",
                       entry.first.c_str(), app.uid, truthText.c_str(), app.total(), diff.c_str(),
-                      app.totalEnergy(), app.time[0] + app.time[4], app.time[1] + app.time[5],
-                      app.time[2], app.time[3], app.hourlyTime, app.hourlyEnergy);
+                      app.totalEnergy(),
+                      pair(app.time[0] + app.time[4], app.energy[0] + app.energy[4]).c_str(),
+                      pair(app.time[1] + app.time[5], app.energy[1] + app.energy[5]).c_str(),
+                      pair(app.time[2], app.energy[2]).c_str(),
+                      pair(app.time[3], app.energy[3]).c_str(),
+                      pair(app.hourlyTime, app.hourlyEnergy).c_str());
     }
-    out += format("%-44s %6s %8" PRId64 " %10" PRId64 " %6" PRId64 " %10" PRId64 "\n",
+    out += format("%-30s %6s %7" PRId64 " %10" PRId64 " %5" PRId64 " %7" PRId64 "\n",
                   "sum over applications", "", truthSum, timeSum, timeSum - truthSum, energySum);
     out += format("\nCPU component (raw_component_cpu, %" PRId64 " rows): %" PRId64
                   " ms of core time, energy %" PRId64
