@@ -226,9 +226,9 @@ bool DeviceSimulator::startDaemon(std::string* error) {
 }
 
 bool DeviceSimulator::waitDaemonReady(std::string* error) {
-    // Ready once the buffered log socket is there and a client can name
-    // itself (the CPU handler's receiver is registered before the socket is
-    // served to anyone who matters).
+    // Ready once the buffered log socket is there and the daemon's battery
+    // listener has registered: the routines and handlers are initialised
+    // right after that step of the start-up, in a moment.
     std::string socket = RootPath::resolve("/dev/socket/") + BufferedLogClient::kSocketName;
     int64_t deadline = monotonicMs() + kReadyTimeoutMs;
     while (monotonicMs() < deadline) {
@@ -241,8 +241,9 @@ bool DeviceSimulator::waitDaemonReady(std::string* error) {
             return false;
         }
         struct stat st;
-        if (stat(socket.c_str(), &st) == 0 && S_ISSOCK(st.st_mode)) {
-            // The daemon logs the library start last but one; give it a moment.
+        android::sp<FakeBatteryRegistrar> registrar = mServices->batteryRegistrar();
+        if (stat(socket.c_str(), &st) == 0 && S_ISSOCK(st.st_mode) && registrar != nullptr &&
+            registrar->listenerCount() > 0) {
             sleepMs(300);
             return true;
         }
