@@ -76,43 +76,61 @@ const column_attribute kRawIdleColumns[] = {
     {COLUMN_LONG, "idle_time"},
 };
 
-#define KELVO_CPU_PAIRS                                                      \
-    {COLUMN_INT, "foreground_time"}, {COLUMN_LONG, "foreground_energy"},     \
-        {COLUMN_INT, "background_time"}, {COLUMN_LONG, "background_energy"}, \
-        {COLUMN_INT, "screen_on_time"}, {COLUMN_LONG, "screen_on_energy"},   \
-        {COLUMN_INT, "screen_off_time"}, {                                   \
-        COLUMN_LONG, "screen_off_energy"                                     \
-    }
-#define KELVO_CPU_CHARGE_PAIRS                                                         \
-    {COLUMN_INT, "charge_foreground_time"}, {COLUMN_LONG, "charge_foreground_energy"}, \
-        {COLUMN_INT, "charge_background_time"}, {                                      \
-        COLUMN_LONG, "charge_background_energy"                                        \
-    }
-
+// Times as int, energies as long, in the pairs' order.
 const column_attribute kRawComponentColumns[] = {
     {COLUMN_TIME, "start_time"},
     {COLUMN_TIME, "end_time"},
-    KELVO_CPU_PAIRS,
-    KELVO_CPU_CHARGE_PAIRS,
+    {COLUMN_INT, "foreground_time"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_time"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_time"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_time"},
+    {COLUMN_LONG, "screen_off_energy"},
+    {COLUMN_INT, "charge_foreground_time"},
+    {COLUMN_LONG, "charge_foreground_energy"},
+    {COLUMN_INT, "charge_background_time"},
+    {COLUMN_LONG, "charge_background_energy"},
 };
 const column_attribute kHourlyComponentColumns[] = {
-    {COLUMN_TIME, "timestamp"},
-    KELVO_CPU_PAIRS,
+    {COLUMN_TIME, "timestamp"},         {COLUMN_INT, "foreground_time"},
+    {COLUMN_LONG, "foreground_energy"}, {COLUMN_INT, "background_time"},
+    {COLUMN_LONG, "background_energy"}, {COLUMN_INT, "screen_on_time"},
+    {COLUMN_LONG, "screen_on_energy"},  {COLUMN_INT, "screen_off_time"},
+    {COLUMN_LONG, "screen_off_energy"},
 };
 const column_attribute kRawApplicationsColumns[] = {
-    {COLUMN_INT, "uid"},       {COLUMN_TIME, "start_time"},
-    {COLUMN_TIME, "end_time"}, {COLUMN_TEXT, "name"},
-    KELVO_CPU_PAIRS,           KELVO_CPU_CHARGE_PAIRS,
+    {COLUMN_INT, "uid"},
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "foreground_time"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_time"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_time"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_time"},
+    {COLUMN_LONG, "screen_off_energy"},
+    {COLUMN_INT, "charge_foreground_time"},
+    {COLUMN_LONG, "charge_foreground_energy"},
+    {COLUMN_INT, "charge_background_time"},
+    {COLUMN_LONG, "charge_background_energy"},
 };
 const column_attribute kHourlyApplicationsColumns[] = {
     {COLUMN_INT, "uid"},
     {COLUMN_TIME, "timestamp"},
     {COLUMN_TEXT, "name"},
-    KELVO_CPU_PAIRS,
+    {COLUMN_INT, "foreground_time"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_time"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_time"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_time"},
+    {COLUMN_LONG, "screen_off_energy"},
 };
-
-#undef KELVO_CPU_PAIRS
-#undef KELVO_CPU_CHARGE_PAIRS
 
 template <size_t N>
 constexpr int32_t columnCount(const column_attribute (&)[N]) {
