@@ -3,6 +3,7 @@
 #include <stdint.h>
 
 #include <mutex>
+#include <string>
 #include <vector>
 
 #include "common/TestEnv.h"
@@ -58,6 +59,31 @@ private:
     static constexpr int32_t kMarker = -1;
     std::mutex mLock;
     std::vector<Got> mGot;
+};
+
+// Records every buffered-log entry delivered to it as "name:magic:data".
+class EntryRecorder : public HandlerThread {
+public:
+    EntryRecorder() : HandlerThread("EntryRecorder", 11) {}
+    int32_t handleParcelMessage(const ParcelMessage& msg) override {
+        const android::Parcel& p = msg.getParcel();
+        p.readInt64();
+        std::string entry = std::string(p.readString8().string()) + ":";
+        entry += std::to_string(p.readInt32()) + ":";
+        std::string data(static_cast<size_t>(p.readInt32()), '\0');
+        p.read(&data[0], data.size());
+        std::lock_guard<std::mutex> guard(mLock);
+        mGot.push_back(entry + data);
+        return 0;
+    }
+    std::vector<std::string> got() {
+        std::lock_guard<std::mutex> guard(mLock);
+        return mGot;
+    }
+
+private:
+    std::mutex mLock;
+    std::vector<std::string> mGot;
 };
 
 } // namespace test

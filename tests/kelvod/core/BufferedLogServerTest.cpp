@@ -12,6 +12,7 @@
 #include <vector>
 
 #include "HealthCounters.h"
+#include "common/RecordingHandler.h"
 #include "common/TestEnv.h"
 #include "core/BufferedLogServer.h"
 #include "kelvo/BufferedLogClient.h"
@@ -22,6 +23,7 @@ using kelvo::BufferedLogClient;
 using kelvo::BufferedLogServer;
 using kelvo::Health;
 using kelvo::HealthCounters;
+using kelvo::test::EntryRecorder;
 using kelvo::test::LogCapture;
 using kelvo::test::waitFor;
 
@@ -29,31 +31,6 @@ namespace {
 
 // Shortened stand-in of the server's read and write time-out.
 constexpr int kIoTimeoutMs = 300;
-
-// Records every entry delivered to it: "name:magic:data".
-class EntryRecorder : public kelvo::HandlerThread {
-public:
-    EntryRecorder() : HandlerThread("EntryRecorder", 11) {}
-    int32_t handleParcelMessage(const kelvo::ParcelMessage& msg) override {
-        const android::Parcel& p = msg.getParcel();
-        p.readInt64();
-        std::string name = p.readString8().string();
-        int32_t magic = p.readInt32();
-        std::string data(static_cast<size_t>(p.readInt32()), '\0');
-        p.read(&data[0], data.size());
-        std::lock_guard<std::mutex> guard(mLock);
-        mGot.push_back(name + ":" + std::to_string(magic) + ":" + data);
-        return 0;
-    }
-    std::vector<std::string> got() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mGot;
-    }
-
-private:
-    std::mutex mLock;
-    std::vector<std::string> mGot;
-};
 
 class BufferedLogServerTest : public ::testing::Test {
 protected:

@@ -1,13 +1,7 @@
 #include <gtest/gtest.h>
-#include <stdlib.h>
-#include <time.h>
 #include <unistd.h>
 
-#include <atomic>
 #include <functional>
-#include <mutex>
-#include <string>
-#include <vector>
 
 #include "HealthCounters.h"
 #include "core/KelvoAgent.h"
@@ -26,51 +20,9 @@ namespace {
 
 constexpr int64_t kFar = 1800000;
 
-int64_t now() {
-    return TimeProvider::getCurrentTime(TIME_TYPE_WALL);
+int64_t timeLeft(const sp<PollingRoutine>& routine) {
+    return TimerManager::getInstance()->getExpireTime(routine->getTimer());
 }
-
-// Answers the polling routine's offset request with chosen values or an error.
-class HourlyStandIn : public KelvoOperator {
-public:
-    HourlyStandIn() : KelvoOperator("HourlyStandIn", -1, 0) {}
-    int32_t handleCustomized(int32_t code, const Parcel&, Parcel* reply) override {
-        if (result < 0) return result;
-        reply->writeInt64(lastTick);
-        reply->writeInt64(left);
-        return 0;
-    }
-    std::atomic<int32_t> result{0};
-    std::atomic<int64_t> lastTick{0};
-    std::atomic<int64_t> left{kFar};
-};
-
-// Reads every data-polling notification back with the shared reader.
-class PollListener : public KelvoOperator {
-public:
-    PollListener() : KelvoOperator("PollListener", -1, 0) {}
-    void setupListeners(Parcel& out) override {
-        addNotifierListener(NOTIFICATION_DATA_POLLING, out);
-    }
-    int32_t onDataPolling(const Parcel& data) override {
-        PollingPayload p;
-        p.reason = PollingPayload::readFrom(data, &p) == 0 ? p.reason : -1;
-        std::lock_guard<std::mutex> guard(mLock);
-        mGot.push_back(p);
-        return 0;
-    }
-    std::vector<PollingPayload> got() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mGot;
-    }
-    bool waitFor(size_t n) {
-        return test::waitFor([&] { return got().size() >= n; });
-    }
-
-private:
-    std::mutex mLock;
-    std::vector<PollingPayload> mGot;
-};
 
 void retire(const sp<KelvoOperator>& op) {
     op->readyToDestroy();
@@ -78,24 +30,50 @@ void retire(const sp<KelvoOperator>& op) {
     op->join();
 }
 
+// Stands in for the hourly routine (the offset request answers the values
+// set, or fails with result) and reads every poll back with the shared
+// reader, as "reason:time:hour:new time:online".
+class HourlyStandIn : public KelvoOperator {
+public:
+    HourlyStandIn() : KelvoOperator("HourlyStandIn", -1, 0) {}
+    void setupListeners(Parcel& out) override {
+        addNotifierListener(NOTIFICATION_DATA_POLLING, out);
+    }
+    int32_t handleCustomized(int32_t, const Parcel&, Parcel* reply) override {
+        reply->writeInt64(lastTick);
+        reply->writeInt64(left);
+        return static_cast<int32_t>(result);
+    }
+    int32_t onDataPolling(const Parcel& data) override {
+        PollingPayload p;
+        std::string s = PollingPayload::readFrom(data, &p) < 0 ? "unreadable:" : "";
+        for (int64_t v : {int64_t(p.reason), p.time, p.hour, p.newTime})
+            s += std::to_string(v) + ":";
+        std::lock_guard<std::mutex> guard(lock);
+        polls.push_back(s + std::to_string(p.online));
+        return 0;
+    }
+    std::atomic<int64_t> result{0}, lastTick{0}, left{kFar};
+    std::mutex lock;
+    std::vector<std::string> polls;
+};
+
 class PollingRoutineTest : public test::AgentStorageTest {
 protected:
     void addTables() override {
         setenv("TZ", "UTC", 1);
         tzset();
-        mRoutine = new PollingRoutine();
         mRoutine->addSchemaTable();
     }
     void SetUp() override {
         AgentStorageTest::SetUp();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mHourly);
-        mListener->initialize();
+        mHourly->initialize();
         mRoutine->initialize();
     }
     void TearDown() override {
         TimerManager::getInstance()->removeTimer(mRoutine->getTimer());
         retire(mRoutine);
-        retire(mListener);
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
         retire(mHourly);
         AgentStorageTest::TearDown();
@@ -106,45 +84,38 @@ protected:
         if (extra) extra(body);
         Notifier::getInstance()->sendNotification(type, body);
     }
-    void expire() {
-        mRoutine->sendMessage(ParcelMessage(MESSAGE_TIMER, PollingRoutine::kPollingTimerId));
+    std::vector<std::string> polls() {
+        std::lock_guard<std::mutex> guard(mHourly->lock);
+        return mHourly->polls;
     }
-    // The reasons polled after the first n, once a shut-down poll closed them.
-    std::vector<int32_t> reasonsAfter(size_t n) {
-        notify(NOTIFICATION_SHUT_DOWN, now());
-        std::vector<int32_t> out;
-        if (!test::waitFor([&] {
-                std::vector<PollingPayload> got = mListener->got();
-                return got.size() > n && got.back().reason == POLLING_SHUT_DOWN;
-            })) {
-            return out;
-        }
-        for (const PollingPayload& p : mListener->got()) out.push_back(p.reason);
-        return std::vector<int32_t>(out.begin() + n, out.end() - 1);
+    // The reasons polled after the first n ("41"), closed by a shut-down poll.
+    std::string reasonsAfter(size_t n) {
+        notify(NOTIFICATION_SHUT_DOWN, 0);
+        EXPECT_TRUE(test::waitFor([&] { return polls().size() > n && polls().back()[0] == '7'; }));
+        std::string out;
+        for (size_t i = n; i + 1 < polls().size(); ++i) out += polls()[i][0];
+        return out;
     }
 
-    sp<PollingRoutine> mRoutine;
+    const int64_t mNow = TimeProvider::getCurrentTime(TIME_TYPE_WALL);
+    sp<PollingRoutine> mRoutine = new PollingRoutine();
     sp<HourlyStandIn> mHourly = new HourlyStandIn();
-    sp<PollListener> mListener = new PollListener();
+    ParcelMessage mExpiry{MESSAGE_TIMER, PollingRoutine::kPollingTimerId};
 };
 
-} // namespace
+}  // namespace
 
 TEST_F(PollingRoutineTest, SettingsAcceptedOnlyWithinTheirRange) {
     struct Case {
-        const char* period;
-        const char* minInterval;
-        int64_t floor;
-        int64_t expectedPeriod;
-        int64_t expectedMin;
+        const char *period, *minInterval;
+        int64_t floor, expectedPeriod, expectedMin;
         uint64_t refused;
-    };
-    const Case cases[] = {
-            {"30000", "", 0, 600000, 300000, 1},
-            {"60000", "86400000", 0, 60000, 86400000, 0},
-            {"86400001", "9223372036854775808", 0, 600000, 300000, 2},
-            {"60000ms", "-60000", 0, 600000, 300000, 2},
-            {"200", "100", 100, 200, 100, 0},  // a shortened floor: the timer really polls
+    } cases[] = {
+        {"30000", "", 0, 600000, 300000, 1},
+        {"60000", "86400000", 0, 60000, 86400000, 0},
+        {"86400001", "9223372036854775808", 0, 600000, 300000, 2},
+        {"60000ms", "-60000", 0, 600000, 300000, 2},
+        {"200", "100", 100, 200, 100, 0},  // a shortened floor: the timer really polls
     };
     for (const Case& c : cases) {
         HostProperties::setForTest(PollingRoutine::kPeriodProperty, c.period);
@@ -156,111 +127,87 @@ TEST_F(PollingRoutineTest, SettingsAcceptedOnlyWithinTheirRange) {
         EXPECT_EQ(c.expectedPeriod, routine->getPeriodMs()) << c.period;
         EXPECT_EQ(c.expectedMin, routine->getMinIntervalMs()) << c.minInterval;
         EXPECT_EQ(refused + c.refused, HealthCounters::get(Health::SettingsRefused)) << c.period;
-        int64_t left = TimerManager::getInstance()->getExpireTime(routine->getTimer());
-        EXPECT_TRUE(left > c.expectedPeriod - 5000 && left <= c.expectedPeriod) << left;
-        if (c.floor > 0) {
-            EXPECT_TRUE(mListener->waitFor(1));
-            EXPECT_EQ(POLLING_PERIODIC, mListener->got()[0].reason);
-        }
+        EXPECT_GT(timeLeft(routine), c.expectedPeriod - 5000) << c.period;
+        EXPECT_TRUE(c.floor == 0 || test::waitFor([&] { return !polls().empty(); }));
         TimerManager::getInstance()->removeTimer(routine->getTimer());
         retire(routine);
     }
     PollingRoutine::setSettingFloorForTest(0);
+    EXPECT_EQ('0', polls()[0][0]);  // from the 200 ms timer
 }
 
 // Battery-level and timer polls: past the minimum interval only, never near
 // the hourly tick; an offset the hourly routine cannot give never stops them.
 TEST_F(PollingRoutineTest, SuppressionRule) {
     struct Case {
-        const char* name;
-        bool timer;      // a timer expiry (now) instead of a battery change
-        int64_t delta;   // after the previous poll
-        int32_t result;  // of the offset request
-        int64_t tickAgo; // t - last tick
-        int64_t left;    // until the next tick
-        bool polls;
-    };
-    const Case cases[] = {
-            {"interval equal", false, 300000, 0, kFar, kFar, false},
-            {"interval over", false, 300001, 0, kFar, kFar, true},
-            {"30 s before the hour", true, 400000, 0, kFar, 30000, false},
-            {"30 s after the tick", true, 400000, 0, 30000, kFar, false},
-            {"offset request failed", false, 400000, -2, 0, 0, true},
-            {"negative time left", true, 400000, 0, kFar, -4, true},
-            {"clock set back", false, 400000, 0, -3600000, kFar, true},
+        bool timer;  // a timer expiry (now) instead of a battery change
+        int64_t sinceLastPoll, result, sinceTick, left;
+        const char* polled;
+    } cases[] = {
+        {false, 300000, 0, kFar, kFar, "4"},       // the minimum interval
+        {false, 300001, 0, kFar, kFar, "41"},      // just past it
+        {true, 400000, 0, kFar, 30000, "4"},       // 30 s before the hour
+        {true, 400000, 0, 30000, kFar, "4"},       // 30 s after the tick
+        {false, 400000, -2, 0, 0, "41"},           // the offset request failed
+        {true, 400000, 0, kFar, -4, "40"},         // an error code as time left
+        {false, 400000, 0, -3600000, kFar, "41"},  // the clock was set back
     };
     for (const Case& c : cases) {
-        int64_t t = c.timer ? now() : 1700000000000LL;
+        int64_t t = c.timer ? TimeProvider::getCurrentTime(TIME_TYPE_WALL) : 1700000000000LL;
         mHourly->result = c.result;
-        mHourly->lastTick = t - c.tickAgo;
+        mHourly->lastTick = t - c.sinceTick;
         mHourly->left = c.left;
-        size_t before = mListener->got().size();
-        notify(NOTIFICATION_ABNORMALITY_THERMAL, t - c.delta);
-        ASSERT_TRUE(mListener->waitFor(before + 1));
-        if (c.timer) {
-            expire();
-        } else {
-            notify(NOTIFICATION_BATTERY_LEVEL_CHANGED, t);
-        }
-        std::vector<int32_t> expected = {POLLING_THERMAL};
-        if (c.polls) expected.push_back(c.timer ? POLLING_PERIODIC : POLLING_BATTERY_LEVEL);
-        EXPECT_EQ(expected, reasonsAfter(before)) << c.name;
+        size_t before = polls().size();
+        notify(NOTIFICATION_ABNORMALITY_THERMAL, t - c.sinceLastPoll);
+        ASSERT_TRUE(test::waitFor([&] { return polls().size() > before; }));
+        c.timer ? (void)mRoutine->sendMessage(mExpiry)
+                : notify(NOTIFICATION_BATTERY_LEVEL_CHANGED, t);
+        EXPECT_EQ(c.polled, reasonsAfter(before)) << c.sinceLastPoll << " " << c.left;
     }
 }
 
 // Every reason's payload reads back with the shared reader and is recorded;
-// only battery, tick, clock, thermal and balance polls restart the timer.
+// charger and shut-down polls leave the timer running, the others restart it.
 TEST_F(PollingRoutineTest, PayloadsRowsAndTimerRestarts) {
-    const int64_t t = now() + 400000;
+    const std::string t = std::to_string(mNow + 400000);
+    std::function<void(Parcel&)> none;
     struct Case {
         int32_t type;
         std::function<void(Parcel&)> extra;
-        PollingPayload expected;
-        bool restarts;
+        std::string expected;
+    } cases[] = {
+        {NOTIFICATION_BATTERY_LEVEL_CHANGED, [](Parcel& p) { p.writeInt32(50); },
+         "1:" + t + ":0:0:0"},
+        {NOTIFICATION_HOURLY_TICK, [](Parcel& p) { p.writeInt64(5); }, "2:" + t + ":5:0:0"},
+        {NOTIFICATION_CHARGER_ONLINE_CHANGED, [](Parcel& p) { p.writeBool(true); },
+         "6:" + t + ":0:0:1"},
+        {NOTIFICATION_ABNORMALITY_THERMAL, none, "4:" + t + ":0:0:0"},
+        {NOTIFICATION_FORCE_BALANCE, none, "5:" + t + ":0:0:0"},
+        {NOTIFICATION_SHUT_DOWN, none, "7:" + t + ":0:0:0"},
+        {NOTIFICATION_TIME_CHANGED, [](Parcel& p) { p.writeInt64(9); }, "3:1000:0:9:0"},
     };
-    const Case cases[] = {
-            {NOTIFICATION_BATTERY_LEVEL_CHANGED, [](Parcel& p) { p.writeInt32(50); },
-             {POLLING_BATTERY_LEVEL, t}, true},
-            {NOTIFICATION_HOURLY_TICK, [&](Parcel& p) { p.writeInt64(t - 5); },
-             {POLLING_HOURLY_TICK, t + 1, t - 5}, true},
-            {NOTIFICATION_CHARGER_ONLINE_CHANGED, [](Parcel& p) { p.writeBool(true); },
-             {POLLING_CHARGER, t + 1, 0, 0, true}, false},
-            {NOTIFICATION_ABNORMALITY_THERMAL, nullptr, {POLLING_THERMAL, t + 1}, true},
-            {NOTIFICATION_FORCE_BALANCE, nullptr, {POLLING_FORCE_BALANCE, t + 1}, true},
-            {NOTIFICATION_SHUT_DOWN, nullptr, {POLLING_SHUT_DOWN, t + 1}, false},
-            {NOTIFICATION_TIME_CHANGED, [&](Parcel& p) { p.writeInt64(t + 9); },
-             {POLLING_TIME_CHANGED, 1000, 0, t + 9}, true},
-    };
-    std::string expectedRows;
-    for (size_t i = 0; i < sizeof(cases) / sizeof(cases[0]); ++i) {
-        const Case& c = cases[i];
+    std::string expectedRows, stored;
+    for (size_t i = 0; i < 7; ++i) {
+        int64_t time = i == 6 ? 1000 : mNow + 400000;  // a time change carries the old clock
         usleep(200000);
-        int64_t before = TimerManager::getInstance()->getExpireTime(mRoutine->getTimer());
-        notify(c.type, c.expected.time, c.extra);
-        ASSERT_TRUE(mListener->waitFor(i + 1)) << i;
+        int64_t before = timeLeft(mRoutine);
+        notify(cases[i].type, time, cases[i].extra);
+        ASSERT_TRUE(test::waitFor([&] { return polls().size() > i; }));
         mRoutine->sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, -1));  // done with the poll
-        PollingPayload got = mListener->got()[i];
-        EXPECT_EQ(c.expected.reason, got.reason);
-        EXPECT_EQ(c.expected.time, got.time) << i;
-        EXPECT_EQ(c.expected.hour, got.hour) << i;
-        EXPECT_EQ(c.expected.newTime, got.newTime) << i;
-        EXPECT_EQ(c.expected.online, got.online) << i;
-        int64_t after = TimerManager::getInstance()->getExpireTime(mRoutine->getTimer());
-        EXPECT_EQ(c.restarts, after > before) << i << ": " << before << " -> " << after;
-        expectedRows += std::to_string(c.expected.time) + "|" + std::to_string(c.expected.reason);
+        EXPECT_EQ(cases[i].expected, polls()[i]);
+        // Charger and shut-down polls leave the timer running.
+        bool restarts = cases[i].expected[0] != '6' && cases[i].expected[0] != '7';
+        EXPECT_EQ(restarts, timeLeft(mRoutine) > before) << cases[i].expected;
+        expectedRows += std::to_string(time) + "|" + cases[i].expected[0];
     }
     // Measured on the new clock: a periodic poll right after the change waits.
-    expire();
-    EXPECT_EQ(std::vector<int32_t>(), reasonsAfter(sizeof(cases) / sizeof(cases[0])));
+    mRoutine->sendMessage(mExpiry);
+    EXPECT_EQ("", reasonsAfter(7));
     // A timer the manager lost comes back with the next restart.
     TimerManager::getInstance()->removeTimer(mRoutine->getTimer());
-    notify(NOTIFICATION_FORCE_BALANCE, t + 2);
-    ASSERT_TRUE(test::waitFor([&] {
-        return TimerManager::getInstance()->getExpireTime(mRoutine->getTimer()) > 0;
-    }));
-    std::string stored;
-    for (const std::string& r : rows("SELECT timestamp, reason FROM debug_data_polling ORDER BY id "
-                                     "LIMIT 7")) {
+    notify(NOTIFICATION_FORCE_BALANCE, 0);
+    EXPECT_TRUE(test::waitFor([&] { return timeLeft(mRoutine) > 0; }));
+    for (const std::string& r : rows("SELECT timestamp, reason FROM debug_data_polling LIMIT 7")) {
         stored += r;
     }
     EXPECT_EQ(expectedRows, stored);

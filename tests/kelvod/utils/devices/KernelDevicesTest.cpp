@@ -11,6 +11,7 @@
 #include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
 #include "HealthCounters.h"
+#include "common/RecordingHandler.h"
 #include "common/TestEnv.h"
 #include "core/BufferedLogServer.h"
 #include "utils/devices/DpmDevice.h"
@@ -24,31 +25,6 @@ using kelvo::test::TempRoot;
 using Device = FakeKernelDriver::Device;
 
 namespace {
-
-// Records "name:magic:data" of every buffered-log entry it gets.
-class EntryRecorder : public HandlerThread {
-public:
-    EntryRecorder() : HandlerThread("EntryRecorder", 11) {}
-    int32_t handleParcelMessage(const ParcelMessage& msg) override {
-        const android::Parcel& p = msg.getParcel();
-        p.readInt64();
-        std::string entry = std::string(p.readString8().string()) + ":";
-        entry += std::to_string(p.readInt32()) + ":";
-        std::string data(static_cast<size_t>(p.readInt32()), '\0');
-        p.read(&data[0], data.size());
-        std::lock_guard<std::mutex> guard(mLock);
-        mGot.push_back(entry + data);
-        return 0;
-    }
-    std::vector<std::string> got() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mGot;
-    }
-
-private:
-    std::mutex mLock;
-    std::vector<std::string> mGot;
-};
 
 class KernelDevicesTest : public ::testing::Test {
 protected:
@@ -277,7 +253,7 @@ TEST_F(KernelDevicesTest, FailedRequests) {
 TEST_F(KernelDevicesTest, ReportRequestsAnsweredAsTheDriversBufferedLogClient) {
     android::sp<BufferedLogServer> server = new BufferedLogServer("ReportServer", 2000);
     ASSERT_EQ(0, server->start());
-    android::sp<EntryRecorder> recorder = new EntryRecorder();
+    android::sp<test::EntryRecorder> recorder = new test::EntryRecorder();
     android::sp<LogReceiver> receiver = new LogReceiver(recorder);
     for (int32_t magic = 0; magic < 4; ++magic) {
         ASSERT_EQ(0, server->registerLogReceiver(receiver, android::String8("kelvo_driver"), magic));
