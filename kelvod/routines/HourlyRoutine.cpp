@@ -27,30 +27,30 @@ constexpr uint32_t kCompensationParam = 35;
 constexpr int32_t kAbnormalityHourRequest = 2;
 
 const column_attribute kTickColumns[] = {
-        {COLUMN_TIME, "start_routine"},
-        {COLUMN_TIME, "end_routine"},
+    {COLUMN_TIME, "start_routine"},
+    {COLUMN_TIME, "end_routine"},
 };
 const table_attribute kTickTable = {"1.0", 1, 2, kTickColumns, "debug_hourly_tick"};
 
 const column_attribute kCompensationColumns[] = {
-        {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_INT, "battery"},
-        {COLUMN_INT, "power_model"}, {COLUMN_INT, "free"},      {COLUMN_INT, "ratio"},
+    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, {COLUMN_INT, "battery"},
+    {COLUMN_INT, "power_model"}, {COLUMN_INT, "free"},      {COLUMN_INT, "ratio"},
 };
 const table_attribute kCompensationTable = {"1.1", 1, 6, kCompensationColumns,
                                             "debug_energy_compensation"};
 
 const column_attribute kTvlogColumns[] = {
-        {COLUMN_TIME, "timestamp"},
-        {COLUMN_INT, "tvlog_count"},
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_INT, "tvlog_count"},
 };
 const table_attribute kTvlogTable = {"1.0", 1, 2, kTvlogColumns, "debug_tvlog_count"};
 
 // The notification that announces each candidate (1 to 8).
 const int32_t kCandidateNotifications[HourlyRoutine::kCandidateCount] = {
-        NOTIFICATION_HOURLY_TICK,        NOTIFICATION_APPLICATIONS_ACCOUNTING,
-        NOTIFICATION_COMPONENT_ACCOUNTING, NOTIFICATION_HOURLY_UPLOADING,
-        NOTIFICATION_DAILY_TICK,         NOTIFICATION_DAILY_UPLOADING,
-        NOTIFICATION_DIFF_DAY_REBOOT,    NOTIFICATION_DAWN_UPLOADING,
+    NOTIFICATION_HOURLY_TICK,          NOTIFICATION_APPLICATIONS_ACCOUNTING,
+    NOTIFICATION_COMPONENT_ACCOUNTING, NOTIFICATION_HOURLY_UPLOADING,
+    NOTIFICATION_DAILY_TICK,           NOTIFICATION_DAILY_UPLOADING,
+    NOTIFICATION_DIFF_DAY_REBOOT,      NOTIFICATION_DAWN_UPLOADING,
 };
 
 const uint32_t kHourlyEvents[] = {EVENT_HOURLY_COMPONENTS, EVENT_HOURLY_APPLICATIONS};
@@ -76,7 +76,7 @@ int64_t saturatingAdd(int64_t a, int64_t b) {
     return sum;
 }
 
-} // namespace
+}  // namespace
 
 std::atomic<int64_t> HourlyRoutine::sVoteTimeoutMs{HourlyRoutine::kVoteTimeoutMs};
 
@@ -178,8 +178,8 @@ int32_t HourlyRoutine::tick() {
 
     android::Parcel row;
     row.writeInt64(hour);
-    row.writeInt32(KelvoUtils::saturateInt32(
-            static_cast<int64_t>(Dispatcher::getInstance()->getLogCount())));
+    row.writeInt32(
+        KelvoUtils::saturateInt32(static_cast<int64_t>(Dispatcher::getInstance()->getLogCount())));
     insertEntries(kTvlogTable, row, 1, false);
     return 0;
 }
@@ -283,9 +283,8 @@ void HourlyRoutine::notifyVoting(int32_t notification, int64_t hour, voting_roun
     timeout.writeInt64(hour);
     timeout.writeInt32(round.candidate);
     int64_t delayMs = round.pending == 0 ? 0 : sVoteTimeoutMs.load(std::memory_order_relaxed);
-    round.timeout = sendMessageDelayed(delayMs * 1000000LL,
-                                       ParcelMessage(MESSAGE_CUSTOMIZED, REQUEST_VOTE_TIMEOUT,
-                                                     timeout));
+    round.timeout = sendMessageDelayed(
+        delayMs * 1000000LL, ParcelMessage(MESSAGE_CUSTOMIZED, REQUEST_VOTE_TIMEOUT, timeout));
 }
 
 int32_t HourlyRoutine::handleCustomized(int32_t code, const android::Parcel& data,
@@ -331,10 +330,10 @@ int32_t HourlyRoutine::handleVote(const android::Parcel& data) {
     voting_round& round = it->second;
     if (hour != mActiveHour || candidate != round.candidate) {
         // A waiting round has announced nothing yet: no vote can be for it.
-        KLOGE("Elector(%u) is voting for a mismatched candidate(%d, %d) in the voting round of "
-              "hour(%s)",
-              elector, candidate, hour == mActiveHour ? round.candidate : 0,
-              hourText(hour).c_str());
+        KLOGE(
+            "Elector(%u) is voting for a mismatched candidate(%d, %d) in the voting round of "
+            "hour(%s)",
+            elector, candidate, hour == mActiveHour ? round.candidate : 0, hourText(hour).c_str());
         refused();
         return -16;
     }
@@ -584,8 +583,8 @@ int32_t HourlyRoutine::checkLastTick(int64_t time) {
     android::Parcel reply;
     int32_t rows = 0;
     int32_t ret = queryEntriesSimple(
-            android::String8("SELECT start_routine FROM debug_hourly_tick ORDER BY id DESC LIMIT 1"),
-            &reply, 1, rows);
+        android::String8("SELECT start_routine FROM debug_hourly_tick ORDER BY id DESC LIMIT 1"),
+        &reply, 1, rows);
     if (ret < 0) {
         KLOGE("Failed to query hourly tick: %d", ret);
         return -17;
@@ -602,9 +601,8 @@ int32_t HourlyRoutine::checkLastTick(int64_t time) {
     if (mRounds.count(hour) != 0) {
         return 0;
     }
-    int8_t type = TimeProvider(time).startOfDay() != TimeProvider(last).startOfDay()
-            ? ROUND_REBOOT
-            : ROUND_HOURLY;
+    int8_t type = TimeProvider(time).startOfDay() != TimeProvider(last).startOfDay() ? ROUND_REBOOT
+                                                                                     : ROUND_HOURLY;
     openRound(hour, type, 2);
     KLOGI("Processing data before last shut down");
     return 0;
@@ -633,9 +631,9 @@ bool HourlyRoutine::checkUpload() {
 
 void HourlyRoutine::updateDailyCompensation(int64_t hour, voting_round& round) {
     android::String8 sql = android::String8::format(
-            "SELECT SUM(battery), SUM(power_model), SUM(free) FROM debug_energy_compensation "
-            "WHERE end_time > %" PRId64 " AND end_time <= %" PRId64,
-            hour - kDayMs, hour);
+        "SELECT SUM(battery), SUM(power_model), SUM(free) FROM debug_energy_compensation "
+        "WHERE end_time > %" PRId64 " AND end_time <= %" PRId64,
+        hour - kDayMs, hour);
     android::Parcel reply;
     int32_t rows = 0;
     if (queryEntriesSimple(sql, &reply, 3, rows) < 0) {
@@ -659,8 +657,7 @@ int32_t HourlyRoutine::uploadEnergyCompensationData(float ratio, uint32_t event)
     }
     android::Parcel data;
     DataUploader::formIntData(kCompensationParam,
-                              KelvoUtils::saturateInt32(static_cast<double>(ratio) * 1000.0),
-                              data);
+                              KelvoUtils::saturateInt32(static_cast<double>(ratio) * 1000.0), data);
     if (DataUploader::getInstance()->setEventData(event, data, true) < 0) {
         KLOGE("Failed to set upload energy compensation");
         return -23;
@@ -720,4 +717,4 @@ int32_t HourlyRoutine::onShutDown(const android::Parcel&) {
     return forceFlushEntries();
 }
 
-} // namespace kelvo
+}  // namespace kelvo

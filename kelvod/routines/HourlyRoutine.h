@@ -1,13 +1,12 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stdint.h>
+#include <utils/String8.h>
 
 #include <atomic>
 #include <map>
 #include <string>
-
-#include <binder/Parcel.h>
-#include <utils/String8.h>
 
 #include "core/KelvoOperator.h"
 #include "utils/TimerCallback.h"
@@ -31,17 +30,17 @@ class HourlyRoutine : public KelvoOperator {
 public:
     // Requests of MESSAGE_CUSTOMIZED (what).
     enum request_code : int32_t {
-        REQUEST_VOTE = 0,         // int64 round hour, int32 candidate, uint32 elector
-        REQUEST_VOTE_TIMEOUT = 1, // int64 round hour, int32 candidate (sent to itself)
-        REQUEST_OFFSET = 2,       // reply: int64 last tick, int64 ms until the next tick
-        REQUEST_COMPENSATION = 3, // int64 round hour, uint32 elector, int64 energy
-        REQUEST_ELECTOR = 4,      // uint32 elector bit, int32 candidates to the end
+        REQUEST_VOTE = 0,          // int64 round hour, int32 candidate, uint32 elector
+        REQUEST_VOTE_TIMEOUT = 1,  // int64 round hour, int32 candidate (sent to itself)
+        REQUEST_OFFSET = 2,        // reply: int64 last tick, int64 ms until the next tick
+        REQUEST_COMPENSATION = 3,  // int64 round hour, uint32 elector, int64 energy
+        REQUEST_ELECTOR = 4,       // uint32 elector bit, int32 candidates to the end
     };
     enum round_type : int8_t {
         ROUND_HOURLY = 0,
-        ROUND_DAWN = 1,   // opened at 06:xx local
-        ROUND_DAILY = 2,  // opened at 00:xx local
-        ROUND_REBOOT = 3, // catch-up of an hour of another day
+        ROUND_DAWN = 1,    // opened at 06:xx local
+        ROUND_DAILY = 2,   // opened at 00:xx local
+        ROUND_REBOOT = 3,  // catch-up of an hour of another day
     };
 
     // The `what` of the hourly timer's MESSAGE_TIMER.
@@ -75,10 +74,10 @@ public:
 private:
     struct voting_round {
         int8_t type;
-        int64_t start;     // wall-clock time the round was opened
-        int32_t timeout;   // id of the pending time-out message, -1 when none
-        uint32_t pending;  // electors that have not voted for the candidate
-        int32_t candidate; // current step, 1 to 8
+        int64_t start;      // wall-clock time the round was opened
+        int32_t timeout;    // id of the pending time-out message, -1 when none
+        uint32_t pending;   // electors that have not voted for the candidate
+        int32_t candidate;  // current step, 1 to 8
         int64_t battery;
         int64_t powerModel;
         int64_t free;
@@ -110,8 +109,8 @@ private:
     bool checkUpload();
     void updateDailyCompensation(int64_t hour, voting_round& round);
     float computeRatio(const voting_round& round) const;
-    void logCompensation(const char* kind, int64_t start, int64_t hour,
-                         const voting_round& round, float ratio, bool store);
+    void logCompensation(const char* kind, int64_t start, int64_t hour, const voting_round& round,
+                         float ratio, bool store);
     int32_t uploadEnergyCompensationData(float ratio, uint32_t event);
     int32_t uploadEvents(const uint32_t* events, size_t count, int64_t start, int64_t end);
     void sendToAbnormality(int64_t hour);
@@ -130,4 +129,4 @@ private:
     static std::atomic<int64_t> sVoteTimeoutMs;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

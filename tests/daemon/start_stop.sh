@@ -6,6 +6,9 @@ bin=$1
 root=$(mktemp -d /tmp/kelvo-daemon-XXXXXX)
 log=$root/stderr.log
 trap 'rm -rf "$root"' EXIT
+# The device's configuration, as every device has one.
+mkdir -p "$root/vendor/etc/xml"
+cp "$(dirname "$0")/../../config/tv_kelvo_config.xml" "$root/vendor/etc/xml/"
 
 KELVO_ROOT=$root "$bin" 2>"$log" &
 pid=$!
@@ -16,10 +19,15 @@ done
 if ! grep -q '\[KelvoMain.cpp\] main# Kelvo Daemon (Version: 000.1.4.0)' "$log"; then
     echo "FAIL: no banner"; cat "$log"; kill -9 $pid; exit 1
 fi
-sleep 0.3
-names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
+# Start-up goes on after the banner: wait (up to 5 s on a loaded machine)
+# for the threads.
+for _ in $(seq 1 100); do
+    names=$(cat /proc/$pid/task/*/comm 2>/dev/null | sort | tr '\n' ' ')
+    case " $names " in *" BufferedLogServ "*" HourlyRoutine "*" PollingRoutine "*) break;; esac
+    sleep 0.05
+done
 echo "threads: $names"
-for expected in kelvod KelvoStorage BufferedLogServ PollingRoutine; do
+for expected in kelvod KelvoStorage BufferedLogServ PollingRoutine HourlyRoutine; do
     case " $names " in *" $expected "*) ;; *) echo "FAIL: no thread $expected"; kill -9 $pid; exit 1;; esac
 done
 # The buffered log socket lies below the root.
