@@ -10,6 +10,9 @@
 #include <time.h>
 #include <unistd.h>
 
+#include <string>
+#include <vector>
+
 namespace kelvo {
 namespace sim {
 
@@ -38,16 +41,36 @@ bool DaemonProcess::start(const std::string& program, const std::map<std::string
         *error = "cannot open " + logPath + ": " + strerror(errno);
         return false;
     }
+    // Everything the child needs is made before the fork: the simulator has
+    // threads, so the child may only make async-signal-safe calls.
+    std::vector<std::string> entries;
+    for (char** e = environ; *e != nullptr; ++e) {
+        std::string entry(*e);
+        if (env.count(entry.substr(0, entry.find('='))) == 0) {
+            entries.push_back(entry);
+        }
+    }
+    for (const auto& entry : env) {
+        entries.push_back(entry.first + "=" + entry.second);
+    }
+    std::vector<char*> envp;
+    for (std::string& entry : entries) {
+        envp.push_back(&entry[0]);
+    }
+    envp.push_back(nullptr);
+    char* argv[] = {const_cast<char*>(program.c_str()), nullptr};
+    int null = open("/dev/null", O_RDONLY | O_CLOEXEC);
     pid_t parent = getpid();
     pid_t pid = fork();
     if (pid < 0) {
         *error = std::string("cannot fork: ") + strerror(errno);
         close(log);
+        if (null >= 0) {
+            close(null);
+        }
         return false;
     }
     if (pid == 0) {
-        // Only async-signal-safe calls until exec, apart from setenv on the
-        // child's own copy of the environment.
         setpgid(0, 0);
         prctl(PR_SET_PDEATHSIG, SIGTERM);
         if (getppid() != parent) {
@@ -58,17 +81,18 @@ bool DaemonProcess::start(const std::string& program, const std::map<std::string
         sigprocmask(SIG_SETMASK, &none, nullptr);
         signal(SIGINT, SIG_DFL);
         signal(SIGTERM, SIG_DFL);
+        signal(SIGHUP, SIG_DFL);
+        // dup2 clears close-on-exec on the copies.
         dup2(log, STDERR_FILENO);
         dup2(log, STDOUT_FILENO);
-        int null = open("/dev/null", O_RDONLY);
         if (null >= 0) {
             dup2(null, STDIN_FILENO);
         }
-        for (const auto& entry : env) {
-            setenv(entry.first.c_str(), entry.second.c_str(), 1);
-        }
-        execl(program.c_str(), program.c_str(), static_cast<char*>(nullptr));
+        execve(program.c_str(), argv, envp.data());
         _exit(127);
+    }
+    if (null >= 0) {
+        close(null);
     }
     close(log);
     setpgid(pid, pid);
