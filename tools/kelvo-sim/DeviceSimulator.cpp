@@ -38,6 +38,9 @@ constexpr int kStopGraceMs = 15000;
 // The idle figures are taken from this long after the start on.
 constexpr int64_t kIdleSettleMs = 10000;
 constexpr int32_t kBrightnessOn = 128;
+constexpr int64_t kHourMs = 3600 * 1000;
+// Eight steps of a round, each waiting at most a minute for its votes.
+constexpr int64_t kLongestRoundMs = 8 * 60 * 1000;
 
 int64_t monotonicMs() {
     struct timespec ts;
@@ -327,17 +330,31 @@ void DeviceSimulator::advanceTo(int64_t ms) {
     mModelMs = ms;
 }
 
-void DeviceSimulator::updatePhase(int64_t elapsedMs) {
-    if (mFirstHourMs <= 0 || elapsedMs < mFirstHourMs) {
-        mPhase = Phase::Load;
-        return;
+int32_t DeviceSimulator::hourlyEventsUploaded() const {
+    std::ifstream events(SimReport::eventsPath(mOptions.root));
+    std::string line;
+    int32_t count = 0;
+    while (std::getline(events, line)) {
+        count += line.find("\"event\":903001060") != std::string::npos ? 1 : 0;
     }
-    if (mPhase == Phase::HourlyRound || (mPhase == Phase::Load && elapsedMs - mFirstHourMs < 2000)) {
-        // The round is over once its hourly event is in the uploaded-events file.
-        std::ifstream events(SimReport::eventsPath(mOptions.root));
-        std::string text((std::istreambuf_iterator<char>(events)), std::istreambuf_iterator<char>());
-        mPhase = text.find("\"event\":903001060") != std::string::npos ? Phase::Load
-                                                                       : Phase::HourlyRound;
+    return count;
+}
+
+void DeviceSimulator::updatePhase(int64_t elapsedMs) {
+    int32_t uploaded = hourlyEventsUploaded();
+    if (elapsedMs >= mNextHourMs) {
+        // A round opens at every full hour; it is over once its hourly event
+        // is in the uploaded-events file (or after the longest round).
+        mPhase = Phase::HourlyRound;
+        mRoundStartMs = elapsedMs;
+        mNextHourMs += kHourMs;
+    }
+    if (mPhase == Phase::HourlyRound &&
+        (uploaded > mHourlyEventsBefore || elapsedMs - mRoundStartMs > kLongestRoundMs)) {
+        mPhase = Phase::Load;
+    }
+    if (mPhase != Phase::HourlyRound) {
+        mHourlyEventsBefore = uploaded;
     }
 }
 
@@ -346,12 +363,15 @@ void DeviceSimulator::showProgress(int64_t elapsedMs, bool last) {
         return;
     }
     static int64_t sLastLine = -1;
+    static Phase sLastPhase = Phase::Start;
     bool tty = isatty(STDERR_FILENO) != 0;
     int64_t second = elapsedMs / 1000;
-    if (!tty && !last && second / 10 == sLastLine) {
+    // Without a terminal: a line every 10 s and at every change of phase.
+    if (!tty && !last && second / 10 == sLastLine && mPhase == sLastPhase) {
         return;
     }
     sLastLine = second / 10;
+    sLastPhase = mPhase;
     time_t simulated = static_cast<time_t>(simulatedNowMs() / 1000);
     struct tm parts;
     localtime_r(&simulated, &parts);
@@ -498,8 +518,6 @@ int DeviceSimulator::run() {
     parts.tm_isdst = -1;
     mStartMs = static_cast<int64_t>(mktime(&parts)) * 1000;
     mOffsetMs = mStartMs - now;
-    int64_t hourMs = 3600 * 1000;
-    mFirstHourMs = (mStartMs / hourMs + 1) * hourMs - mStartMs;
 
     showProgress(0, false);
     if (!prepareRoot(&error) || !startServices(&error) || !startDaemon(&error) ||
@@ -513,7 +531,7 @@ int DeviceSimulator::run() {
     }
     // The steps count from here, once the daemon is up.
     mStartMs = simulatedNowMs();
-    mFirstHourMs = (mStartMs / hourMs + 1) * hourMs - mStartMs;
+    mNextHourMs = (mStartMs / kHourMs + 1) * kHourMs - mStartMs;
     bool completed = play();
     return finish(completed);
 }

@@ -69,6 +69,8 @@ private:
     std::string answerCpuRequest();
     void showProgress(int64_t elapsedMs, bool last);
     void updatePhase(int64_t elapsedMs);
+    // Hourly events (903001060) in the uploaded-events file so far.
+    int32_t hourlyEventsUploaded() const;
     void stopAll();
     int finish(bool completed);
 
@@ -77,9 +79,11 @@ private:
     const Scenario& mScenario;
     Options mOptions;
     int64_t mOffsetMs = 0;
-    int64_t mStartMs = 0;      // simulated wall clock at the beginning
-    int64_t mModelMs = 0;      // simulated time played so far
-    int64_t mFirstHourMs = 0;  // elapsed ms at which the first full hour falls
+    int64_t mStartMs = 0;       // simulated wall clock at the beginning
+    int64_t mModelMs = 0;       // simulated time played so far
+    int64_t mNextHourMs = 0;    // elapsed ms at which the next full hour falls
+    int64_t mRoundStartMs = 0;  // elapsed ms at which the current round opened
+    int32_t mHourlyEventsBefore = 0;
     Phase mPhase = Phase::Start;
     std::string mLogPath;
     std::string mError;
