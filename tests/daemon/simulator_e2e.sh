@@ -76,7 +76,8 @@ component = p["6"]
 assert component["class"] == 903009021 and component["params"]["7"] > 0, component
 top = p["7"]
 names = {a["params"]["3"]["params"]["0"] for a in top}
-assert {"com.example.mail", "system_server", "kernel_kworker"} <= names, names
+assert names == {"com.example.mail", "com.example.browser", "com.example.browser-renderer",
+                 "system_server", "kernel_kworker"}, names
 for a in top:
     assert a["class"] == 903009022 and a["params"]["1"]["class"] == 903009021, a
 PY
