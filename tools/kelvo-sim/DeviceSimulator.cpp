@@ -4,6 +4,7 @@
 #include <dirent.h>
 #include <errno.h>
 #include <inttypes.h>
+#include <sqlite3.h>
 #include <stdio.h>
 #include <stdlib.h>
 #include <string.h>
@@ -330,31 +331,41 @@ void DeviceSimulator::advanceTo(int64_t ms) {
     mModelMs = ms;
 }
 
-int32_t DeviceSimulator::hourlyEventsUploaded() const {
-    std::ifstream events(SimReport::eventsPath(mOptions.root));
-    std::string line;
-    int32_t count = 0;
-    while (std::getline(events, line)) {
-        count += line.find("\"event\":903001060") != std::string::npos ? 1 : 0;
+int32_t DeviceSimulator::hourlyRoundsFinished() const {
+    // Each finished round leaves a debug_hourly_tick row (flushed at once).
+    sqlite3* db = nullptr;
+    int32_t count = -1;
+    std::string path = SimReport::databasePath(mOptions.root);
+    if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+        sqlite3_busy_timeout(db, 50);
+        sqlite3_stmt* stmt = nullptr;
+        if (sqlite3_prepare_v2(db, "SELECT COUNT(*) FROM debug_hourly_tick", -1, &stmt, nullptr) ==
+                SQLITE_OK &&
+            sqlite3_step(stmt) == SQLITE_ROW) {
+            count = sqlite3_column_int(stmt, 0);
+        }
+        sqlite3_finalize(stmt);
     }
+    sqlite3_close(db);
     return count;
 }
 
 void DeviceSimulator::updatePhase(int64_t elapsedMs) {
-    int32_t uploaded = hourlyEventsUploaded();
+    int32_t finished = hourlyRoundsFinished();
     if (elapsedMs >= mNextHourMs) {
-        // A round opens at every full hour; it is over once its hourly event
-        // is in the uploaded-events file (or after the longest round).
+        // A round opens at every full hour; it is over once its row is in
+        // debug_hourly_tick (or after the longest round).
         mPhase = Phase::HourlyRound;
         mRoundStartMs = elapsedMs;
         mNextHourMs += kHourMs;
+        showProgress(elapsedMs, false);
     }
     if (mPhase == Phase::HourlyRound &&
-        (uploaded > mHourlyEventsBefore || elapsedMs - mRoundStartMs > kLongestRoundMs)) {
+        (finished > mRoundsBefore || elapsedMs - mRoundStartMs > kLongestRoundMs)) {
         mPhase = Phase::Load;
     }
-    if (mPhase != Phase::HourlyRound) {
-        mHourlyEventsBefore = uploaded;
+    if (mPhase != Phase::HourlyRound && finished >= 0) {
+        mRoundsBefore = finished;
     }
 }
 

@@ -69,8 +69,8 @@ private:
     std::string answerCpuRequest();
     void showProgress(int64_t elapsedMs, bool last);
     void updatePhase(int64_t elapsedMs);
-    // Hourly events (903001060) in the uploaded-events file so far.
-    int32_t hourlyEventsUploaded() const;
+    // Rounds the hourly routine finished so far; -1 when unknown.
+    int32_t hourlyRoundsFinished() const;
     void stopAll();
     int finish(bool completed);
 
@@ -83,7 +83,7 @@ private:
     int64_t mModelMs = 0;       // simulated time played so far
     int64_t mNextHourMs = 0;    // elapsed ms at which the next full hour falls
     int64_t mRoundStartMs = 0;  // elapsed ms at which the current round opened
-    int32_t mHourlyEventsBefore = 0;
+    int32_t mRoundsBefore = 0;
     Phase mPhase = Phase::Start;
     std::string mLogPath;
     std::string mError;
