@@ -221,6 +221,10 @@ bool DeviceSimulator::startServices(std::string* error) {
 }
 
 bool DeviceSimulator::startDaemon(std::string* error) {
+    if (access(mOptions.daemonPath.c_str(), X_OK) != 0) {
+        *error = "no daemon to run at " + mOptions.daemonPath + " (build it, or give --daemon)";
+        return false;
+    }
     std::map<std::string, std::string> env = {
         {"KELVO_ROOT", mOptions.root},
         {"KELVO_CLOCK_OFFSET_MS", std::to_string(mOffsetMs)},
