@@ -6,18 +6,27 @@
 # running. docs/simulator.md describes the simulator and its scenarios.
 #   scripts/run-daemon.sh [SCENARIO] [kelvo-sim options, e.g. --root DIR]
 set -euo pipefail
-scenario=${1:-}
-shift || true
-if [ -n "$scenario" ]; then
-    [ -f "$scenario" ] || { echo "run-daemon.sh: no scenario file $scenario" >&2; exit 2; }
-    scenario=$(realpath "$scenario")
-fi
+scenario=
 args=()
-for arg in "$@"; do
-    # A relative root is taken from where the command was given.
-    if [ "${prev:-}" = --root ]; then arg=$(realpath -m "$arg"); fi
-    args+=("$arg")
-    prev=$arg
+while (($# > 0)); do
+    case "$1" in
+        --root | --daemon | --config)
+            (($# >= 2)) || { echo "run-daemon.sh: $1 needs a value" >&2; exit 2; }
+            # Paths are taken from where the command was given.
+            args+=("$1" "$(realpath -m "$2")")
+            shift 2
+            ;;
+        -*)
+            args+=("$1")
+            shift
+            ;;
+        *)
+            [ -z "$scenario" ] || { echo "run-daemon.sh: one scenario only" >&2; exit 2; }
+            [ -f "$1" ] || { echo "run-daemon.sh: no scenario file $1" >&2; exit 2; }
+            scenario=$(realpath "$1")
+            shift
+            ;;
+    esac
 done
 cd "$(dirname "$0")/.."
 scenario=${scenario:-$PWD/examples/main-job.scn}
