@@ -271,6 +271,7 @@ void clearParcel(Parcel& p) {
 }  // namespace
 
 std::atomic<int64_t> CpuHandler::sReportWaitMs{CpuHandler::kDefaultReportWaitMs};
+std::atomic<int64_t> CpuHandler::sClockHz{0};
 
 int64_t CpuHandler::counter::advance(int64_t reading) {
     if (!known) {
@@ -293,7 +294,7 @@ CpuHandler::CpuHandler()
       mNextPendingId(0),
       mScreenOn(true),
       mCharging(false) {
-    long hz = sysconf(_SC_CLK_TCK);
+    long hz = sClockHz.load() > 0 ? sClockHz.load() : sysconf(_SC_CLK_TCK);
     mClockHz = hz > 0 ? hz : 100;
 }
 
@@ -301,6 +302,10 @@ CpuHandler::~CpuHandler() {
     if (mPidCpuTimeEnabled) {
         KelvoDevice::enablePidCpuTime(false);
     }
+}
+
+void CpuHandler::setClockHz(int64_t hz) {
+    sClockHz = hz > 0 ? hz : 0;
 }
 
 void CpuHandler::setReportWaitMs(int64_t ms) {

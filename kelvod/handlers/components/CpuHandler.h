@@ -62,6 +62,10 @@ public:
 
     // How long a pass waits for the kernel's report (tests shorten it).
     static void setReportWaitMs(int64_t ms);
+    // The clock-tick rate of handlers created afterwards; 0 takes the
+    // system's (100 when it cannot be read). Tests use rates that do not
+    // divide 1000.
+    static void setClockHz(int64_t hz);
 
     void setupListeners(android::Parcel& out) override;
     void setCandidateElector() override;
@@ -227,6 +231,7 @@ private:
     bool mCharging;
 
     static std::atomic<int64_t> sReportWaitMs;
+    static std::atomic<int64_t> sClockHz;
 };
 
 }  // namespace kelvo

@@ -112,6 +112,8 @@ public:
         mRoutine = new StandInRoutine();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
         CpuHandler::setReportWaitMs(5000);
+        // A tick rate that does not divide 1000: 3.33 ms per tick.
+        CpuHandler::setClockHz(300);
         mHandler = new CpuHandler();
         ASSERT_EQ(0, mHandler->earlyInitialize());
         mHandler->addSchemaTable();
@@ -126,6 +128,7 @@ public:
         mHandler->readyToDestroy();
         mHandler->requestThreadExit();
         mHandler.clear();
+        CpuHandler::setClockHz(0);
         mRoutine->requestThreadExit();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
         mRoutine.clear();
@@ -258,6 +261,10 @@ TEST_F(CpuHandlerTest, ProcessesAndUidsAreChargedToTheirPackages) {
     EXPECT_EQ(std::vector<std::string>({"0|30", "1|0"}),
               rows("SELECT cluster, idle_time FROM raw_cpu_idle_time"));
     EXPECT_EQ(1u, rows("SELECT * FROM raw_component_cpu").size());
+    // Residency in ms from cumulative ticks at 300 Hz: 200 -> 240 and
+    // 99 -> 119 ticks (not 3 ms per tick).
+    EXPECT_EQ(std::vector<std::string>({"0|300000|134", "1|652800|66"}),
+              rows("SELECT cluster, frequency, time FROM raw_cpu_frequencies_time WHERE time > 0"));
 
     // The process-name query answers from the pid entries.
     struct Query {
