@@ -21,8 +21,7 @@
 using android::Parcel;
 using android::sp;
 using namespace kelvo;
-using kelvo::test::LogCapture;
-using kelvo::test::waitFor;
+using namespace kelvo::test;
 
 namespace {
 
@@ -99,8 +98,7 @@ protected:
     void addTables() override {
         setenv("TZ", "UTC", 1);
         tzset();
-        std::lock_guard<std::mutex> guard(gLock);
-        gSeen.clear();
+        gSeen.clear();  // every elector of the last test has been joined
         setClock(kDay + 9 * kH + 20 * kMin);
         std::string xml = "<kelvo_config><element id=\"4\"><component id=\"0\"><parameter>";
         mRoot->writeFile("/data/misc/kelvo/tv_kelvo_config.xml",
@@ -213,7 +211,7 @@ class HourlyFlowTest : public HourlyRoutineTest, public ::testing::WithParamInte
 
 TEST_P(HourlyFlowTest, RoundsStepAndUploadOnTheLastVote) {
     const FlowCase& c = GetParam();
-    kelvo::test::DirectDb db(dbPath());
+    DirectDb db(dbPath());
     std::string last = std::to_string(c.lastStart), delta = std::to_string(c.timeChange);
     db.exec("INSERT INTO debug_hourly_tick(start_routine) SELECT " + last + " WHERE " + last);
     db.exec("INSERT INTO raw_time_changed(delta) SELECT " + delta + " WHERE " + delta);
