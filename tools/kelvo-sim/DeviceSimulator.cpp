@@ -158,6 +158,16 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         mOptions.root = pattern;
     }
     const std::string& root = mOptions.root;
+    // The report compares this run's rows with this run's truth: rows of an
+    // earlier run on the same root (at the same simulated times) would mix in.
+    struct stat st;
+    if (stat(SimReport::databasePath(root).c_str(), &st) == 0 ||
+        stat(SimReport::eventsPath(root).c_str(), &st) == 0) {
+        *error = root +
+                 " holds the database or the uploaded events of an earlier run; give a "
+                 "fresh --root";
+        return false;
+    }
     for (const char* dir :
          {"/system", "/vendor/etc/xml", "/data/log/kelvo", "/data/property", "/dev", "/sim"}) {
         if (!makeDirs(root + dir)) {
