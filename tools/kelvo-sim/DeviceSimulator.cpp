@@ -404,7 +404,7 @@ void DeviceSimulator::showProgress(int64_t elapsedMs, bool last) {
     strftime(clock, sizeof(clock), "%H:%M:%S", &parts);
     fprintf(stderr, "%s[%3" PRId64 "s / %3" PRId64 "s] %s  phase: %-12s reports: %d%s",
             tty ? "\r" : "", second, mScenario.durationMs() / 1000, clock,
-            phaseName(static_cast<int>(mPhase)), mReports, tty && !last ? "" : "\n");
+            phaseName(static_cast<int>(mPhase)), mReports.load(), tty && !last ? "" : "\n");
     fflush(stderr);
 }
 

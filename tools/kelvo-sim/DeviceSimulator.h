@@ -95,7 +95,7 @@ private:
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;
     std::map<std::string, int64_t> mLastSeenMs;
-    int32_t mReports = 0;
+    std::atomic<int32_t> mReports{0};  // also read by the progress line
 
     std::unique_ptr<PlatformServices> mServices;
     std::unique_ptr<fake::FakeKernelDriver> mDriver;
