@@ -384,15 +384,6 @@ void CpuHandler::cleanTables(int64_t time) {
     cleanObsoleteEntries(kHourlyApplicationsTable.name, time, "timestamp");
 }
 
-void CpuHandler::dump(String8& out) {
-    out.appendFormat(
-        "CpuHandler: clusters %zu, ready %d, first sample %d, uids %zu, pids %zu, "
-        "uid baselines %zu, pending passes %zu\n",
-        mClusterOrder.size(), mConfigsReady ? 1 : 0, mFirstSample ? 1 : 0, mUids.size(),
-        mPids.size(), mUidBaselines.size(), mPending.size());
-    KelvoOperator::dump(out);
-}
-
 // ---- Cluster discovery ----
 
 int32_t CpuHandler::readClusterConfig(int32_t core, std::map<std::string, cluster_info>& clusters,
@@ -1255,6 +1246,8 @@ int32_t CpuHandler::handleComponentResult(const Parcel& data) {
 
 int32_t CpuHandler::handleApplicationResult(const Parcel& data) {
     Parcel rows;
+    // The rows take about the room of the records they come from.
+    rows.setDataCapacity(data.dataSize() + 64);
     int32_t count = 0;
     while (data.dataAvail() > 0) {
         int32_t uid = 0;

@@ -72,7 +72,6 @@ public:
     int32_t checkEnable() override;
     void addSchemaTable() override;
     void cleanTables(int64_t time) override;
-    void dump(android::String8& out) override;
 
     int32_t onForegroundChanged(const android::Parcel& data) override;
     int32_t onDataPolling(const android::Parcel& data) override;
