@@ -2,7 +2,8 @@
 # Prepares a fresh Debian 12 machine and builds the project.
 #   scripts/setup.sh [BUILD_DIR] [extra cmake arguments...]
 # Installs the Debian packages the build needs (only those missing), then
-# configures BUILD_DIR (default: build) and builds it with two jobs.
+# configures BUILD_DIR (default: build) and builds it with two jobs: every
+# target, or only those named in KELVO_TARGETS (blank-separated).
 set -euo pipefail
 cd "$(dirname "$0")/.."
 
@@ -32,4 +33,6 @@ shift || true
 LAUNCHER=()
 command -v ccache >/dev/null && LAUNCHER=(-DCMAKE_C_COMPILER_LAUNCHER=ccache -DCMAKE_CXX_COMPILER_LAUNCHER=ccache)
 cmake -S . -B "$BUILD_DIR" "${LAUNCHER[@]}" "$@" >/dev/null
-cmake --build "$BUILD_DIR" -j2
+TARGETS=()
+for t in ${KELVO_TARGETS:-}; do TARGETS+=(--target "$t"); done
+cmake --build "$BUILD_DIR" -j2 "${TARGETS[@]}"

@@ -55,7 +55,9 @@ constexpr uint32_t kClassPackage = 903009063;
 constexpr uint32_t kClassFrequency = 903009030;
 constexpr uint32_t kClassIdle = 903009029;
 constexpr int32_t kTopApplications = 20;
-constexpr int32_t kMaxNameLength = 100;
+// Longest uploaded application name. (Named apart from the thread name bound
+// the handler inherits, which would hide a file-scope constant of that name.)
+constexpr int32_t kMaxUploadNameLength = 100;
 
 constexpr const char* kCpuDir = "/sys/devices/system/cpu";
 constexpr const char* kUidStatPath = "/proc/uid_cputime/show_uid_stat";
@@ -1563,7 +1565,7 @@ int32_t CpuHandler::uploadTopApplications(int64_t end, int64_t window, float rat
             continue;
         }
         Parcel package;
-        DataUploader::formVarcharData(0, name.string(), kMaxNameLength + 1, package);
+        DataUploader::formVarcharData(0, name.string(), kMaxUploadNameLength + 1, package);
         Parcel element;
         DataUploader::formClassData(3, kClassPackage, package, element);
         int32_t strategy = PackageProperty::getInstance()->getPackageStrategy(name);

@@ -1,0 +1,565 @@
+#include "DeviceSimulator.h"
+
+#include <binder/ProcessState.h>
+#include <dirent.h>
+#include <errno.h>
+#include <inttypes.h>
+#include <sqlite3.h>
+#include <stdio.h>
+#include <stdlib.h>
+#include <string.h>
+#include <sys/stat.h>
+#include <time.h>
+#include <unistd.h>
+
+#include <fstream>
+#include <sstream>
+
+#include "CpuTree.h"
+#include "FakeDriverReporter.h"
+#include "FakeKernelDriver.h"
+#include "PlatformServices.h"
+#include "SimReport.h"
+#include "kelvo/BufferedLogClient.h"
+#include "kelvo/LogWriter.h"
+#include "kelvo/RootPath.h"
+
+namespace kelvo {
+namespace sim {
+
+std::atomic<bool> DeviceSimulator::sStop{false};
+
+namespace {
+
+// After a per-process report the counter files stay as they are for this
+// long, so the pass that reads them sees the state the report was cut from.
+constexpr int64_t kReportGuardMs = 800;
+constexpr int64_t kReadyTimeoutMs = 15000;
+constexpr int kStopGraceMs = 15000;
+// The idle figures are taken from this long after the start on.
+constexpr int64_t kIdleSettleMs = 10000;
+constexpr int32_t kBrightnessOn = 128;
+constexpr int64_t kHourMs = 3600 * 1000;
+// Eight steps of a round, each waiting at most a minute for its votes.
+constexpr int64_t kLongestRoundMs = 8 * 60 * 1000;
+
+int64_t monotonicMs() {
+    struct timespec ts;
+    clock_gettime(CLOCK_MONOTONIC, &ts);
+    return ts.tv_sec * 1000LL + ts.tv_nsec / 1000000;
+}
+
+int64_t realtimeMs() {
+    struct timespec ts;
+    clock_gettime(CLOCK_REALTIME, &ts);
+    return ts.tv_sec * 1000LL + ts.tv_nsec / 1000000;
+}
+
+void sleepMs(int64_t ms) {
+    if (ms <= 0) {
+        return;
+    }
+    struct timespec ts = {static_cast<time_t>(ms / 1000), static_cast<long>(ms % 1000) * 1000000};
+    nanosleep(&ts, nullptr);
+}
+
+bool makeDirs(const std::string& path) {
+    std::string partial;
+    std::stringstream in(path);
+    std::string part;
+    while (std::getline(in, part, '/')) {
+        partial += part + "/";
+        if (!part.empty() && mkdir(partial.c_str(), 0755) != 0 && errno != EEXIST) {
+            return false;
+        }
+    }
+    return true;
+}
+
+bool copyFile(const std::string& from, const std::string& to) {
+    struct stat st;
+    if (stat(to.c_str(), &st) == 0) {
+        return true;  // a file the user put there stays
+    }
+    std::ifstream in(from, std::ios::binary);
+    std::ofstream out(to, std::ios::binary);
+    if (!in || !out) {
+        return false;
+    }
+    out << in.rdbuf();
+    return static_cast<bool>(out);
+}
+
+// Sum of both kinds of context switches over the threads of a process.
+int64_t contextSwitches(pid_t pid) {
+    std::string dir = "/proc/" + std::to_string(pid) + "/task";
+    DIR* tasks = opendir(dir.c_str());
+    if (tasks == nullptr) {
+        return -1;
+    }
+    int64_t total = 0;
+    while (struct dirent* entry = readdir(tasks)) {
+        if (entry->d_name[0] == '.') {
+            continue;
+        }
+        std::ifstream status(dir + "/" + entry->d_name + "/status");
+        std::string line;
+        while (std::getline(status, line)) {
+            if (line.compare(0, 24, "voluntary_ctxt_switches:") == 0 ||
+                line.compare(0, 27, "nonvoluntary_ctxt_switches:") == 0) {
+                total += atoll(line.substr(line.find(':') + 1).c_str());
+            }
+        }
+    }
+    closedir(tasks);
+    return total;
+}
+
+int64_t residentKb(pid_t pid) {
+    std::ifstream status("/proc/" + std::to_string(pid) + "/status");
+    std::string line;
+    while (std::getline(status, line)) {
+        if (line.compare(0, 6, "VmRSS:") == 0) {
+            return atoll(line.substr(6).c_str());
+        }
+    }
+    return -1;
+}
+
+const char* phaseName(int phase) {
+    static const char* const kNames[] = {"start", "load", "hourly round", "report"};
+    return kNames[phase];
+}
+
+}  // namespace
+
+DeviceSimulator::DeviceSimulator(const Scenario& scenario, const Options& options)
+    : mScenario(scenario), mOptions(options), mModel(scenario) {}
+
+DeviceSimulator::~DeviceSimulator() {
+    stopAll();
+}
+
+void DeviceSimulator::requestStop() {
+    sStop = true;
+}
+
+int64_t DeviceSimulator::simulatedNowMs() const {
+    return realtimeMs() + mOffsetMs;
+}
+
+bool DeviceSimulator::prepareRoot(std::string* error) {
+    if (mOptions.root.empty()) {
+        char pattern[] = "/tmp/kelvo-sim-XXXXXX";
+        if (mkdtemp(pattern) == nullptr) {
+            *error = std::string("cannot create a root under /tmp: ") + strerror(errno);
+            return false;
+        }
+        mOptions.root = pattern;
+    }
+    const std::string& root = mOptions.root;
+    // The report compares this run's rows with this run's truth: rows of an
+    // earlier run on the same root (at the same simulated times) would mix in.
+    struct stat st;
+    if (stat(SimReport::databasePath(root).c_str(), &st) == 0 ||
+        stat(SimReport::eventsPath(root).c_str(), &st) == 0) {
+        *error = root +
+                 " holds the database or the uploaded events of an earlier run; give a "
+                 "fresh --root";
+        return false;
+    }
+    for (const char* dir :
+         {"/system", "/vendor/etc/xml", "/data/log/kelvo", "/data/property", "/dev", "/sim"}) {
+        if (!makeDirs(root + dir)) {
+            *error = "cannot create " + root + dir + ": " + strerror(errno);
+            return false;
+        }
+    }
+    if (!copyFile(mOptions.configDir + "/build.prop", root + "/system/build.prop") ||
+        !copyFile(mOptions.configDir + "/tv_kelvo_config.xml",
+                  root + "/vendor/etc/xml/tv_kelvo_config.xml")) {
+        *error = "cannot copy the sample configuration from " + mOptions.configDir;
+        return false;
+    }
+    mTree.reset(new CpuTree(root));
+    if (!mTree->layout(mModel.clusters()) || !mModel.writeCounters(mTree.get())) {
+        *error = "cannot lay out the CPU counters below " + root + ": " + strerror(errno);
+        return false;
+    }
+    mLogPath = root + "/sim/kelvod.log";
+    RootPath::setRoot(root.c_str());
+    return true;
+}
+
+bool DeviceSimulator::startServices(std::string* error) {
+    mServices.reset(new PlatformServices());
+    const std::shared_ptr<PlatformState>& state = mServices->state();
+    for (const Scenario::App& app : mScenario.apps()) {
+        state->setPackages(app.uid, app.packages);
+    }
+    std::vector<PlatformState::Process> processes;
+    for (const Scenario::Process& process : mScenario.processes()) {
+        if (process.nameType != 1) {
+            continue;
+        }
+        PlatformState::Process entry{process.pid, process.uid, process.name, {}};
+        if (!process.package.empty()) {
+            entry.packages.push_back(process.package);
+        }
+        processes.push_back(entry);
+    }
+    state->setProcesses(processes);
+    android::ProcessState::self()->startThreadPool();
+    if (mServices->startAll() != android::NO_ERROR) {
+        *error = "cannot register the platform services below " + mOptions.root;
+        return false;
+    }
+    mDriver.reset(new fake::FakeKernelDriver());
+    if (!mDriver->start()) {
+        *error = "cannot serve the kernel devices below " + mOptions.root;
+        return false;
+    }
+    mReporter.reset(new fake::FakeDriverReporter(*mDriver));
+    mReporter->setBodyProvider([this](const fake::FakeDriverReporter::Report& report) {
+        return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME ? answerCpuRequest()
+                                                                            : std::string();
+    });
+    mReporter->start();
+    mLogWriter.reset(new LogWriter(RootPath::resolve("/dev/tvlog_kelvo")));
+    mLogWriter->setTimeout(200);
+    return true;
+}
+
+bool DeviceSimulator::startDaemon(std::string* error) {
+    if (access(mOptions.daemonPath.c_str(), X_OK) != 0) {
+        *error = "no daemon to run at " + mOptions.daemonPath + " (build it, or give --daemon)";
+        return false;
+    }
+    std::map<std::string, std::string> env = {
+        {"KELVO_ROOT", mOptions.root},
+        {"KELVO_CLOCK_OFFSET_MS", std::to_string(mOffsetMs)},
+        {"TZ", mScenario.timeZone()},
+    };
+    return mDaemon.start(mOptions.daemonPath, env, mLogPath, error);
+}
+
+bool DeviceSimulator::waitDaemonReady(std::string* error) {
+    // Ready once the buffered log socket is there and the daemon's battery
+    // listener has registered: the routines and handlers are initialised
+    // right after that step of the start-up, in a moment.
+    std::string socket = RootPath::resolve("/dev/socket/") + BufferedLogClient::kSocketName;
+    int64_t deadline = monotonicMs() + kReadyTimeoutMs;
+    while (monotonicMs() < deadline) {
+        if (!mDaemon.running()) {
+            *error = "the daemon ended during its start; see " + mLogPath;
+            return false;
+        }
+        if (sStop) {
+            *error = "interrupted";
+            return false;
+        }
+        struct stat st;
+        android::sp<FakeBatteryRegistrar> registrar = mServices->batteryRegistrar();
+        if (stat(socket.c_str(), &st) == 0 && S_ISSOCK(st.st_mode) && registrar != nullptr &&
+            registrar->listenerCount() > 0) {
+            sleepMs(300);
+            return true;
+        }
+        sleepMs(50);
+    }
+    *error = "the daemon did not start within 15 s; see " + mLogPath;
+    return false;
+}
+
+std::string DeviceSimulator::answerCpuRequest() {
+    std::lock_guard<std::mutex> lock(mLock);
+    std::string body;
+    int32_t state = 1;
+    int32_t count = mModel.processCount();
+    body.append(reinterpret_cast<const char*>(&state), sizeof(state));
+    body.append(reinterpret_cast<const char*>(&count), sizeof(count));
+    body += mModel.processRecords();
+    mLastSeenMs = mModel.seenMs();
+    if (!mHaveBaseline) {
+        mBaselineMs = mLastSeenMs;
+        mHaveBaseline = true;
+    }
+    ++mReports;
+    mGuardUntilMs = monotonicMs() + kReportGuardMs;
+    return body;
+}
+
+void DeviceSimulator::writeCounters() {
+    std::lock_guard<std::mutex> lock(mLock);
+    if (monotonicMs() < mGuardUntilMs) {
+        return;
+    }
+    if (!mModel.writeCounters(mTree.get())) {
+        fprintf(stderr, "kelvo-sim: cannot rewrite the counter files: %s\n", strerror(errno));
+    }
+}
+
+void DeviceSimulator::apply(const Scenario::Step& step) {
+    int64_t t = mStartMs + step.atMs;
+    int result = 0;
+    switch (step.action) {
+        case Scenario::Action::Load: {
+            std::lock_guard<std::mutex> lock(mLock);
+            mModel.setLoad(step.pid, step.cluster, step.percent, step.frequency);
+            return;
+        }
+        case Scenario::Action::Foreground:
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, "KELVO_TAG_FOREGROUND_CHANGED",
+                                       ("name=" + step.text).c_str(), t);
+            break;
+        case Scenario::Action::Screen:
+            result = mLogWriter->write(
+                LogWriter::PRIORITY_INFO, "KELVO_TAG_BRIGHTNESS",
+                ("brightness=" + std::to_string(step.flag ? kBrightnessOn : 0)).c_str(), t);
+            break;
+        case Scenario::Action::Charger: {
+            PlatformState::Battery battery = mServices->state()->battery();
+            battery.acOnline = step.text == "ac";
+            battery.usbOnline = step.text == "usb";
+            battery.wirelessOnline = step.text == "wireless";
+            mServices->state()->setBattery(battery);
+            return;
+        }
+        case Scenario::Action::Battery: {
+            PlatformState::Battery battery = mServices->state()->battery();
+            battery.level = step.value;
+            mServices->state()->setBattery(battery);
+            return;
+        }
+    }
+    ++mLogWritten;
+    if (result != 0) {
+        // No reader on the device, or its queue stayed full.
+        ++mLogUnread;
+    }
+}
+
+void DeviceSimulator::advanceTo(int64_t ms) {
+    std::lock_guard<std::mutex> lock(mLock);
+    mModel.advance(ms - mModelMs);
+    mModelMs = ms;
+}
+
+int32_t DeviceSimulator::hourlyRoundsFinished() const {
+    // Each finished round leaves a debug_hourly_tick row (flushed at once).
+    sqlite3* db = nullptr;
+    int32_t count = -1;
+    std::string path = SimReport::databasePath(mOptions.root);
+    if (sqlite3_open_v2(path.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+        sqlite3_busy_timeout(db, 50);
+        sqlite3_stmt* stmt = nullptr;
+        if (sqlite3_prepare_v2(db, "SELECT COUNT(*) FROM debug_hourly_tick", -1, &stmt, nullptr) ==
+                SQLITE_OK &&
+            sqlite3_step(stmt) == SQLITE_ROW) {
+            count = sqlite3_column_int(stmt, 0);
+        }
+        sqlite3_finalize(stmt);
+    }
+    sqlite3_close(db);
+    return count;
+}
+
+void DeviceSimulator::updatePhase(int64_t elapsedMs) {
+    int32_t finished = hourlyRoundsFinished();
+    if (elapsedMs >= mNextHourMs) {
+        // A round opens at every full hour; it is over once its row is in
+        // debug_hourly_tick (or after the longest round).
+        mPhase = Phase::HourlyRound;
+        mRoundStartMs = elapsedMs;
+        mNextHourMs += kHourMs;
+        showProgress(elapsedMs, false);
+    }
+    if (mPhase == Phase::HourlyRound &&
+        (finished > mRoundsBefore || elapsedMs - mRoundStartMs > kLongestRoundMs)) {
+        mPhase = Phase::Load;
+    }
+    if (mPhase != Phase::HourlyRound && finished >= 0) {
+        mRoundsBefore = finished;
+    }
+}
+
+void DeviceSimulator::showProgress(int64_t elapsedMs, bool last) {
+    if (!mOptions.progress) {
+        return;
+    }
+    static int64_t sLastLine = -1;
+    static Phase sLastPhase = Phase::Start;
+    bool tty = isatty(STDERR_FILENO) != 0;
+    int64_t second = elapsedMs / 1000;
+    // Without a terminal: a line every 10 s and at every change of phase.
+    if (!tty && !last && second / 10 == sLastLine && mPhase == sLastPhase) {
+        return;
+    }
+    sLastLine = second / 10;
+    sLastPhase = mPhase;
+    time_t simulated = static_cast<time_t>(simulatedNowMs() / 1000);
+    struct tm parts;
+    localtime_r(&simulated, &parts);
+    char clock[16];
+    strftime(clock, sizeof(clock), "%H:%M:%S", &parts);
+    fprintf(stderr, "%s[%3" PRId64 "s / %3" PRId64 "s] %s  phase: %-12s reports: %d%s",
+            tty ? "\r" : "", second, mScenario.durationMs() / 1000, clock,
+            phaseName(static_cast<int>(mPhase)), mReports.load(), tty && !last ? "" : "\n");
+    fflush(stderr);
+}
+
+bool DeviceSimulator::play() {
+    const std::vector<Scenario::Step>& steps = mScenario.steps();
+    size_t next = 0;
+    int64_t tick = mScenario.tickMs();
+    int64_t begin = monotonicMs();
+    int64_t duration = mScenario.durationMs();
+    mPhase = Phase::Load;
+    while (mModelMs < duration) {
+        int64_t target = std::min(mModelMs + tick, duration);
+        sleepMs(begin + target - monotonicMs());
+        if (sStop) {
+            mError = "interrupted";
+            return false;
+        }
+        if (!mDaemon.running()) {
+            mError = "the daemon ended during the run; see " + mLogPath;
+            return false;
+        }
+        // Steps take effect at their own time, so the load given is exact
+        // whatever the loop's jitter.
+        while (next < steps.size() && steps[next].atMs <= target) {
+            advanceTo(steps[next].atMs);
+            apply(steps[next]);
+            ++next;
+        }
+        advanceTo(target);
+        writeCounters();
+        if (mOptions.idleFigures && mSwitchesAtStart < 0 && target >= kIdleSettleMs) {
+            mRssKb = residentKb(mDaemon.pid());
+            mSwitchesAtStart = contextSwitches(mDaemon.pid());
+            mSwitchesAtStartMs = monotonicMs();
+        }
+        updatePhase(target);
+        showProgress(target, false);
+    }
+    while (next < steps.size()) {
+        apply(steps[next++]);
+    }
+    return true;
+}
+
+void DeviceSimulator::stopAll() {
+    if (mReporter) {
+        mReporter->stop();
+    }
+    mDaemonStatus = mDaemon.stop(kStopGraceMs);
+    if (mDriver) {
+        mDriver->stop();
+    }
+    if (mServices) {
+        mServices->stopAll();
+    }
+}
+
+int DeviceSimulator::finish(bool completed) {
+    int64_t switchesAtEnd = -1;
+    int64_t endMono = monotonicMs();
+    if (mOptions.idleFigures && mSwitchesAtStart >= 0 && mDaemon.running()) {
+        switchesAtEnd = contextSwitches(mDaemon.pid());
+    }
+    int64_t endMs = simulatedNowMs();
+    mPhase = Phase::Report;
+    showProgress(mModelMs, true);
+    stopAll();
+
+    SimReport::Header header;
+    header.scenario = mOptions.scenarioPath;
+    header.timeZone = mScenario.timeZone();
+    header.startMs = mStartMs;
+    header.endMs = endMs;
+    header.root = mOptions.root;
+    header.daemonLog = mLogPath;
+    header.daemonStatus = mDaemonStatus;
+    header.interrupted = !completed;
+    header.logRecordsWritten = mLogWritten;
+    header.logRecordsUnread = mLogUnread;
+    std::map<std::string, int64_t> truth;
+    {
+        std::lock_guard<std::mutex> lock(mLock);
+        header.reportsAnswered = mReports;
+        for (const auto& seen : mLastSeenMs) {
+            truth[seen.first] = seen.second - mBaselineMs[seen.first];
+        }
+        // Without a report the daemon could account nothing: every truth is 0.
+        for (const auto& name : mModel.nameUids()) {
+            truth.emplace(name.first, 0);
+        }
+    }
+    SimReport report(header, truth, mModel.nameUids());
+    std::string text;
+    bool readable = report.build(&text);
+    fputs("\n", stdout);
+    fputs(text.c_str(), stdout);
+    std::ofstream(mOptions.root + "/sim/summary.txt") << text;
+    std::ofstream(mOptions.root + "/sim/truth.tsv") << report.truthTable();
+    if (!mError.empty()) {
+        fprintf(stderr, "kelvo-sim: %s\n", mError.c_str());
+    }
+    if (mOptions.idleFigures) {
+        if (switchesAtEnd >= 0 && endMono > mSwitchesAtStartMs) {
+            fprintf(stderr,
+                    "kelvo-sim: %" PRId64 " context switches of the daemon in %" PRId64 " ms\n",
+                    switchesAtEnd - mSwitchesAtStart, endMono - mSwitchesAtStartMs);
+            printf("daemon_idle_rss_kb %" PRId64 "\n", mRssKb);
+            printf("daemon_idle_wakeups_per_min %.1f\n",
+                   static_cast<double>(switchesAtEnd - mSwitchesAtStart) * 60000.0 /
+                       static_cast<double>(endMono - mSwitchesAtStartMs));
+        } else {
+            fprintf(stderr, "kelvo-sim: the idle figures need a run longer than %" PRId64 " s\n",
+                    kIdleSettleMs / 1000);
+            readable = false;
+        }
+    }
+    if (!completed) {
+        return sStop ? 130 : 1;
+    }
+    return readable && mDaemonStatus == 0 ? 0 : 1;
+}
+
+int DeviceSimulator::run() {
+    std::string error;
+    setenv("TZ", mScenario.timeZone().c_str(), 1);
+    tzset();
+    // The offset that puts the daemon's clock at the scenario's time of day,
+    // today in the scenario's zone.
+    int64_t now = realtimeMs();
+    time_t seconds = static_cast<time_t>(now / 1000);
+    struct tm parts;
+    localtime_r(&seconds, &parts);
+    parts.tm_hour = mScenario.startSecondOfDay() / 3600;
+    parts.tm_min = mScenario.startSecondOfDay() / 60 % 60;
+    parts.tm_sec = mScenario.startSecondOfDay() % 60;
+    parts.tm_isdst = -1;
+    mStartMs = static_cast<int64_t>(mktime(&parts)) * 1000;
+    mOffsetMs = mStartMs - now;
+
+    showProgress(0, false);
+    if (!prepareRoot(&error) || !startServices(&error) || !startDaemon(&error) ||
+        !waitDaemonReady(&error)) {
+        fprintf(stderr, "\nkelvo-sim: %s\n", error.c_str());
+        stopAll();
+        if (error == "interrupted") {
+            return 130;
+        }
+        return 1;
+    }
+    // The steps count from here, once the daemon is up.
+    mStartMs = simulatedNowMs();
+    mNextHourMs = (mStartMs / kHourMs + 1) * kHourMs - mStartMs;
+    bool completed = play();
+    return finish(completed);
+}
+
+}  // namespace sim
+}  // namespace kelvo

@@ -1,0 +1,97 @@
+#pragma once
+
+#include <stdint.h>
+
+#include <map>
+#include <string>
+#include <vector>
+
+namespace kelvo {
+namespace sim {
+
+// One scenario of the device simulator: the phone's apps and processes, and
+// what happens to them over time (docs/simulator.md). A scenario is read
+// whole before anything runs; the first bad line refuses it.
+class Scenario {
+public:
+    // A uid and the packages the package service lists for it.
+    struct App {
+        int32_t uid = 0;
+        std::vector<std::string> packages;
+    };
+
+    struct Process {
+        int32_t pid = 0;
+        int32_t uid = 0;
+        std::string name;
+        // 1: process, 2: kernel thread (the per-process report's name type).
+        uint8_t nameType = 1;
+        // The package the activity manager lists for the process; empty when
+        // it is not an application process.
+        std::string package;
+    };
+
+    // What a timed line does. Later components add their verbs here.
+    enum class Action {
+        Load,        // pid, cluster, percent, frequency (kHz, 0: the highest)
+        Foreground,  // text: the package
+        Screen,      // flag: on
+        Charger,     // text: "ac", "usb", "wireless" or "off"
+        Battery,     // value: level
+    };
+
+    struct Step {
+        int64_t atMs = 0;
+        int32_t line = 0;
+        Action action = Action::Load;
+        int32_t pid = 0;
+        int32_t cluster = 0;
+        int32_t percent = 0;
+        int32_t frequency = 0;
+        int32_t value = 0;
+        bool flag = false;
+        std::string text;
+    };
+
+    // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
+    bool load(const std::string& path, std::string* error);
+    // Reads scenario text; name only labels errors.
+    bool parse(const std::string& text, const std::string& name, std::string* error);
+
+    // Simulated local time of day at the beginning, in seconds after midnight.
+    int32_t startSecondOfDay() const { return mStartSecondOfDay; }
+    const std::string& timeZone() const { return mTimeZone; }
+    int64_t durationMs() const { return mDurationMs; }
+    // Steps of the timer's resolution: how often counters advance.
+    int32_t tickMs() const { return mTickMs; }
+    const std::vector<App>& apps() const { return mApps; }
+    const std::vector<Process>& processes() const { return mProcesses; }
+    // In time order (lines of equal time keep their order).
+    const std::vector<Step>& steps() const { return mSteps; }
+
+    const App* findApp(int32_t uid) const;
+    const Process* findProcess(int32_t pid) const;
+
+    // Cluster layout of the simulated phone (CpuTree::phoneClusters): cores
+    // and frequency steps (kHz).
+    static constexpr int32_t kClusterCount = 2;
+    static const std::vector<int32_t>& clusterFrequencies(int32_t cluster);
+    static int32_t clusterCores(int32_t cluster);
+
+private:
+    bool parseLine(const std::vector<std::string>& words, std::string* reason);
+    bool parseTimed(int64_t atMs, const std::vector<std::string>& words, std::string* reason);
+    bool check(std::string* reason, int32_t* line);
+
+    int32_t mLine = 0;
+    int32_t mStartSecondOfDay = -1;
+    std::string mTimeZone = "UTC";
+    int64_t mDurationMs = -1;
+    int32_t mTickMs = 1000;
+    std::vector<App> mApps;
+    std::vector<Process> mProcesses;
+    std::vector<Step> mSteps;
+};
+
+}  // namespace sim
+}  // namespace kelvo
