@@ -227,6 +227,12 @@ AbnormalityRoutine::AbnormalityRoutine()
     SystraceDumper::getInstance();
 }
 
+AbnormalityRoutine::~AbnormalityRoutine() {
+    if (mTimer != nullptr) {
+        TimerManager::getInstance()->removeTimer(mTimer);
+    }
+}
+
 void AbnormalityRoutine::refused() {
     HealthCounters::add(Health::AbnormalityInputRefused);
 }

@@ -68,6 +68,8 @@ public:
     static constexpr int32_t kPowerLogCpu = 185;
 
     AbnormalityRoutine();
+    // Removes its timer: the manager keeps a timer until told.
+    ~AbnormalityRoutine() override;
 
     // Shortens the check period (tests); 0 or less restores it. Read when
     // the timer is armed.

@@ -96,6 +96,12 @@ std::string HourlyRoutine::hourText(int64_t hour) {
     return TimeProvider(hour).toString(TIME_FORMAT_DATE, true);
 }
 
+HourlyRoutine::~HourlyRoutine() {
+    if (mTimer != nullptr) {
+        TimerManager::getInstance()->removeTimer(mTimer);
+    }
+}
+
 void HourlyRoutine::refused() {
     HealthCounters::add(Health::RoutineRequestsRefused);
 }

@@ -54,6 +54,8 @@ public:
     static constexpr int64_t kTimeChangeLimitMs = 3600000;
 
     HourlyRoutine();
+    // Removes its timer: the manager keeps a timer until told.
+    ~HourlyRoutine() override;
 
     // Shortens the vote time-out (tests); 0 or less restores it.
     static void setVoteTimeoutMs(int64_t ms);

@@ -64,6 +64,12 @@ void PollingRoutine::onFirstRef() {
     mTimer = new TimerCallback(this, kPollingTimerId);
 }
 
+PollingRoutine::~PollingRoutine() {
+    if (mTimer != nullptr) {
+        TimerManager::getInstance()->removeTimer(mTimer);
+    }
+}
+
 void PollingRoutine::addSchemaTable() {
     addSchema(kPollingTable);
 }

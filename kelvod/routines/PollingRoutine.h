@@ -40,6 +40,8 @@ public:
 
     // Reads the settings; the timer starts with initialize().
     PollingRoutine();
+    // Removes its timer: the manager keeps a timer until told.
+    ~PollingRoutine() override;
 
     int64_t getPeriodMs() const { return mPeriodMs; }
     int64_t getMinIntervalMs() const { return mMinIntervalMs; }

@@ -26,6 +26,9 @@ int TimerCallback::handleEvent(int fd, int events, void* data) {
     // while the manager confirms this callback still owns exactly this
     // descriptor, and keep it confirmed until the message is posted, so no
     // message leaves after removeTimer() returned.
+    // Declared before the lock: when this is the last reference, the target
+    // goes only after the manager's lock is released.
+    android::sp<HandlerThread> target;
     std::unique_lock<std::mutex> registered = TimerManager::getInstance()->lockRegistered(this, fd);
     if (!registered.owns_lock()) {
         KLOGD("Timer %d no longer owns fd %d", mId, fd);
@@ -50,8 +53,11 @@ int TimerCallback::handleEvent(int fd, int events, void* data) {
         return 0;
     }
 
-    if ((events & android::Looper::EVENT_INPUT) != 0 && mTarget != nullptr) {
-        mTarget->sendMessage(ParcelMessage(MESSAGE_TIMER, mId));
+    if ((events & android::Looper::EVENT_INPUT) != 0) {
+        target = mTarget.promote();
+        if (target != nullptr) {
+            target->sendMessage(ParcelMessage(MESSAGE_TIMER, mId));
+        }
     }
     return 1;
 }

@@ -15,14 +15,15 @@ class TimerCallback : public android::LooperCallback {
 public:
     TimerCallback(const android::sp<HandlerThread>& target, int32_t id);
 
-    const android::sp<HandlerThread>& getTarget() const { return mTarget; }
     int32_t getId() const { return mId; }
 
     // 1 keeps the descriptor watched, 0 drops it from the looper.
     int handleEvent(int fd, int events, void* data) override;
 
 private:
-    android::sp<HandlerThread> mTarget;
+    // Weak: an operator keeps its own timer callbacks, so a strong
+    // reference back would keep both alive for ever.
+    android::wp<HandlerThread> mTarget;
     int32_t mId;
 };
 

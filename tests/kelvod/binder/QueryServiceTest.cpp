@@ -78,8 +78,11 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
         std::string out;
         for (const Query& q : queries) {
             android::Parcel r;
-            bool answered = q.apps ? client.queryApplications(q.start, q.end, q.maskOrTop, &r)
-                                   : client.queryComponent(q.start, q.end, q.maskOrTop, q.flag, &r);
+            // The oversized block takes seconds under the sanitizers.
+            const int waitMs = 60000;
+            bool answered =
+                    q.apps ? client.queryApplications(q.start, q.end, q.maskOrTop, &r, waitMs)
+                           : client.queryComponent(q.start, q.end, q.maskOrTop, q.flag, &r, waitMs);
             out += !answered ? "no answer\n"
                    : q.apps  ? KelvoQueryClient::formatApplications(r)
                              : KelvoQueryClient::formatComponent(r, q.flag);
