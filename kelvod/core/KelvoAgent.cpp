@@ -15,6 +15,7 @@
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/SystemHandler.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
@@ -31,6 +32,10 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_CAMERA, HANDLER_GNSS,     HANDLER_THERMAL, HANDLER_WIFI,       HANDLER_BATTERY,
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
+
+android::sp<KelvoOperator> makeSystemHandler() {
+    return new SystemHandler();
+}
 
 android::sp<KelvoOperator> makeCpuHandler() {
     return new CpuHandler();
@@ -55,6 +60,7 @@ android::sp<KelvoOperator> makeHourlyRoutine() {
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
+        handlers[HANDLER_SYSTEM] = &makeSystemHandler;
         handlers[HANDLER_CPU] = &makeCpuHandler;
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;

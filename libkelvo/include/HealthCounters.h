@@ -37,6 +37,7 @@ enum class Health : uint32_t {
     CpuReportsLate,          // CPU passes run without their per-process report
     CpuEntriesCapped,        // processes or uids not followed: their maps were full
     CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
+    SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
     Count
 };
 
