@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <fstream>
+#include <map>
 
 #include "HealthCounters.h"
 #include "KelvoLog.h"
@@ -20,6 +21,7 @@
 #include "core/Notifier.h"
 #include "kelvo/RootPath.h"
 #include "routines/PollingPayload.h"
+#include "utils/devices/KelvoDevice.h"
 #include "utils/KelvoUtils.h"
 #include "utils/LoggerMessage.h"
 #include "utils/PackageProperty.h"
@@ -36,6 +38,7 @@ constexpr int64_t kHourMs = 3600000;
 constexpr int64_t kDayMs = 86400000;
 constexpr const char* kWakeupSourcesPath = "/proc/wakeup_sources";
 constexpr const char* kBufferedSender = "KelvoService";
+constexpr const char* kDriverSender = "kelvo_driver";
 constexpr int32_t kRequestDailyStatistics = 0;
 constexpr int32_t kRequestPackageList = 2;
 
@@ -239,6 +242,13 @@ SystemHandler::SystemHandler()
       mLastWifiWakeTime(0),
       mPartialWakelocks(kernelUptimeMs() > kRestartUptimeMs),
       mDdrLevels(0),
+      mStatsUser(gLogUserType.load() == 3 || gLogUserType.load() == 5),
+      mKworkerHour(-1),
+      mUeventHour(-1),
+      mBinderHour(-1),
+      mDailyHour(-1),
+      mBinderPrevious(KelvoAgent::getInstance()->getSystemBootTime()),
+      mDailyRecordSinceUpload(false),
       mRepeatHour{-1, -1, -1, -1} {
     const std::string ddr = RootPath::resolve(kDdrPath);
     mDdrLevels = std::max(0, DdrFrequencyReader::countLevels(ddr));
@@ -302,6 +312,10 @@ void SystemHandler::setupListeners(Parcel& out) {
     for (int32_t type : kNotifications) {
         addNotifierListener(type, out);
     }
+    addBufferedLogReceiver(kBufferedSender, SERVICE_DAILY_STATISTICS, out);
+    for (int32_t type : {DRIVER_KWORKER, DRIVER_UEVENT, DRIVER_BINDER_STATS}) {
+        addBufferedLogReceiver(kDriverSender, type, out);
+    }
 }
 
 void SystemHandler::registerDispatcherTag() {
@@ -328,6 +342,11 @@ void SystemHandler::setCandidateElector() {
             candidates.writeInt32(c);
         }
         setElector(e.elector, candidates);
+    }
+    if (mStatsUser) {
+        Parcel tick;
+        tick.writeInt32(kCandidateTick);
+        setElector(kElectorKworker | kElectorUevent | kElectorBinderStats, tick);
     }
 }
 
@@ -779,6 +798,12 @@ int32_t SystemHandler::handleBootCompleted(int64_t time) {
     } else if (ret < 0) {
         KLOGE("Failed to check package list: %d", ret);
     }
+    if (mStatsUser) {
+        if (KelvoDevice::setBinderStatsEnable(true) < 0) {
+            KLOGE("Failed to enable binder stats logging");
+        }
+        mBinderPrevious = time;
+    }
     return 0;
 }
 
@@ -1022,7 +1047,8 @@ int32_t SystemHandler::readDdr(int64_t time) {
 
 int32_t SystemHandler::onForegroundChanged(const Parcel& data) {
     data.setDataPosition(0);
-    data.readInt64();
+    int64_t time = data.readInt64();
+    requestBinderStats(time, 0);
     data.readString8(&mForeground);
     return 0;
 }
@@ -1059,7 +1085,22 @@ int32_t SystemHandler::onDataPolling(const Parcel& data) {
     }
     const bool hourly = poll.reason == POLLING_HOURLY_TICK;
     const int64_t time = hourly ? poll.hour : poll.time;
-    int32_t ret = readMemory(time);
+    int32_t kind = 1;
+    int64_t binderTime = poll.time;
+    if (poll.reason == POLLING_CHARGER) {
+        kind = poll.online ? 4 : 5;
+    } else if (poll.reason == POLLING_TIME_CHANGED) {
+        kind = 3;
+        binderTime = poll.newTime;
+    } else if (hourly) {
+        kind = 2;
+        binderTime = poll.hour;
+    }
+    int32_t ret = requestBinderStats(binderTime, kind);
+    if (ret < 0) {
+        KLOGD("Failed to request binder stats information: %d", ret);
+    }
+    ret = readMemory(time);
     if (ret < 0) {
         KLOGD("Failed to handle memory: %d", ret);
     }
@@ -1080,7 +1121,243 @@ int32_t SystemHandler::onDataPolling(const Parcel& data) {
     return 0;
 }
 
-int32_t SystemHandler::onHourlyTick(const Parcel&) {
+int32_t SystemHandler::onHourlyTick(const Parcel& data) {
+    if (!mStatsUser) {
+        return 0;
+    }
+    data.setDataPosition(0);
+    data.readInt64();
+    const int64_t hour = data.readInt64();
+    int32_t ret = KelvoDevice::requestKworkerInfo(hour);
+    if (ret < 0) {
+        KLOGE("Failed to request kworker information: %d", ret);
+        voteCandidate(hour, kCandidateTick, kElectorKworker);
+    } else {
+        mKworkerHour = hour;
+    }
+    ret = KelvoDevice::requestUeventInfo(hour);
+    if (ret < 0) {
+        KLOGE("Failed to request uevent information: %d", ret);
+        voteCandidate(hour, kCandidateTick, kElectorUevent);
+    } else {
+        mUeventHour = hour;
+    }
+    return 0;
+}
+
+int32_t SystemHandler::requestBinderStats(int64_t time, int32_t kind) {
+    if (!mStatsUser) {
+        return 0;
+    }
+    dev_transmit_t transmit = {12, time, kind};
+    int32_t ret = KelvoDevice::requestBinderStats(&transmit);
+    if (ret < 0) {
+        KLOGE("Failed to request binder stats: %d", ret);
+        if (kind == 2) {
+            voteCandidate(time, kCandidateTick, kElectorBinderStats);
+        }
+        return ret;
+    }
+    if (kind == 2) {
+        mBinderHour = time;
+    }
+    return 0;
+}
+
+void SystemHandler::voteRemembered(int64_t* hour, int32_t candidate, uint32_t elector) {
+    if (*hour >= 0) {
+        voteCandidate(*hour, candidate, elector);
+        *hour = -1;
+    }
+}
+
+int32_t SystemHandler::handleBufferedLog(const Parcel& data) {
+    data.setDataPosition(0);
+    int64_t arrival = 0;
+    String8 sender;
+    int32_t magic = 0;
+    int32_t length = 0;
+    const void* bytes = nullptr;
+    bool ok = data.readInt64(&arrival) == android::NO_ERROR &&
+              data.readString8(&sender) == android::NO_ERROR &&
+              data.readInt32(&magic) == android::NO_ERROR &&
+              data.readInt32(&length) == android::NO_ERROR && length >= 1 &&
+              (bytes = data.readInplace(static_cast<size_t>(length))) != nullptr;
+    const uint8_t* entry = ok ? static_cast<const uint8_t*>(bytes) : nullptr;
+    const size_t size = ok ? static_cast<size_t>(length) : 0;
+    if (sender == kBufferedSender && magic == SERVICE_DAILY_STATISTICS) {
+        return handleDailyStatistics(entry, size);
+    }
+    if (sender == kDriverSender) {
+        switch (magic) {
+            case DRIVER_KWORKER:
+                return handleKworker(entry, size);
+            case DRIVER_UEVENT:
+                return handleUevent(entry, size);
+            case DRIVER_BINDER_STATS:
+                return handleBinderStats(entry, size);
+            default:
+                break;
+        }
+    }
+    HealthCounters::add(Health::BufferedEntryRefused);
+    KLOGE("Unknown buffered log type: %s", sender.c_str());
+    return -3;
+}
+
+namespace {
+
+int32_t refuseEntry() {
+    HealthCounters::add(Health::BufferedEntryRefused);
+    KLOGE("Invalid data length");
+    return -2;
+}
+
+}  // namespace
+
+int32_t SystemHandler::handleKworker(const uint8_t* data, size_t size) {
+    SystemRecords::echo head;
+    std::vector<SystemRecords::kworker> entries;
+    int32_t ret = SystemRecords::parseKworker(data, size, &head, &entries);
+    if (ret == 0 && !entries.empty()) {
+        Parcel rows;
+        for (const SystemRecords::kworker& k : entries) {
+            rows.writeInt64(head.time);
+            rows.writeString8(String8(k.symbol.c_str()));
+            rows.writeInt64(k.count);
+            rows.writeInt64(k.time);
+        }
+        insertEntries(k_raw_kworker, rows, static_cast<int32_t>(entries.size()), false);
+    }
+    voteRemembered(&mKworkerHour, kCandidateTick, kElectorKworker);
+    return ret < 0 ? refuseEntry() : 0;
+}
+
+int32_t SystemHandler::handleUevent(const uint8_t* data, size_t size) {
+    SystemRecords::echo head;
+    std::vector<SystemRecords::uevent> entries;
+    int32_t ret = SystemRecords::parseUevent(data, size, &head, &entries);
+    if (ret == 0 && !entries.empty()) {
+        Parcel rows;
+        for (const SystemRecords::uevent& u : entries) {
+            rows.writeInt64(head.time);
+            rows.writeString8(String8(u.devpath.c_str()));
+            rows.writeInt32(u.action);
+            rows.writeInt32(u.count);
+        }
+        insertEntries(k_raw_uevent, rows, static_cast<int32_t>(entries.size()), false);
+    }
+    voteRemembered(&mUeventHour, kCandidateTick, kElectorUevent);
+    return ret < 0 ? refuseEntry() : 0;
+}
+
+int32_t SystemHandler::handleBinderStats(const uint8_t* data, size_t size) {
+    SystemRecords::echo head;
+    std::vector<SystemRecords::binder_entry> entries;
+    int32_t ret = SystemRecords::parseBinderStats(data, size, &head, &entries);
+    if (ret < 0) {
+        // The vote of an awaited hourly answer is still cast.
+        voteRemembered(&mBinderHour, kCandidateTick, kElectorBinderStats);
+        return refuseEntry();
+    }
+    struct merged {
+        SystemRecords::binder_entry e;
+        int64_t forward;
+        int64_t backward;
+    };
+    std::vector<merged> rows;
+    std::map<std::pair<std::string, std::string>, size_t> index;
+    PackageProperty* packages = PackageProperty::getInstance();
+    for (SystemRecords::binder_entry& e : entries) {
+        String8 name;
+        if (packages->queryPackageByUidAndPid(e.serviceUid, e.servicePid, name) >= 0 &&
+            name.length() > 0) {
+            e.service = name.c_str();
+        }
+        name = String8();
+        if (packages->queryPackageByUidAndPid(e.clientUid, e.clientPid, name) >= 0 &&
+            name.length() > 0) {
+            e.client = name.c_str();
+        }
+        auto same = index.find({e.service, e.client});
+        if (same != index.end()) {
+            rows[same->second].forward += e.count;
+            continue;
+        }
+        auto swapped = index.find({e.client, e.service});
+        if (swapped != index.end()) {
+            rows[swapped->second].backward += e.count;
+            continue;
+        }
+        index[{e.service, e.client}] = rows.size();
+        rows.push_back({e, e.count, 0});
+    }
+    const std::string foreground = mForeground.c_str();
+    Parcel out;
+    int32_t count = 0;
+    for (size_t i = 0; i < rows.size(); ++i) {
+        const merged& m = rows[i];
+        out.writeInt64(mBinderPrevious);
+        out.writeInt64(head.time);
+        out.writeString8(String8(m.e.service.c_str()));
+        out.writeInt32(m.e.serviceUid);
+        out.writeInt32(m.e.servicePid);
+        out.writeString8(String8(m.e.client.c_str()));
+        out.writeInt32(m.e.clientUid);
+        out.writeInt32(m.e.clientPid);
+        out.writeInt32(KelvoUtils::saturateInt32(m.forward));
+        out.writeInt32(KelvoUtils::saturateInt32(m.backward));
+        out.writeInt32(!foreground.empty() && (foreground == m.e.service ||
+                                               foreground == m.e.client)
+                               ? 1
+                               : 0);
+        out.writeInt32(mScreenOn ? 1 : 0);
+        out.writeInt32(mChargerOnline ? 1 : 0);
+        if (++count == kMaxRowsPerInsert || i + 1 == rows.size()) {
+            insertEntries(k_raw_binder_stats, out, count, false);
+            out.setDataSize(0);
+            out.setDataPosition(0);
+            count = 0;
+        }
+    }
+    mBinderPrevious = head.time;
+    if (head.reason == 2) {
+        voteRemembered(&mBinderHour, kCandidateTick, kElectorBinderStats);
+    }
+    return 0;
+}
+
+int32_t SystemHandler::handleDailyStatistics(const uint8_t* data, size_t size) {
+    SystemRecords::daily_statistics record;
+    if (SystemRecords::parseDailyStatistics(data, size, &record) < 0) {
+        return refuseEntry();
+    }
+    static const char* const kNames[] = {
+        "storage_sdcard",           "storage_usb",         "settings_wlan_connection",
+        "settings_mobile_connection", "settings_power_saving", "settings_aod",
+        "settings_face_unlock",     "settings_inscreen_unlock",
+    };
+    const int64_t time = record.day;
+    Parcel rows;
+    auto add = [&rows, time](const char* name, long long value) {
+        rows.writeInt64(time);
+        rows.writeString8(String8(name));
+        rows.writeString8(String8::format("%lld", value));
+    };
+    add("storage_free", record.free);
+    add("storage_available", record.available);
+    for (int i = 0; i < 8; ++i) {
+        add(kNames[i], record.settings[i]);
+    }
+    insertEntries(k_daily_misc_data, rows, 10, false);
+    KLOGI("Free: %lld, Available: %lld, Sdcard: %d, Usb: %d, Wlan: %d, Mobile: %d, Power "
+          "saving: %d, Aod: %d, Face: %d, Inscreen: %d",
+          static_cast<long long>(record.free), static_cast<long long>(record.available),
+          record.settings[0], record.settings[1], record.settings[2], record.settings[3],
+          record.settings[4], record.settings[5], record.settings[6], record.settings[7]);
+    mDailyStatistics = record;
+    mDailyRecordSinceUpload = true;
+    voteRemembered(&mDailyHour, kCandidateDailyTick, kElectorDailyRecord | kElectorDailyStatistics);
     return 0;
 }
 
@@ -1095,6 +1372,8 @@ int32_t SystemHandler::onDailyTick(const Parcel& data) {
     if (ret < 0) {
         KLOGE("Failed to handle storage: %d", ret);
         elector |= kElectorDailyRecord | kElectorDailyStatistics;
+    } else {
+        mDailyHour = hour;
     }
     readDdr(hour);
     voteCandidate(hour, kCandidateDailyTick, elector);

@@ -11,6 +11,7 @@
 #include "handlers/DdrFrequencyReader.h"
 #include "handlers/KernelWakelockReader.h"
 #include "handlers/PartialWakelockTracker.h"
+#include "handlers/SystemRecords.h"
 #include "storage/TableAttribute.h"
 
 namespace kelvo {
@@ -58,6 +59,18 @@ public:
     static constexpr uint32_t kElectorMobilePhone = 0x100000;
     static constexpr uint32_t kElectorDdr = 0x400000;
     static constexpr uint32_t kElectorDailyRecord = 0x1000000;
+    // Declared only for the log user types that collect kernel statistics.
+    static constexpr uint32_t kElectorKworker = 0x80000;
+    static constexpr uint32_t kElectorUevent = 0x800000;
+    static constexpr uint32_t kElectorBinderStats = 0x2000000;
+    // Buffered-log entry types.
+    enum buffered_type : int32_t {
+        SERVICE_DAILY_STATISTICS = 0,
+        DRIVER_KWORKER = 1,
+        DRIVER_UEVENT = 2,
+        DRIVER_BINDER_STATS = 3,
+    };
+    static constexpr int32_t kMaxRowsPerInsert = 5000;
     // The votes of the accounting steps and of the uploads.
     static constexpr uint32_t kApplicationsVote = 0x2008;
     static constexpr uint32_t kComponentVote = 0x30;
@@ -118,8 +131,17 @@ public:
     int32_t onDawnUploading(const android::Parcel& data) override;
     int32_t logApplicationsAccounting(int64_t time) override;
     int32_t logComponentAccounting(int64_t time) override;
+    int32_t handleBufferedLog(const android::Parcel& data) override;
 
 private:
+    int32_t handleKworker(const uint8_t* data, size_t size);
+    int32_t handleUevent(const uint8_t* data, size_t size);
+    int32_t handleBinderStats(const uint8_t* data, size_t size);
+    int32_t handleDailyStatistics(const uint8_t* data, size_t size);
+    // Asks the kernel for binder statistics of kind k at t.
+    int32_t requestBinderStats(int64_t time, int32_t kind);
+    // Votes at the hour remembered with a request, once.
+    void voteRemembered(int64_t* hour, int32_t candidate, uint32_t elector);
     int32_t handleTimeChanged(int64_t time, const char* text);
     int32_t handleSuspend(int64_t time);
     int32_t handleResume(int64_t time);
@@ -176,6 +198,16 @@ private:
     PartialWakelockTracker mPartialWakelocks;
     DdrFrequencyReader mDdr;
     int32_t mDdrLevels;
+
+    // Kernel statistics are collected for some log user types only.
+    bool mStatsUser;
+    int64_t mKworkerHour;  // -1 when no answer is awaited
+    int64_t mUeventHour;
+    int64_t mBinderHour;
+    int64_t mDailyHour;
+    int64_t mBinderPrevious;  // end of the previous binder statistics answer
+    SystemRecords::daily_statistics mDailyStatistics;
+    bool mDailyRecordSinceUpload;
     int64_t mRepeatHour[4];
 };
 

@@ -396,3 +396,86 @@ TEST(DdrFrequencyReaderTest, TwelveLevels) {
 }
 
 }  // namespace
+
+namespace {
+
+// Little-endian record builder.
+struct Bytes {
+    std::string b;
+    template <typename T>
+    Bytes& put(T v) {
+        b.append(reinterpret_cast<const char*>(&v), sizeof(v));
+        return *this;
+    }
+    Bytes& text(const std::string& s, size_t size) {
+        std::string t = s.substr(0, size);
+        t.resize(size, '\0');
+        b += t;
+        return *this;
+    }
+};
+
+std::string binderEntry(const std::string& service, const std::string& client, int32_t count) {
+    Bytes e;
+    e.put<int32_t>(1000).put<int32_t>(1).text(service, 48);
+    e.put<int32_t>(1001).put<int32_t>(2).text(client, 48).put<int32_t>(count);
+    return e.b;
+}
+
+// Entries from the kernel driver and the framework: rows they leave, and
+// hostile ones refused whole (counted, no rows).
+TEST_F(SystemHandlerTest, BufferedRecords) {
+    auto send = [this](const char* sender, int32_t magic, const std::string& bytes) {
+        Parcel p;
+        p.writeInt64(kH);
+        p.writeString8(String8(sender));
+        p.writeInt32(magic);
+        p.writeInt32(static_cast<int32_t>(bytes.size()));
+        p.write(bytes.data(), bytes.size());
+        return mHandler->sendMessageSync(ParcelMessage(MESSAGE_BUFFERED_LOG, 0, p));
+    };
+    auto echo = [](int32_t n) { return Bytes().put<int64_t>(kH).put<int32_t>(2).put<int32_t>(n); };
+    // A full 48-byte name without its terminator stays within its field.
+    const std::string longName(48, 's');
+    Bytes binder = echo(3);
+    binder.b += binderEntry(longName, "b", 5) + binderEntry(longName, "b", 2) +
+                binderEntry("b", longName, 4);
+    Bytes kworker = echo(1);
+    kworker.text("worker_fn", 64).put<int64_t>(9).put<int64_t>(77);
+    Bytes daily;
+    daily.put<int32_t>(0).put<int64_t>(kH).put<int64_t>(111).put<int64_t>(222);
+    for (int i = 0; i < 8; ++i) daily.put<int32_t>(i);
+
+    const uint64_t refused = HealthCounters::get(Health::BufferedEntryRefused);
+    const struct {
+        const char* sender;
+        int32_t magic;
+        std::string bytes;
+        int32_t result;
+    } kEntries[] = {
+        {"kelvo_driver", 3, binder.b, 0},
+        {"kelvo_driver", 3, echo(4).b + binderEntry("x", "y", 1), -2},       // count beyond entry
+        {"kelvo_driver", 3, echo(-1).b, -2},                                   // negative count
+        {"kelvo_driver", 3, std::string(10, '\0'), -2},                        // short header
+        {"kelvo_driver", 1, kworker.b, 0},
+        {"kelvo_driver", 1, echo(1000000).b + kworker.b.substr(16), -2},       // huge count
+        {"kelvo_driver", 2, echo(0).b, 0},                                     // no uevents
+        {"KelvoService", 0, daily.b.substr(0, 59), -2},                        // short record
+        {"KelvoService", 0, daily.b, 0},
+        {"someone", 0, daily.b, -3},
+    };
+    for (const auto& e : kEntries) {
+        EXPECT_EQ(e.result, send(e.sender, e.magic, e.bytes)) << e.sender << " " << e.magic;
+    }
+    EXPECT_EQ(refused + 6, HealthCounters::get(Health::BufferedEntryRefused));
+    EXPECT_EQ(std::vector<std::string>{longName + "|b|7|4"},
+              rows("SELECT service, client, forward, backward FROM raw_binder_stats"));
+    EXPECT_EQ(std::vector<std::string>{"worker_fn|9|77"},
+              rows("SELECT symbol, count, time FROM raw_kworker"));
+    EXPECT_EQ((std::vector<std::string>{"storage_available|222", "storage_free|111",
+                                        "storage_usb|1"}),
+              rows("SELECT name, value FROM daily_misc_data WHERE name IN ('storage_free', "
+                   "'storage_available', 'storage_usb') ORDER BY name"));
+}
+
+}  // namespace
