@@ -8,6 +8,7 @@
 
 #include <algorithm>
 #include <fstream>
+#include <functional>
 #include <map>
 
 #include "HealthCounters.h"
@@ -21,6 +22,7 @@
 #include "core/Notifier.h"
 #include "kelvo/RootPath.h"
 #include "routines/PollingPayload.h"
+#include "storage/DataUploader.h"
 #include "utils/devices/KelvoDevice.h"
 #include "utils/KelvoUtils.h"
 #include "utils/LoggerMessage.h"
@@ -1459,22 +1461,255 @@ int32_t SystemHandler::logComponentAccounting(int64_t hour) {
     return insertEntries(k_hourly_system_suspend, row, 1, false);
 }
 
+namespace {
+
+constexpr uint32_t kClassPackage = 903009063;
+
+// Runs a query and hands each row's reply position to the reader; the
+// number of rows, or -17.
+int32_t forEachRow(const String8& sql, int32_t columns,
+                   const std::function<void(const Parcel&)>& read) {
+    Parcel reply;
+    int32_t rows = 0;
+    if (StorageOperator::queryEntriesSimple(sql, &reply, columns, rows) < 0) {
+        return -17;
+    }
+    for (int32_t r = 0; r < rows; ++r) {
+        read(reply);
+    }
+    return rows;
+}
+
+void formPackage(uint32_t id, const String8& name, Parcel& out) {
+    Parcel package;
+    DataUploader::formVarcharData(0, name.c_str(), SystemHandler::kMaxUploadName + 1, package);
+    DataUploader::formClassData(id, kClassPackage, package, out);
+}
+
+}  // namespace
+
+void SystemHandler::formComponentData(int64_t end, int64_t window, Parcel& out) {
+    const long long from = end - window;
+    const long long to = end;
+    int32_t ret = forEachRow(
+        String8::format("SELECT source, SUM(count) FROM hourly_wake_up_source WHERE timestamp > "
+                        "%lld AND timestamp <= %lld GROUP BY source ORDER BY SUM(count) DESC "
+                        "LIMIT %d",
+                        from, to, kTopSources),
+        2, [&out](const Parcel& r) {
+            Parcel e;
+            DataUploader::formVarcharData(0, r.readString8().c_str(), kMaxUploadName + 1, e);
+            DataUploader::formIntData(1, r.readInt64(), e);
+            DataUploader::formClassArray(29, 903009023, e, out);
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query wake up source data: %d", ret);
+    }
+    ret = forEachRow(
+        String8::format("SELECT name, tag, SUM(count) FROM hourly_applications_alarm WHERE "
+                        "timestamp > %lld AND timestamp <= %lld GROUP BY name, tag ORDER BY "
+                        "SUM(count) DESC LIMIT %d",
+                        from, to, kTopApplications),
+        3, [&out](const Parcel& r) {
+            String8 name = r.readString8();
+            String8 tag = r.readString8();
+            Parcel e;
+            formPackage(3, name, e);
+            formPackage(4, tag, e);
+            int32_t type = PackageProperty::getInstance()->getPackageType(name);
+            if (type >= 1) {
+                DataUploader::formIntData(5, type, e);
+            }
+            DataUploader::formIntData(2, r.readInt64(), e);
+            DataUploader::formClassArray(30, 903009024, e, out);
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query applications alarm data: %d", ret);
+    }
+    ret = forEachRow(
+        String8::format("SELECT name, tag, SUM(duration) FROM "
+                        "hourly_applications_partial_wakelock WHERE timestamp > %lld AND "
+                        "timestamp <= %lld GROUP BY name, tag ORDER BY SUM(duration) DESC LIMIT "
+                        "%d",
+                        from, to, kTopApplications),
+        3, [&out](const Parcel& r) {
+            String8 name = r.readString8();
+            String8 tag = r.readString8();
+            int64_t duration = r.readInt64();
+            KLOGD("%s %s %lld", name.c_str(), tag.c_str(), static_cast<long long>(duration));
+            Parcel e;
+            formPackage(5, name, e);
+            formPackage(6, tag, e);
+            int32_t type = PackageProperty::getInstance()->getPackageType(name);
+            if (type >= 1) {
+                DataUploader::formIntData(8, type, e);
+            }
+            DataUploader::formIntData(3, duration, e);
+            DataUploader::formClassArray(31, 903009025, e, out);
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query partial wakelock data: %d", ret);
+    }
+    ret = forEachRow(
+        String8::format("SELECT name, SUM(count), SUM(duration) FROM "
+                        "hourly_applications_kernel_wakelock WHERE timestamp > %lld AND "
+                        "timestamp <= %lld AND name != 'PowerManagerService.Display' AND name != "
+                        "'PowerManagerService.WakeLocks' AND name != 'charge_wakelock' AND name "
+                        "!= 'usb_wake_lock' GROUP BY name ORDER BY SUM(duration) DESC LIMIT %d",
+                        from, to, kTopApplications),
+        3, [&out](const Parcel& r) {
+            String8 name = r.readString8();
+            int64_t count = r.readInt64();
+            int64_t duration = r.readInt64();
+            KLOGD("%s %lld %lld", name.c_str(), static_cast<long long>(count),
+                  static_cast<long long>(duration));
+            Parcel e;
+            DataUploader::formVarcharData(0, name.c_str(), kMaxUploadName + 1, e);
+            DataUploader::formIntData(1, count, e);
+            DataUploader::formIntData(2, duration, e);
+            DataUploader::formClassArray(32, 903009026, e, out);
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query kernel wakelock data: %d", ret);
+    }
+}
+
+void SystemHandler::formStatisticsData(int64_t end, Parcel& out) {
+    const long long from = end - kDayMs;
+    const long long to = end;
+    int32_t ret = forEachRow(
+        String8::format("SELECT COUNT(*), SUM(duration) FROM hourly_system_suspend WHERE "
+                        "timestamp > %lld AND timestamp <= %lld",
+                        from, to),
+        2, [&out](const Parcel& r) {
+            if (r.readInt64() > 0) {
+                int64_t duration = r.readInt64();
+                KLOGD("duration: %lld", static_cast<long long>(duration));
+                DataUploader::formIntData(9, duration, out);
+            }
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query sum system suspend data: %d", ret);
+    }
+    ret = forEachRow(
+        String8::format("SELECT freq, SUM(duration) FROM raw_ddr_frequency WHERE timestamp > "
+                        "%lld AND timestamp <= %lld GROUP BY freq",
+                        from, to),
+        2, [&out](const Parcel& r) {
+            Parcel e;
+            DataUploader::formIntData(1, r.readInt64(), e);
+            DataUploader::formIntData(2, r.readInt64(), e);
+            DataUploader::formClassArray(15, 903009030, e, out);
+        });
+    if (ret < 0) {
+        KLOGE("Failed to query ddr frequency data: %d", ret);
+    }
+}
+
+void SystemHandler::formUserData(int64_t end, Parcel& out) {
+    // The day's statistics only when a record arrived since the last upload.
+    if (mDailyRecordSinceUpload) {
+        const SystemRecords::daily_statistics& d = mDailyStatistics;
+        DataUploader::formIntData(2, d.settings[0], out);
+        DataUploader::formIntData(3, d.settings[1], out);
+        DataUploader::formIntData(10, d.free, out);
+        DataUploader::formIntData(11, d.available, out);
+        DataUploader::formIntData(14, d.settings[2], out);
+        DataUploader::formIntData(15, d.settings[3], out);
+        DataUploader::formIntData(16, d.settings[4], out);
+        DataUploader::formIntData(17, d.settings[5], out);
+        DataUploader::formIntData(18, (d.settings[6] == 1 ? 1 : 0) | (d.settings[7] == 1 ? 2 : 0),
+                                  out);
+        mDailyRecordSinceUpload = false;
+    }
+    if (forEachRow(String8("SELECT module, version FROM module_cloud_update"), 2,
+                   [&out](const Parcel& r) {
+                       Parcel e;
+                       DataUploader::formVarcharData(0, r.readString8().c_str(),
+                                                     kMaxUploadName + 1, e);
+                       DataUploader::formVarcharData(1, r.readString8().c_str(), 33, e);
+                       DataUploader::formClassArray(13, 903009044, e, out);
+                   }) < 0) {
+        KLOGE("Failed to query module cloud update information");
+    }
+    const struct {
+        const char* type;
+        uint32_t id;
+    } kMemory[] = {{"MemFree:", 8}, {"MemAvailable:", 9}};
+    for (const auto& m : kMemory) {
+        Parcel ranges;
+        bool bad = false;
+        int32_t rows = forEachRow(
+            String8::format("SELECT range, COUNT(type) FROM raw_memory_range WHERE type = '%s' "
+                            "AND timestamp > %lld AND timestamp <= %lld GROUP BY range",
+                            m.type, static_cast<long long>(end - kDayMs),
+                            static_cast<long long>(end)),
+            2, [&ranges, &bad](const Parcel& r) {
+                int64_t range = r.readInt64();
+                int64_t count = r.readInt64();
+                if (range < 0 || range > 5) {
+                    bad = true;
+                    return;
+                }
+                DataUploader::formIntData(static_cast<uint32_t>(range), count, ranges);
+            });
+        if (rows < 0) {
+            KLOGE("Failed to query accounting memory data");
+        } else if (rows > 6 || bad) {
+            KLOGE("Invalid memory range rows: %d", rows);
+        } else if (rows > 0) {
+            DataUploader::formClassData(m.id, 903009032, ranges, out);
+        }
+    }
+}
+
 int32_t SystemHandler::onHourlyUploading(const Parcel& data) {
     data.setDataPosition(0);
     data.readFloat();
-    return voteCandidate(data.readInt64(), kCandidateHourlyUpload, kPeriodUploadVote);
+    const int64_t end = data.readInt64();
+    forceFlushEntries();
+    Parcel out;
+    formComponentData(end, kHourMs, out);
+    if (setEventData(EVENT_HOURLY_COMPONENTS, out, true) < 0) {
+        KLOGE("Failed to set upload energy component data");
+    }
+    return voteCandidate(end, kCandidateHourlyUpload, kPeriodUploadVote);
 }
 
 int32_t SystemHandler::onDailyUploading(const Parcel& data) {
     data.setDataPosition(0);
     data.readFloat();
-    return voteCandidate(data.readInt64(), kCandidateDailyUpload, kDailyUploadVote);
+    const int64_t end = data.readInt64();
+    forceFlushEntries();
+    Parcel components;
+    formComponentData(end, kDayMs, components);
+    if (setEventData(EVENT_DAILY_COMPONENTS, components, true) < 0) {
+        KLOGE("Failed to set upload energy component data");
+    }
+    Parcel statistics;
+    formStatisticsData(end, statistics);
+    if (setEventData(EVENT_DAILY_SYSTEM, statistics, true) < 0) {
+        KLOGE("Failed to set upload energy statistics data");
+    }
+    Parcel users;
+    formUserData(end, users);
+    if (setEventData(EVENT_DAILY_USERS, users, true) < 0) {
+        KLOGE("Failed to set upload energy user data");
+    }
+    return voteCandidate(end, kCandidateDailyUpload, kDailyUploadVote);
 }
 
 int32_t SystemHandler::onDawnUploading(const Parcel& data) {
     data.setDataPosition(0);
     data.readFloat();
-    return voteCandidate(data.readInt64(), kCandidateDawnUpload, kPeriodUploadVote);
+    const int64_t end = data.readInt64();
+    forceFlushEntries();
+    Parcel out;
+    formComponentData(end, 21600000, out);
+    if (setEventData(EVENT_DAILY_COMPONENTS, out, true) < 0) {
+        KLOGE("Failed to set upload energy component data");
+    }
+    return voteCandidate(end, kCandidateDawnUpload, kPeriodUploadVote);
 }
 
 }  // namespace kelvo

@@ -133,7 +133,16 @@ public:
     int32_t logComponentAccounting(int64_t time) override;
     int32_t handleBufferedLog(const android::Parcel& data) override;
 
+    // Array lengths of the uploads.
+    static constexpr int32_t kTopSources = 10;
+    static constexpr int32_t kTopApplications = 20;
+    static constexpr int32_t kMaxUploadName = 100;
+
 private:
+    // The four arrays of the energy component data over (end - window, end].
+    void formComponentData(int64_t end, int64_t window, android::Parcel& out);
+    void formStatisticsData(int64_t end, android::Parcel& out);
+    void formUserData(int64_t end, android::Parcel& out);
     int32_t handleKworker(const uint8_t* data, size_t size);
     int32_t handleUevent(const uint8_t* data, size_t size);
     int32_t handleBinderStats(const uint8_t* data, size_t size);

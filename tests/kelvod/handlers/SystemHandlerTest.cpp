@@ -8,7 +8,17 @@
 #include <string>
 #include <vector>
 
+#include <json/json.h>
+
+#include <chrono>
+
 #include "HealthCounters.h"
+#include "core/AppsAccounting.h"
+#include "core/KelvoAgent.h"
+#include "kelvo/WallClock.h"
+#include "routines/HourlyRoutine.h"
+#include "routines/PollingRoutine.h"
+#include "storage/DataUploader.h"
 #include "core/Dispatcher.h"
 #include "core/Notifier.h"
 #include "handlers/KernelWakelockReader.h"
@@ -476,6 +486,82 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
                                         "storage_usb|1"}),
               rows("SELECT name, value FROM daily_misc_data WHERE name IN ('storage_free', "
                    "'storage_available', 'storage_usb') ORDER BY name"));
+}
+
+}  // namespace
+
+namespace {
+
+// The real hourly and polling routines around the system handler: a round
+// it takes part in ends on its votes, not on the one-minute time-out, and
+// the hour's wake-ups reach the hourly upload.
+class SystemRoundTest : public SystemHandlerTest {
+protected:
+    void addTables() override {
+        setenv("TZ", "UTC", 1);
+        tzset();
+        WallClock::setFixedTimeMs(kH - 600000);
+        SystemHandlerTest::addTables();
+        HourlyRoutine::setVoteTimeoutMs(0);
+        mRoutine = new HourlyRoutine();
+        mPolling = new PollingRoutine();
+        for (StorageOperator* op : {static_cast<StorageOperator*>(mRoutine.get()),
+                                    static_cast<StorageOperator*>(mPolling.get()),
+                                    static_cast<StorageOperator*>(AppsAccounting::getInstance()),
+                                    static_cast<StorageOperator*>(DataUploader::getInstance())}) {
+            op->addSchemaTable();
+        }
+    }
+    void SetUp() override {
+        SystemHandlerTest::SetUp();
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_POLLING, mPolling);
+        for (const sp<KelvoOperator>& op : {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
+            op->earlyInitialize();
+            op->initialize();
+        }
+        // The handler's electors, now that the routine runs.
+        mHandler->setCandidateElector();
+    }
+    void TearDown() override {
+        for (const sp<KelvoOperator>& op : {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
+            op->readyToDestroy();
+            op->requestThreadExit();
+            op->join();
+        }
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_POLLING, nullptr);
+        SystemHandlerTest::TearDown();
+        WallClock::setFixedTimeMs(-1);
+        unsetenv("TZ");
+        tzset();
+    }
+
+    sp<HourlyRoutine> mRoutine;
+    sp<PollingRoutine> mPolling;
+};
+
+TEST_F(SystemRoundTest, RoundEndsOnTheHandlersVotes) {
+    run({S, -300000, ""});
+    run({W, -200000, "irq=X gpio=0"});
+    run({R, -100000, ""});
+    const std::string ticks = "SELECT id FROM debug_hourly_tick";
+    const uint64_t refused = HealthCounters::get(Health::RoutineRequestsRefused);
+    auto started = std::chrono::steady_clock::now();
+    WallClock::setFixedTimeMs(kH + 500);
+    mRoutine->sendMessage(ParcelMessage(MESSAGE_TIMER, HourlyRoutine::kHourlyTimerId));
+    ASSERT_TRUE(waitFor([&] { return !rows(ticks).empty(); }, std::chrono::milliseconds(30000)));
+    EXPECT_LT(std::chrono::steady_clock::now() - started, std::chrono::seconds(20));
+    EXPECT_EQ(refused, HealthCounters::get(Health::RoutineRequestsRefused));
+    EXPECT_EQ(std::vector<std::string>{at(0) + "|200000|1"},
+              rows("SELECT timestamp, duration, count FROM hourly_system_suspend"));
+    bool uploaded = false;
+    for (const Json::Value& e : events()) {
+        if (e["event"].asUInt() == EVENT_HOURLY_COMPONENTS) {
+            uploaded = uploaded || e["params"]["29"][0]["params"]["0"].asString() == "X";
+        }
+    }
+    EXPECT_TRUE(uploaded);
 }
 
 }  // namespace
