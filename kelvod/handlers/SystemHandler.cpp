@@ -170,7 +170,10 @@ const char* const kTagNames[SystemHandler::TAG_COUNT] = {
     "KELVO_TAG_KERNEL_WAKEUP",  "KELVO_TAG_ALARM_TRIGGER",  "KELVO_TAG_ALARM_WORKSOURCE",
     "KELVO_TAG_PACKAGE_REMOVED", "KELVO_TAG_PACKAGE_ADDED", "KELVO_TAG_UID_REMOVED",
     "KELVO_TAG_BOOT_COMPLETED", "KELVO_TAG_SHUTDOWN",       "KELVO_TAG_PHONE_STATE",
-    "KELVO_TAG_RESET_BATTERY_STAT",
+    "KELVO_TAG_RESET_BATTERY_STAT", "KELVO_TAG_WAKE_STATUS", "KELVO_TAG_FREEZING_FAILED",
+    "KELVO_TAG_MODEM_WAKEUP_SOURCE", "KELVO_TAG_AP_WAKE_IRQ", "KELVO_TAG_KERNEL_WAKEUP_PACKET",
+    "KELVO_TAG_SENSORHUB_WAKE", "KELVO_TAG_WIFI_WAKE_IPV4", "KELVO_TAG_CLOUD_UPDATE",
+    "KELVO_TAG_PM_SCENE", "KELVO_TAG_APP_WAKEUP",
 };
 
 // How long the kernel has been up, in ms.
@@ -417,7 +420,13 @@ int32_t SystemHandler::handleLogger(int64_t time, int32_t tag, const char* text)
             WakelockManager::getInstance()->noteResetBatteryStats();
             mPartialWakelocks.clear();
             return 0;
+        case TAG_WIFI_WAKE_IPV4:
+            mLastWifiWakeTime = time;
+            return 0;
         default:
+            if (tag > TAG_RESET_BATTERY_STAT && tag < TAG_COUNT) {
+                return handleRecord(time, tag, text);
+            }
             KLOGE("Unknown message type: %d", tag);
             return -3;
     }
@@ -848,6 +857,108 @@ int32_t SystemHandler::handlePhoneState(int64_t time, const char* text) {
     note.writeInt32(state);
     note.writeInt32(subId);
     return sendNotification(NOTIFICATION_PHONE_STATE_CHANGED, note);
+}
+
+int32_t SystemHandler::handleRecord(int64_t time, int32_t tag, const char* text) {
+    Parcel row;
+    row.writeInt64(time);
+    const table_attribute* table = nullptr;
+    int32_t v[7] = {};
+    std::string a;
+    std::string b;
+    bool ok = true;
+    switch (tag) {
+        case TAG_WAKE_STATUS: {
+            static const char* const kKeys[] = {"ap=",    "modem=",    "hifi=",    "iomcu=",
+                                                "sevra=", "hotplug0=", "hotplug1="};
+            for (int i = 0; ok && i < 7; ++i) {
+                ok = parseInt(text, kKeys[i], i < 6 ? kKeys[i + 1] : nullptr, &v[i]) == 0;
+                row.writeInt32(v[i]);
+            }
+            table = &k_raw_wake_status;
+            break;
+        }
+        case TAG_FREEZING_FAILED:
+        case TAG_AP_WAKE_IRQ:
+            ok = parseText(text, "name=", nullptr, kNameSize, &a) == 0;
+            row.writeString8(String8(a.c_str()));
+            table = tag == TAG_AP_WAKE_IRQ ? &k_raw_ap_wake_irq : &k_raw_freezing_failed;
+            if (tag == TAG_AP_WAKE_IRQ && mChargerOnline) {
+                return 0;
+            }
+            break;
+        case TAG_MODEM_WAKEUP_SOURCE:
+            ok = parseInt(text, "type=", "source=", &v[0]) == 0 &&
+                 parseText(text, "source=", nullptr, 256, &a) == 0;
+            row.writeInt32(v[0]);
+            row.writeString8(String8(a.c_str()));
+            table = &k_raw_modem_wakeup_source;
+            break;
+        case TAG_WAKEUP_PACKET: {
+            ok = parseInt(text, "net=", "uid=", &v[0]) == 0 &&
+                 parseInt(text, "uid=", "pid=", &v[1]) == 0 &&
+                 parseInt(text, "pid=", "protocol=", &v[2]) == 0 &&
+                 parseInt(text, "protocol=", nullptr, &v[3]) == 0;
+            String8 name;
+            if (ok && (PackageProperty::getInstance()->queryPackageByUidAndPid(v[1], v[2], name) <
+                           0 ||
+                       name.length() == 0)) {
+                name = String8::format("uid_%d", v[1]);
+            }
+            row.writeString8(name);
+            row.writeInt32(v[0]);
+            row.writeInt32(v[3]);
+            table = &k_raw_wake_up_packet;
+            break;
+        }
+        case TAG_SENSORHUB_WAKE: {
+            long long data = LLONG_MIN;
+            ok = parseMessage(text, "data=", nullptr, "%lld", &data, sizeof(data)) == 0 &&
+                 data >= 0 && data <= UINT32_MAX;
+            row.writeInt32(static_cast<int32_t>(data >> 16));
+            row.writeInt32(static_cast<int32_t>(data & 0xFFFF));
+            table = &k_raw_sensorhub_wake;
+            break;
+        }
+        case TAG_CLOUD_UPDATE:
+            ok = parseText(text, "module=", "version=", kNameSize, &a) == 0 &&
+                 parseText(text, "version=", nullptr, kNameSize, &b) == 0;
+            if (ok) {
+                row.writeString8(String8(a.c_str()));
+                row.writeString8(String8(b.c_str()));
+                String8 condition =
+                    String8::format("module = %s", KelvoUtils::quoteSqlText(a.c_str()).c_str());
+                return updateEntries(k_module_cloud_update, row, condition.c_str());
+            }
+            break;
+        case TAG_PM_SCENE:
+            ok = parseInt(text, "scene=", "name=", &v[0]) == 0 &&
+                 parseText(text, "name=", "state=", kNameSize, &a) == 0 &&
+                 parseInt(text, "state=", nullptr, &v[1]) == 0;
+            row.writeString8(String8(a.c_str()));
+            row.writeInt32(v[0]);
+            row.writeInt32(v[1]);
+            table = &k_raw_pelmora_scene;
+            break;
+        case TAG_APP_WAKEUP:
+            ok = parseText(text, "procname=", "source=", kNameSize, &a) == 0 &&
+                 parseText(text, "source=", "gpio=", kNameSize, &b) == 0 &&
+                 parseInt(text, "gpio=", nullptr, &v[0]) == 0;
+            if (v[0] >= 1) {
+                b = "GPIO" + std::to_string(v[0]);
+            }
+            row.writeString8(String8(a.c_str()));
+            row.writeString8(String8(b.c_str()));
+            table = &k_raw_app_wakeup;
+            break;
+        default:
+            KLOGE("Unknown message type: %d", tag);
+            return -3;
+    }
+    if (!ok || table == nullptr) {
+        return refuse("Failed to parse message");
+    }
+    return insertEntries(*table, row, 1, false);
 }
 
 int32_t SystemHandler::insertMiscData(const Parcel& data) {

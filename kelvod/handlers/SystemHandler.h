@@ -38,7 +38,17 @@ public:
         TAG_SHUTDOWN = 10,
         TAG_PHONE_STATE = 11,
         TAG_RESET_BATTERY_STAT = 12,
-        TAG_COUNT = 13,
+        TAG_WAKE_STATUS = 13,
+        TAG_FREEZING_FAILED = 14,
+        TAG_MODEM_WAKEUP_SOURCE = 15,
+        TAG_AP_WAKE_IRQ = 16,
+        TAG_WAKEUP_PACKET = 17,
+        TAG_SENSORHUB_WAKE = 18,
+        TAG_WIFI_WAKE_IPV4 = 19,
+        TAG_CLOUD_UPDATE = 20,
+        TAG_PM_SCENE = 21,
+        TAG_APP_WAKEUP = 22,
+        TAG_COUNT = 23,
     };
     // Customized messages.
     enum system_message : int32_t {
@@ -162,6 +172,8 @@ private:
     int32_t handleBootCompleted(int64_t time);
     int32_t handleShutDown(int64_t time);
     int32_t handlePhoneState(int64_t time, const char* text);
+    // The records written as one row each.
+    int32_t handleRecord(int64_t time, int32_t tag, const char* text);
     int32_t checkAlarmWakeup(int64_t wake);
     int32_t checkWifiWake(int64_t wake);
     int32_t insertMiscData(const android::Parcel& data);

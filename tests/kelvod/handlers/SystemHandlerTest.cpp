@@ -200,7 +200,18 @@ INSTANTIATE_TEST_SUITE_P(
                   {PR, 4000, "uid=10011 name=x'OR'1'='1"}},
                  "SELECT name FROM raw_package_version UNION ALL "
                  "SELECT name || ':' || state FROM raw_package_state WHERE name = 'com.keep'",
-                 {"com.keep", "com.keep:1"}}),
+                 {"com.keep", "com.keep:1"}},
+        Scenario{"CloudUpdateReplacesItsModule",
+                 {{SystemHandler::TAG_CLOUD_UPDATE, 1000, "module=a'b version=1"},
+                  {SystemHandler::TAG_CLOUD_UPDATE, 2000, "module=c version=9"},
+                  {SystemHandler::TAG_CLOUD_UPDATE, 3000, "module=a'b version=2"}},
+                 "SELECT module, version FROM module_cloud_update ORDER BY module",
+                 {"a'b|2", "c|9"}},
+        Scenario{"SensorHubSourceAndReason",
+                 {{SystemHandler::TAG_SENSORHUB_WAKE, 1000, "data=196613"},
+                  {SystemHandler::TAG_SENSORHUB_WAKE, 2000, "data=x"}},
+                 "SELECT source, reason FROM raw_sensorhub_wake",
+                 {"3|5"}}),
     [](const ::testing::TestParamInfo<Scenario>& info) { return std::string(info.param.name); });
 
 // A package added twice keeps one version row: the newest.
