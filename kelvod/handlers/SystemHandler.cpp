@@ -11,6 +11,8 @@
 #include <functional>
 #include <map>
 
+#include <cutils/properties.h>
+
 #include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "binder/managers/PackageManager.h"
@@ -223,6 +225,12 @@ int32_t parseInt(const char* text, const char* key, const char* next, int32_t* o
     return 0;
 }
 
+std::string readProperty(const char* name) {
+    char value[PROPERTY_VALUE_MAX] = {};
+    property_get(name, value, "");
+    return value;
+}
+
 int32_t refuse(const char* what) {
     HealthCounters::add(Health::LoggerMessageRefused);
     KLOGE("%s", what);
@@ -376,6 +384,23 @@ int32_t SystemHandler::lateInitialize() {
         KLOGI("Initial error log count: %lld", static_cast<long long>(count));
     } else {
         KLOGE("Failed to query error log count: %d", rows);
+    }
+    // The versions, one row per key.
+    const struct {
+        const char* key;
+        std::string value;
+    } kVersions[] = {
+        {"kelvod_version", "000.1.4.0"},
+        {"product_version", readProperty("ro.build.description")},
+        {"software_version", readProperty("ro.build.display.id")},
+    };
+    for (const auto& v : kVersions) {
+        Parcel row;
+        row.writeInt64(KelvoAgent::getInstance()->getSystemBootTime());
+        row.writeString8(String8(v.key));
+        row.writeString8(String8(v.value.c_str()));
+        updateEntries(k_about_kelvo_daemon, row,
+                      String8::format("key = %s", KelvoUtils::quoteSqlText(v.key).c_str()).c_str());
     }
     // Nothing read the current state yet: the first poll only sets the baseline.
     std::vector<KernelWakelockReader::increment> ignored;
