@@ -44,6 +44,7 @@ constexpr const char* kWakeupSourcesPath = "/proc/wakeup_sources";
 constexpr const char* kBufferedSender = "KelvoService";
 constexpr const char* kDriverSender = "kelvo_driver";
 constexpr int32_t kRequestDailyStatistics = 0;
+constexpr int32_t kRequestMobilePhone = 1;
 constexpr int32_t kRequestPackageList = 2;
 
 // Causes of repeated per-poll lines.
@@ -260,6 +261,7 @@ SystemHandler::SystemHandler()
       mUeventHour(-1),
       mBinderHour(-1),
       mDailyHour(-1),
+      mMobileHour(-1),
       mBinderPrevious(KelvoAgent::getInstance()->getSystemBootTime()),
       mDailyRecordSinceUpload(false),
       mRepeatHour{-1, -1, -1, -1} {
@@ -325,7 +327,9 @@ void SystemHandler::setupListeners(Parcel& out) {
     for (int32_t type : kNotifications) {
         addNotifierListener(type, out);
     }
-    addBufferedLogReceiver(kBufferedSender, SERVICE_DAILY_STATISTICS, out);
+    for (int32_t type : {SERVICE_DAILY_STATISTICS, SERVICE_MOBILE_PHONE, SERVICE_PACKAGE_VERSIONS}) {
+        addBufferedLogReceiver(kBufferedSender, type, out);
+    }
     for (int32_t type : {DRIVER_KWORKER, DRIVER_UEVENT, DRIVER_BINDER_STATS}) {
         addBufferedLogReceiver(kDriverSender, type, out);
     }
@@ -1254,7 +1258,16 @@ int32_t SystemHandler::onDataPolling(const Parcel& data) {
         KLOGD("Failed to handle wakelock: %d", ret);
     }
     if (hourly) {
-        voteCandidate(poll.hour, kCandidateTick, kElectorWakelock | kElectorMobilePhone);
+        voteCandidate(poll.hour, kCandidateTick, kElectorWakelock);
+        int32_t request = 0;
+        ret = BufferedLogServer::getInstance()->requestLogMessage(
+            String8(kBufferedSender), kRequestMobilePhone, &request, 0);
+        if (ret < 0) {
+            KLOGD("Failed to handle mobile phone: %d", ret);
+            voteCandidate(poll.hour, kCandidateTick, kElectorMobilePhone);
+        } else {
+            mMobileHour = poll.hour;
+        }
     }
     return 0;
 }
@@ -1323,8 +1336,17 @@ int32_t SystemHandler::handleBufferedLog(const Parcel& data) {
               (bytes = data.readInplace(static_cast<size_t>(length))) != nullptr;
     const uint8_t* entry = ok ? static_cast<const uint8_t*>(bytes) : nullptr;
     const size_t size = ok ? static_cast<size_t>(length) : 0;
-    if (sender == kBufferedSender && magic == SERVICE_DAILY_STATISTICS) {
-        return handleDailyStatistics(entry, size);
+    if (sender == kBufferedSender) {
+        switch (magic) {
+            case SERVICE_DAILY_STATISTICS:
+                return handleDailyStatistics(entry, size);
+            case SERVICE_MOBILE_PHONE:
+                return handleMobilePhone(entry, size);
+            case SERVICE_PACKAGE_VERSIONS:
+                return handlePackageVersions(entry, size);
+            default:
+                break;
+        }
     }
     if (sender == kDriverSender) {
         switch (magic) {
@@ -1461,6 +1483,45 @@ int32_t SystemHandler::handleBinderStats(const uint8_t* data, size_t size) {
     mBinderPrevious = head.time;
     if (head.reason == 2) {
         voteRemembered(&mBinderHour, kCandidateTick, kElectorBinderStats);
+    }
+    return 0;
+}
+
+int32_t SystemHandler::handleMobilePhone(const uint8_t* data, size_t size) {
+    std::vector<SystemRecords::mobile_phone> entries;
+    int32_t ret = SystemRecords::parseMobilePhone(data, size, &entries);
+    KLOGD("size=%zu", entries.size());
+    if (ret == 0 && !entries.empty()) {
+        const int64_t time = TimeProvider::getCurrentTime(TIME_TYPE_WALL);
+        Parcel rows;
+        for (const SystemRecords::mobile_phone& m : entries) {
+            rows.writeInt64(time);
+            rows.writeInt32(m.subId);
+            rows.writeInt32(m.mcc);
+            rows.writeInt32(m.mnc);
+            rows.writeInt32(m.dataSwitch);
+            rows.writeInt32(m.voiceSwitch);
+        }
+        insertEntries(k_raw_mobile_phone, rows, static_cast<int32_t>(entries.size()), false);
+    }
+    voteRemembered(&mMobileHour, kCandidateTick, kElectorMobilePhone);
+    return ret < 0 ? refuseEntry() : 0;
+}
+
+int32_t SystemHandler::handlePackageVersions(const uint8_t* data, size_t size) {
+    std::vector<SystemRecords::package_version> entries;
+    if (SystemRecords::parsePackageVersions(data, size, &entries) < 0) {
+        return refuseEntry();
+    }
+    const int64_t time = TimeProvider::getCurrentTime(TIME_TYPE_WALL);
+    for (const SystemRecords::package_version& p : entries) {
+        Parcel row;
+        row.writeInt64(time);
+        row.writeString8(String8(p.name.c_str()));
+        row.writeString8(String8(p.version.c_str()));
+        updateEntries(k_raw_package_version, row,
+                      String8::format("name = %s", KelvoUtils::quoteSqlText(p.name.c_str()).c_str())
+                          .c_str());
     }
     return 0;
 }
@@ -1767,6 +1828,33 @@ void SystemHandler::formUserData(int64_t end, Parcel& out) {
                        DataUploader::formClassArray(13, 903009044, e, out);
                    }) < 0) {
         KLOGE("Failed to query module cloud update information");
+    }
+    // Mobile-phone data: read for the debug output only (nothing uploaded).
+    const long long from = end - kDayMs;
+    const long long to = end;
+    if (forEachRow(String8::format("SELECT COUNT(*), SUM(data_switch) FROM raw_mobile_phone "
+                                   "WHERE timestamp > %lld AND timestamp <= %lld",
+                                   from, to),
+                   2, [](const Parcel& r) {
+                       r.readInt64();
+                       KLOGD("network switch: %lld", static_cast<long long>(r.readInt64()));
+                   }) < 0) {
+        KLOGE("Failed to query network switch time: %d", -17);
+    }
+    // The latest row of each card: SQLite takes the bare columns from the
+    // row of MAX(timestamp).
+    if (forEachRow(String8::format("SELECT sub_id, mcc, mnc, MAX(timestamp) FROM "
+                                   "raw_mobile_phone WHERE timestamp > %lld AND timestamp <= "
+                                   "%lld GROUP BY sub_id",
+                                   from, to),
+                   4, [](const Parcel& r) {
+                       long long sub = r.readInt64();
+                       long long mcc = r.readInt64();
+                       long long mnc = r.readInt64();
+                       r.readInt64();
+                       KLOGD("sim card data: sub_id=%lld mcc=%lld mnc=%lld", sub, mcc, mnc);
+                   }) < 0) {
+        KLOGE("Failed to query mobile phone data: %d", -17);
     }
     const struct {
         const char* type;

@@ -76,6 +76,8 @@ public:
     // Buffered-log entry types.
     enum buffered_type : int32_t {
         SERVICE_DAILY_STATISTICS = 0,
+        SERVICE_MOBILE_PHONE = 1,
+        SERVICE_PACKAGE_VERSIONS = 2,
         DRIVER_KWORKER = 1,
         DRIVER_UEVENT = 2,
         DRIVER_BINDER_STATS = 3,
@@ -157,6 +159,8 @@ private:
     int32_t handleUevent(const uint8_t* data, size_t size);
     int32_t handleBinderStats(const uint8_t* data, size_t size);
     int32_t handleDailyStatistics(const uint8_t* data, size_t size);
+    int32_t handleMobilePhone(const uint8_t* data, size_t size);
+    int32_t handlePackageVersions(const uint8_t* data, size_t size);
     // Asks the kernel for binder statistics of kind k at t.
     int32_t requestBinderStats(int64_t time, int32_t kind);
     // Votes at the hour remembered with a request, once.
@@ -226,6 +230,7 @@ private:
     int64_t mUeventHour;
     int64_t mBinderHour;
     int64_t mDailyHour;
+    int64_t mMobileHour;
     int64_t mBinderPrevious;  // end of the previous binder statistics answer
     SystemRecords::daily_statistics mDailyStatistics;
     bool mDailyRecordSinceUpload;

@@ -89,6 +89,51 @@ int32_t SystemRecords::parseBinderStats(const uint8_t* data, size_t size, echo* 
     return 0;
 }
 
+namespace {
+
+// The count of a framework record when its entries fit.
+int32_t frameworkEntries(const uint8_t* data, size_t size, size_t entrySize) {
+    if (data == nullptr || size < 4) {
+        return -2;
+    }
+    int32_t n = readAt<int32_t>(data, 0);
+    if (n < 0 || n > SystemRecords::kMaxEntries || static_cast<size_t>(n) > (size - 4) / entrySize) {
+        return -2;
+    }
+    return n;
+}
+
+}  // namespace
+
+int32_t SystemRecords::parseMobilePhone(const uint8_t* data, size_t size,
+                                        std::vector<mobile_phone>* out) {
+    int32_t n = frameworkEntries(data, size, kMobilePhoneEntrySize);
+    if (n < 0) {
+        return -2;
+    }
+    for (int32_t i = 0; i < n; ++i) {
+        size_t at = 4 + i * kMobilePhoneEntrySize;
+        out->push_back({readAt<int32_t>(data, at), readAt<int32_t>(data, at + 4),
+                        readAt<int32_t>(data, at + 8), readAt<int32_t>(data, at + 12),
+                        readAt<int32_t>(data, at + 16)});
+    }
+    return 0;
+}
+
+int32_t SystemRecords::parsePackageVersions(const uint8_t* data, size_t size,
+                                            std::vector<package_version>* out) {
+    int32_t n = frameworkEntries(data, size, kPackageEntrySize);
+    if (n < 0) {
+        return -2;
+    }
+    for (int32_t i = 0; i < n; ++i) {
+        size_t at = 4 + i * kPackageEntrySize;
+        out->push_back({textAt(data, at, kPackageNameSize),
+                        textAt(data, at + kPackageNameSize, kPackageVersionSize)});
+    }
+    return 0;
+}
+
 int32_t SystemRecords::parseDailyStatistics(const uint8_t* data, size_t size,
                                             daily_statistics* out) {
     if (data == nullptr || size < kDailyStatisticsSize) {

@@ -23,6 +23,10 @@ public:
     static constexpr size_t kBinderEntrySize = 116;
     static constexpr size_t kBinderNameSize = 48;
     static constexpr size_t kDailyStatisticsSize = 60;
+    static constexpr size_t kMobilePhoneEntrySize = 20;  // five int32
+    static constexpr size_t kPackageNameSize = 128;
+    static constexpr size_t kPackageVersionSize = 32;
+    static constexpr size_t kPackageEntrySize = kPackageNameSize + kPackageVersionSize;
     static constexpr int32_t kMaxEntries = 4096;
 
     struct echo {
@@ -48,6 +52,17 @@ public:
         std::string client;
         int32_t count;
     };
+    struct mobile_phone {
+        int32_t subId;
+        int32_t mcc;
+        int32_t mnc;
+        int32_t dataSwitch;
+        int32_t voiceSwitch;
+    };
+    struct package_version {
+        std::string name;
+        std::string version;
+    };
     struct daily_statistics {
         int64_t day = 0;
         int64_t free = 0;
@@ -63,6 +78,11 @@ public:
                                std::vector<uevent>* out);
     static int32_t parseBinderStats(const uint8_t* data, size_t size, echo* head,
                                     std::vector<binder_entry>* out);
+    // Framework records: int32 n, then n entries.
+    static int32_t parseMobilePhone(const uint8_t* data, size_t size,
+                                    std::vector<mobile_phone>* out);
+    static int32_t parsePackageVersions(const uint8_t* data, size_t size,
+                                        std::vector<package_version>* out);
     static int32_t parseDailyStatistics(const uint8_t* data, size_t size, daily_statistics* out);
 };
 

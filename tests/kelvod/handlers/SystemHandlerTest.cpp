@@ -467,6 +467,12 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
     daily.put<int32_t>(0).put<int64_t>(kH).put<int64_t>(111).put<int64_t>(222);
     for (int i = 0; i < 8; ++i) daily.put<int32_t>(i);
 
+    Bytes phone;
+    phone.put<int32_t>(1).put<int32_t>(0).put<int32_t>(460).put<int32_t>(1).put<int32_t>(3);
+    phone.put<int32_t>(1);
+    Bytes package;
+    package.put<int32_t>(1).text("p'q", 128).text("1.0", 32);
+
     const uint64_t refused = HealthCounters::get(Health::BufferedEntryRefused);
     const struct {
         const char* sender;
@@ -484,13 +490,20 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
         {"KelvoService", 0, daily.b.substr(0, 59), -2},                        // short record
         {"KelvoService", 0, daily.b, 0},
         {"someone", 0, daily.b, -3},
+        {"KelvoService", 1, phone.b, 0},
+        {"KelvoService", 1, "\x02" + phone.b.substr(1), -2},                    // two counted, one sent
+        {"KelvoService", 2, package.b, 0},
     };
     for (const auto& e : kEntries) {
         EXPECT_EQ(e.result, send(e.sender, e.magic, e.bytes)) << e.sender << " " << e.magic;
     }
-    EXPECT_EQ(refused + 6, HealthCounters::get(Health::BufferedEntryRefused));
+    EXPECT_EQ(refused + 7, HealthCounters::get(Health::BufferedEntryRefused));
     EXPECT_EQ(std::vector<std::string>{longName + "|b|7|4"},
               rows("SELECT service, client, forward, backward FROM raw_binder_stats"));
+    EXPECT_EQ(std::vector<std::string>{"0|460|1|3|1"},
+              rows("SELECT sub_id, mcc, mnc, data_switch, voice_switch FROM raw_mobile_phone"));
+    EXPECT_EQ(std::vector<std::string>{"p'q|1.0"},
+              rows("SELECT name, version FROM raw_package_version"));
     EXPECT_EQ(std::vector<std::string>{"worker_fn|9|77"},
               rows("SELECT symbol, count, time FROM raw_kworker"));
     EXPECT_EQ((std::vector<std::string>{"storage_available|222", "storage_free|111",
