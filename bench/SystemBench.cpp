@@ -45,9 +45,9 @@ void BM_WakelockPass(benchmark::State& state) {
         std::vector<std::string> texts;
         texts.reserve(kPartials);
         for (int i = 0; i < kPartials; ++i) {
-            texts.push_back("uid=" + std::to_string(10000 + i) + " prevent_time=" +
-                            std::to_string(held) + " ws_name=com.bench.app" + std::to_string(i) +
-                            " tag=*job*/sync" + std::to_string(i));
+            texts.push_back("uid=" + std::to_string(10000 + i) +
+                            " prevent_time=" + std::to_string(held) + " ws_name=com.bench.app" +
+                            std::to_string(i) + " tag=*job*/sync" + std::to_string(i));
         }
         state.ResumeTiming();
         auto start = std::chrono::steady_clock::now();
@@ -56,9 +56,9 @@ void BM_WakelockPass(benchmark::State& state) {
         std::vector<kelvo::PartialWakelockTracker::increment> p;
         partial.update(texts, &p);
         benchmark::DoNotOptimize(k.size() + p.size());
-        totalMs += std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() -
-                                                             start)
-                       .count();
+        totalMs +=
+            std::chrono::duration<double, std::milli>(std::chrono::steady_clock::now() - start)
+                .count();
         ++passes;
     }
     state.counters["wakelock_pass_ms"] = passes > 0 ? totalMs / passes : 0;

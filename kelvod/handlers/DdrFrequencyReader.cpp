@@ -25,8 +25,8 @@ bool DdrFrequencyReader::parseLine(const std::string& line, int64_t* freq, int64
     size_t start = line.find_last_of(" \t:", last);
     start = start == std::string::npos ? 0 : start + 1;
     long long t = -1;
-    if (start <= static_cast<size_t>(consumed) ||
-        sscanf(line.c_str() + start, "%lld", &t) != 1 || t < 0) {
+    if (start <= static_cast<size_t>(consumed) || sscanf(line.c_str() + start, "%lld", &t) != 1 ||
+        t < 0) {
         KLOGE("Failed to parse duration: %lld", f);
         return false;
     }

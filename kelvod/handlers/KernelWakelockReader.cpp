@@ -28,8 +28,8 @@ bool KernelWakelockReader::parseLine(const std::string& line, std::string* name,
     name->assign(line, 0, end);
     long long c = -1;
     long long t = -1;
-    if (sscanf(line.c_str() + tab, "%lld %*s %*s %*s %*s %lld", &c, &t) != 2 || c < 0 ||
-        t < 0 || c > INT32_MAX) {
+    if (sscanf(line.c_str() + tab, "%lld %*s %*s %*s %*s %lld", &c, &t) != 2 || c < 0 || t < 0 ||
+        c > INT32_MAX) {
         return false;
     }
     *count = c;
@@ -107,8 +107,8 @@ int32_t KernelWakelockReader::read(const std::string& path, std::vector<incremen
             continue;
         }
         if (now.time - base.time >= kMinIncrementMs) {
-            out->push_back({entry.first, static_cast<int32_t>(now.count - base.count),
-                            now.time - base.time});
+            out->push_back(
+                {entry.first, static_cast<int32_t>(now.count - base.count), now.time - base.time});
             base.count = now.count;
             base.time = now.time;
         }

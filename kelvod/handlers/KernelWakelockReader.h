@@ -43,8 +43,7 @@ private:
         bool seen = false;
     };
     // One line into name, count and time; false for a line to skip.
-    static bool parseLine(const std::string& line, std::string* name, int64_t* count,
-                          int64_t* time);
+    static bool parseLine(const std::string& line, std::string* name, int64_t* count, int64_t* time);
 
     std::map<std::string, sample> mBaseline;
 };

@@ -1,5 +1,6 @@
 #include "handlers/SystemHandler.h"
 
+#include <cutils/properties.h>
 #include <limits.h>
 #include <stdio.h>
 #include <string.h>
@@ -11,25 +12,23 @@
 #include <functional>
 #include <map>
 
-#include <cutils/properties.h>
-
+#include "ErrorLogger.h"
 #include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "binder/managers/PackageManager.h"
 #include "binder/managers/WakelockManager.h"
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
-#include "ErrorLogger.h"
 #include "core/KelvoAgent.h"
 #include "core/Notifier.h"
 #include "kelvo/RootPath.h"
 #include "routines/PollingPayload.h"
 #include "storage/DataUploader.h"
-#include "utils/devices/KelvoDevice.h"
 #include "utils/KelvoUtils.h"
 #include "utils/LoggerMessage.h"
 #include "utils/PackageProperty.h"
 #include "utils/TimeProvider.h"
+#include "utils/devices/KelvoDevice.h"
 
 using android::Parcel;
 using android::String8;
@@ -64,12 +63,11 @@ constexpr int32_t kCandidateDailyTick = 5;
 constexpr int32_t kCandidateDailyUpload = 6;
 constexpr int32_t kCandidateDawnUpload = 8;
 
-#define TABLE(version, name, ...)                                                          \
-    const column_attribute k_##name##_columns[] = {__VA_ARGS__};                           \
-    const table_attribute k_##name = {version, 1,                                          \
-                                      static_cast<int32_t>(sizeof(k_##name##_columns) /   \
-                                                           sizeof(column_attribute)),     \
-                                      k_##name##_columns, #name};
+#define TABLE(version, name, ...)                                                                \
+    const column_attribute k_##name##_columns[] = {__VA_ARGS__};                                 \
+    const table_attribute k_##name = {                                                           \
+        version, 1, static_cast<int32_t>(sizeof(k_##name##_columns) / sizeof(column_attribute)), \
+        k_##name##_columns, #name};
 
 TABLE("1.1", raw_applications_alarm, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},
       {COLUMN_TEXT, "tag"}, {COLUMN_INT, "worksource"}, {COLUMN_INT, "count"})
@@ -83,9 +81,9 @@ TABLE("1.0", raw_kernel_wakelock, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "nam
       {COLUMN_INT, "count"}, {COLUMN_LONG, "duration"})
 TABLE("1.0", raw_time_changed, {COLUMN_TIME, "old_time"}, {COLUMN_TIME, "new_time"},
       {COLUMN_LONG, "delta"})
-TABLE("1.1", raw_wake_status, {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "ap"},
-      {COLUMN_INT, "modem"}, {COLUMN_INT, "hifi"}, {COLUMN_INT, "iomcu"}, {COLUMN_INT, "sevra"},
-      {COLUMN_INT, "hotplug0"}, {COLUMN_INT, "hotplug1"})
+TABLE("1.1", raw_wake_status, {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "ap"}, {COLUMN_INT, "modem"},
+      {COLUMN_INT, "hifi"}, {COLUMN_INT, "iomcu"}, {COLUMN_INT, "sevra"}, {COLUMN_INT, "hotplug0"},
+      {COLUMN_INT, "hotplug1"})
 TABLE("1.0", raw_freezing_failed, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"})
 TABLE("1.0", raw_modem_wakeup_source, {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "type"},
       {COLUMN_TEXT, "source"})
@@ -122,8 +120,7 @@ TABLE("1.0", raw_binder_stats, {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_t
       {COLUMN_TEXT, "client"}, {COLUMN_INT, "c_uid"}, {COLUMN_INT, "c_pid"},
       {COLUMN_INT, "forward"}, {COLUMN_INT, "backward"}, {COLUMN_INT, "foreground"},
       {COLUMN_INT, "screen"}, {COLUMN_INT, "charge"})
-TABLE("2.0", raw_app_type, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},
-      {COLUMN_LONG, "type"})
+TABLE("2.0", raw_app_type, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, {COLUMN_LONG, "type"})
 TABLE("1.0", hourly_applications_alarm, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},
       {COLUMN_TEXT, "tag"}, {COLUMN_INT, "worksource"}, {COLUMN_INT, "count"})
 TABLE("1.0", hourly_wake_up_source, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "source"},
@@ -132,8 +129,8 @@ TABLE("1.0", hourly_system_suspend, {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "du
       {COLUMN_INT, "count"})
 TABLE("1.0", hourly_applications_partial_wakelock, {COLUMN_TIME, "timestamp"},
       {COLUMN_TEXT, "name"}, {COLUMN_TEXT, "tag"}, {COLUMN_LONG, "duration"})
-TABLE("1.0", hourly_applications_kernel_wakelock, {COLUMN_TIME, "timestamp"},
-      {COLUMN_TEXT, "name"}, {COLUMN_INT, "count"}, {COLUMN_LONG, "duration"})
+TABLE("1.0", hourly_applications_kernel_wakelock, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},
+      {COLUMN_INT, "count"}, {COLUMN_LONG, "duration"})
 TABLE("1.0", daily_misc_data, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},
       {COLUMN_TEXT, "value"})
 TABLE("1.2", debug_start_up, {COLUMN_TIME, "timestamp"}, {COLUMN_LONG, "elapse_time"},
@@ -147,36 +144,63 @@ TABLE("1.0", module_cloud_update, {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "mod
 #undef TABLE
 
 const table_attribute* const kTables[] = {
-    &k_raw_applications_alarm, &k_raw_wake_up_source, &k_raw_system_suspend,
-    &k_raw_memory_range, &k_raw_partial_wakelock, &k_raw_kernel_wakelock,
-    &k_raw_time_changed, &k_raw_wake_status, &k_raw_freezing_failed,
-    &k_raw_modem_wakeup_source, &k_raw_package_state, &k_raw_kworker,
-    &k_raw_uevent, &k_raw_ap_wake_irq, &k_raw_mobile_phone,
-    &k_raw_wake_up_packet, &k_raw_ddr_frequency, &k_raw_sensorhub_wake,
-    &k_raw_devices_model, &k_raw_package_version, &k_raw_pelmora_strategy,
-    &k_raw_pelmora_scene, &k_raw_location_counter, &k_raw_app_wakeup,
-    &k_raw_binder_stats, &k_raw_app_type, &k_hourly_applications_alarm,
-    &k_hourly_wake_up_source, &k_hourly_system_suspend,
-    &k_hourly_applications_partial_wakelock, &k_hourly_applications_kernel_wakelock,
-    &k_daily_misc_data, &k_debug_start_up, &k_debug_error_log,
-    &k_about_kelvo_daemon, &k_module_cloud_update,
+    &k_raw_applications_alarm,
+    &k_raw_wake_up_source,
+    &k_raw_system_suspend,
+    &k_raw_memory_range,
+    &k_raw_partial_wakelock,
+    &k_raw_kernel_wakelock,
+    &k_raw_time_changed,
+    &k_raw_wake_status,
+    &k_raw_freezing_failed,
+    &k_raw_modem_wakeup_source,
+    &k_raw_package_state,
+    &k_raw_kworker,
+    &k_raw_uevent,
+    &k_raw_ap_wake_irq,
+    &k_raw_mobile_phone,
+    &k_raw_wake_up_packet,
+    &k_raw_ddr_frequency,
+    &k_raw_sensorhub_wake,
+    &k_raw_devices_model,
+    &k_raw_package_version,
+    &k_raw_pelmora_strategy,
+    &k_raw_pelmora_scene,
+    &k_raw_location_counter,
+    &k_raw_app_wakeup,
+    &k_raw_binder_stats,
+    &k_raw_app_type,
+    &k_hourly_applications_alarm,
+    &k_hourly_wake_up_source,
+    &k_hourly_system_suspend,
+    &k_hourly_applications_partial_wakelock,
+    &k_hourly_applications_kernel_wakelock,
+    &k_daily_misc_data,
+    &k_debug_start_up,
+    &k_debug_error_log,
+    &k_about_kelvo_daemon,
+    &k_module_cloud_update,
 };
 
 // Tables whose rows are kept (versions, strategies, cloud modules, types).
 const table_attribute* const kKeptTables[] = {
-    &k_about_kelvo_daemon, &k_raw_devices_model, &k_raw_package_version,
+    &k_about_kelvo_daemon,   &k_raw_devices_model,   &k_raw_package_version,
     &k_raw_pelmora_strategy, &k_module_cloud_update, &k_raw_app_type,
 };
 
 const char* const kTagNames[SystemHandler::TAG_COUNT] = {
-    "KELVO_TAG_TIME_CHANGED",   "KELVO_TAG_KERNEL_SUSPEND", "KELVO_TAG_KERNEL_RESUME",
-    "KELVO_TAG_KERNEL_WAKEUP",  "KELVO_TAG_ALARM_TRIGGER",  "KELVO_TAG_ALARM_WORKSOURCE",
-    "KELVO_TAG_PACKAGE_REMOVED", "KELVO_TAG_PACKAGE_ADDED", "KELVO_TAG_UID_REMOVED",
-    "KELVO_TAG_BOOT_COMPLETED", "KELVO_TAG_SHUTDOWN",       "KELVO_TAG_PHONE_STATE",
-    "KELVO_TAG_RESET_BATTERY_STAT", "KELVO_TAG_WAKE_STATUS", "KELVO_TAG_FREEZING_FAILED",
-    "KELVO_TAG_MODEM_WAKEUP_SOURCE", "KELVO_TAG_AP_WAKE_IRQ", "KELVO_TAG_KERNEL_WAKEUP_PACKET",
-    "KELVO_TAG_SENSORHUB_WAKE", "KELVO_TAG_WIFI_WAKE_IPV4", "KELVO_TAG_CLOUD_UPDATE",
-    "KELVO_TAG_PM_SCENE", "KELVO_TAG_APP_WAKEUP",
+    "KELVO_TAG_TIME_CHANGED",       "KELVO_TAG_KERNEL_SUSPEND",
+    "KELVO_TAG_KERNEL_RESUME",      "KELVO_TAG_KERNEL_WAKEUP",
+    "KELVO_TAG_ALARM_TRIGGER",      "KELVO_TAG_ALARM_WORKSOURCE",
+    "KELVO_TAG_PACKAGE_REMOVED",    "KELVO_TAG_PACKAGE_ADDED",
+    "KELVO_TAG_UID_REMOVED",        "KELVO_TAG_BOOT_COMPLETED",
+    "KELVO_TAG_SHUTDOWN",           "KELVO_TAG_PHONE_STATE",
+    "KELVO_TAG_RESET_BATTERY_STAT", "KELVO_TAG_WAKE_STATUS",
+    "KELVO_TAG_FREEZING_FAILED",    "KELVO_TAG_MODEM_WAKEUP_SOURCE",
+    "KELVO_TAG_AP_WAKE_IRQ",        "KELVO_TAG_KERNEL_WAKEUP_PACKET",
+    "KELVO_TAG_SENSORHUB_WAKE",     "KELVO_TAG_WIFI_WAKE_IPV4",
+    "KELVO_TAG_CLOUD_UPDATE",       "KELVO_TAG_PM_SCENE",
+    "KELVO_TAG_APP_WAKEUP",
 };
 
 // How long the kernel has been up, in ms.
@@ -204,8 +228,8 @@ std::string alarmTag(const std::string& tag) {
 int32_t parseText(const char* text, const char* key, const char* next, size_t size,
                   std::string* out) {
     char buffer[256] = {};
-    int32_t ret = parseMessage(text, key, next, "%s", buffer, size < sizeof(buffer) ? size
-                                                                                  : sizeof(buffer));
+    int32_t ret =
+        parseMessage(text, key, next, "%s", buffer, size < sizeof(buffer) ? size : sizeof(buffer));
     if (ret == 0) {
         out->assign(buffer);
     }
@@ -317,11 +341,11 @@ void SystemHandler::cleanTables(int64_t time) {
 
 void SystemHandler::setupListeners(Parcel& out) {
     static const int32_t kNotifications[] = {
-        NOTIFICATION_DATA_POLLING,          NOTIFICATION_HOURLY_TICK,
-        NOTIFICATION_DAILY_TICK,            NOTIFICATION_APPLICATIONS_ACCOUNTING,
-        NOTIFICATION_COMPONENT_ACCOUNTING,  NOTIFICATION_DAILY_UPLOADING,
-        NOTIFICATION_DAWN_UPLOADING,        NOTIFICATION_HOURLY_UPLOADING,
-        NOTIFICATION_SCREEN_STATE_CHANGED,  NOTIFICATION_CHARGER_ONLINE_CHANGED,
+        NOTIFICATION_DATA_POLLING,         NOTIFICATION_HOURLY_TICK,
+        NOTIFICATION_DAILY_TICK,           NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING, NOTIFICATION_DAILY_UPLOADING,
+        NOTIFICATION_DAWN_UPLOADING,       NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_SCREEN_STATE_CHANGED, NOTIFICATION_CHARGER_ONLINE_CHANGED,
         NOTIFICATION_FOREGROUND_CHANGED,
     };
     for (int32_t type : kNotifications) {
@@ -347,10 +371,14 @@ void SystemHandler::setCandidateElector() {
         std::vector<int32_t> candidates;
     };
     const elector_candidates kElectors[] = {
-        {kElectorWakelock, {1, 2, 4, 6, 8}}, {kElectorAlarm, {2, 4, 6, 8}},
-        {kElectorComponent, {3, 4, 6, 8}},   {kElectorComponentUpload, {3, 6}},
-        {kElectorMemory, {1, 6}},            {kElectorDailyStatistics, {5, 6}},
-        {kElectorMobilePhone, {1, 6}},       {kElectorDdr, {5, 6}},
+        {kElectorWakelock, {1, 2, 4, 6, 8}},
+        {kElectorAlarm, {2, 4, 6, 8}},
+        {kElectorComponent, {3, 4, 6, 8}},
+        {kElectorComponentUpload, {3, 6}},
+        {kElectorMemory, {1, 6}},
+        {kElectorDailyStatistics, {5, 6}},
+        {kElectorMobilePhone, {1, 6}},
+        {kElectorDdr, {5, 6}},
         {kElectorDailyRecord, {5, 6}},
     };
     for (const elector_candidates& e : kElectors) {
@@ -380,8 +408,7 @@ int32_t SystemHandler::lateInitialize() {
     insertStartUp(KelvoAgent::getInstance()->getSystemBootTime(), 0);
     Parcel reply;
     int32_t rows = 0;
-    if (queryEntriesSimple(String8("SELECT COUNT(*) FROM debug_error_log"), &reply, 1, rows) >=
-            0 &&
+    if (queryEntriesSimple(String8("SELECT COUNT(*) FROM debug_error_log"), &reply, 1, rows) >= 0 &&
         rows == 1) {
         int64_t count = reply.readInt64();
         ErrorLogger::setCounter(KelvoUtils::saturateInt32(count));
@@ -469,9 +496,8 @@ int32_t SystemHandler::handleTimeChanged(int64_t time, const char* text) {
     }
     const int64_t effective = delta + 10;
     const int64_t newTime = time + effective;
-    KLOGI("Original timestamp: %lld, new timestamp: %lld, delta: %lld",
-          static_cast<long long>(time), static_cast<long long>(newTime),
-          static_cast<long long>(effective));
+    KLOGI("Original timestamp: %lld, new timestamp: %lld, delta: %lld", static_cast<long long>(time),
+          static_cast<long long>(newTime), static_cast<long long>(effective));
     if (!(effective < 60000 && effective > -60000 && hourOf(time) == hourOf(newTime))) {
         Parcel note;
         note.writeInt64(time);
@@ -654,9 +680,9 @@ int32_t SystemHandler::handleAlarm(int64_t time, const char* text) {
         takeAlarm(alarm);
         mBatchCounter = 1;
         cancelAlarmTimeout();
-        int32_t id = sendMessageDelayed(ms2ns(kAlarmTimeoutMs),
-                                        ParcelMessage(MESSAGE_CUSTOMIZED, MESSAGE_ALARM_TIMEOUT,
-                                                      Parcel()));
+        int32_t id =
+            sendMessageDelayed(ms2ns(kAlarmTimeoutMs),
+                               ParcelMessage(MESSAGE_CUSTOMIZED, MESSAGE_ALARM_TIMEOUT, Parcel()));
         mAlarmTimeoutId = id >= 1 ? id : -1;
     } else if (mBatchCounter < mBatchSize) {
         takeAlarm(alarm);
@@ -788,8 +814,8 @@ int32_t SystemHandler::handlePackage(int64_t time, const char* text, bool added)
     state.writeString8(package);
     state.writeString8(version);
     insertEntries(k_raw_package_state, state, 1, false);
-    const String8 condition = String8::format("name = %s", KelvoUtils::quoteSqlText(name.c_str())
-                                                               .c_str());
+    const String8 condition =
+        String8::format("name = %s", KelvoUtils::quoteSqlText(name.c_str()).c_str());
     if (added) {
         // One row per name: the newest version replaces the older ones.
         Parcel row;
@@ -825,13 +851,13 @@ int32_t SystemHandler::handleBootCompleted(int64_t time) {
     insertStartUp(time, 1);
     Parcel reply;
     int32_t rows = 0;
-    int32_t ret = queryEntriesSimple(String8("SELECT COUNT(*) FROM raw_package_version"), &reply,
-                                     1, rows);
+    int32_t ret =
+        queryEntriesSimple(String8("SELECT COUNT(*) FROM raw_package_version"), &reply, 1, rows);
     // COUNT(*) always answers one row: the list is missing when it says 0.
     if (ret >= 0 && rows == 1 && reply.readInt64() == 0) {
         int32_t request = 0;
-        ret = BufferedLogServer::getInstance()->requestLogMessage(
-            String8(kBufferedSender), kRequestPackageList, &request, 0);
+        ret = BufferedLogServer::getInstance()->requestLogMessage(String8(kBufferedSender),
+                                                                  kRequestPackageList, &request, 0);
         if (ret < 0) {
             KLOGE("Failed to check package list: %d", ret);
         }
@@ -898,8 +924,8 @@ int32_t SystemHandler::handleRecord(int64_t time, int32_t tag, const char* text)
     bool ok = true;
     switch (tag) {
         case TAG_WAKE_STATUS: {
-            static const char* const kKeys[] = {"ap=",    "modem=",    "hifi=",    "iomcu=",
-                                                "sevra=", "hotplug0=", "hotplug1="};
+            static const char* const kKeys[] = {
+                "ap=", "modem=", "hifi=", "iomcu=", "sevra=", "hotplug0=", "hotplug1="};
             for (int i = 0; ok && i < 7; ++i) {
                 ok = parseInt(text, kKeys[i], i < 6 ? kKeys[i + 1] : nullptr, &v[i]) == 0;
                 row.writeInt32(v[i]);
@@ -929,9 +955,9 @@ int32_t SystemHandler::handleRecord(int64_t time, int32_t tag, const char* text)
                  parseInt(text, "pid=", "protocol=", &v[2]) == 0 &&
                  parseInt(text, "protocol=", nullptr, &v[3]) == 0;
             String8 name;
-            if (ok && (PackageProperty::getInstance()->queryPackageByUidAndPid(v[1], v[2], name) <
-                           0 ||
-                       name.length() == 0)) {
+            if (ok &&
+                (PackageProperty::getInstance()->queryPackageByUidAndPid(v[1], v[2], name) < 0 ||
+                 name.length() == 0)) {
                 name = String8::format("uid_%d", v[1]);
             }
             row.writeString8(name);
@@ -1181,10 +1207,9 @@ int32_t SystemHandler::readDdr(int64_t time) {
         rows.writeInt64(inc.first);
         rows.writeInt64(inc.second);
     }
-    return increments.empty()
-               ? 0
-               : insertEntries(k_raw_ddr_frequency, rows, static_cast<int32_t>(increments.size()),
-                               false);
+    return increments.empty() ? 0
+                              : insertEntries(k_raw_ddr_frequency, rows,
+                                              static_cast<int32_t>(increments.size()), false);
 }
 
 int32_t SystemHandler::onForegroundChanged(const Parcel& data) {
@@ -1260,8 +1285,8 @@ int32_t SystemHandler::onDataPolling(const Parcel& data) {
     if (hourly) {
         voteCandidate(poll.hour, kCandidateTick, kElectorWakelock);
         int32_t request = 0;
-        ret = BufferedLogServer::getInstance()->requestLogMessage(
-            String8(kBufferedSender), kRequestMobilePhone, &request, 0);
+        ret = BufferedLogServer::getInstance()->requestLogMessage(String8(kBufferedSender),
+                                                                  kRequestMobilePhone, &request, 0);
         if (ret < 0) {
             KLOGD("Failed to handle mobile phone: %d", ret);
             voteCandidate(poll.hour, kCandidateTick, kElectorMobilePhone);
@@ -1467,10 +1492,8 @@ int32_t SystemHandler::handleBinderStats(const uint8_t* data, size_t size) {
         out.writeInt32(m.e.clientPid);
         out.writeInt32(KelvoUtils::saturateInt32(m.forward));
         out.writeInt32(KelvoUtils::saturateInt32(m.backward));
-        out.writeInt32(!foreground.empty() && (foreground == m.e.service ||
-                                               foreground == m.e.client)
-                               ? 1
-                               : 0);
+        out.writeInt32(
+            !foreground.empty() && (foreground == m.e.service || foreground == m.e.client) ? 1 : 0);
         out.writeInt32(mScreenOn ? 1 : 0);
         out.writeInt32(mChargerOnline ? 1 : 0);
         if (++count == kMaxRowsPerInsert || i + 1 == rows.size()) {
@@ -1519,9 +1542,9 @@ int32_t SystemHandler::handlePackageVersions(const uint8_t* data, size_t size) {
         row.writeInt64(time);
         row.writeString8(String8(p.name.c_str()));
         row.writeString8(String8(p.version.c_str()));
-        updateEntries(k_raw_package_version, row,
-                      String8::format("name = %s", KelvoUtils::quoteSqlText(p.name.c_str()).c_str())
-                          .c_str());
+        updateEntries(
+            k_raw_package_version, row,
+            String8::format("name = %s", KelvoUtils::quoteSqlText(p.name.c_str()).c_str()).c_str());
     }
     return 0;
 }
@@ -1532,8 +1555,9 @@ int32_t SystemHandler::handleDailyStatistics(const uint8_t* data, size_t size) {
         return refuseEntry();
     }
     static const char* const kNames[] = {
-        "storage_sdcard",           "storage_usb",         "settings_wlan_connection",
-        "settings_mobile_connection", "settings_power_saving", "settings_aod",
+        "storage_sdcard",           "storage_usb",
+        "settings_wlan_connection", "settings_mobile_connection",
+        "settings_power_saving",    "settings_aod",
         "settings_face_unlock",     "settings_inscreen_unlock",
     };
     const int64_t time = record.day;
@@ -1549,11 +1573,12 @@ int32_t SystemHandler::handleDailyStatistics(const uint8_t* data, size_t size) {
         add(kNames[i], record.settings[i]);
     }
     insertEntries(k_daily_misc_data, rows, 10, false);
-    KLOGI("Free: %lld, Available: %lld, Sdcard: %d, Usb: %d, Wlan: %d, Mobile: %d, Power "
-          "saving: %d, Aod: %d, Face: %d, Inscreen: %d",
-          static_cast<long long>(record.free), static_cast<long long>(record.available),
-          record.settings[0], record.settings[1], record.settings[2], record.settings[3],
-          record.settings[4], record.settings[5], record.settings[6], record.settings[7]);
+    KLOGI(
+        "Free: %lld, Available: %lld, Sdcard: %d, Usb: %d, Wlan: %d, Mobile: %d, Power "
+        "saving: %d, Aod: %d, Face: %d, Inscreen: %d",
+        static_cast<long long>(record.free), static_cast<long long>(record.available),
+        record.settings[0], record.settings[1], record.settings[2], record.settings[3],
+        record.settings[4], record.settings[5], record.settings[6], record.settings[7]);
     mDailyStatistics = record;
     mDailyRecordSinceUpload = true;
     voteRemembered(&mDailyHour, kCandidateDailyTick, kElectorDailyRecord | kElectorDailyStatistics);
@@ -1600,8 +1625,8 @@ int32_t SystemHandler::logHourlyQuery(const char* sql, const table_attribute& ta
                                       int32_t columns, int64_t hour, const char* failure) {
     Parcel reply;
     int32_t rows = 0;
-    String8 query = String8::format(sql, static_cast<long long>(hour - kHourMs),
-                                    static_cast<long long>(hour));
+    String8 query =
+        String8::format(sql, static_cast<long long>(hour - kHourMs), static_cast<long long>(hour));
     if (queryEntriesSimple(query, &reply, columns, rows) < 0) {
         KLOGE("%s", failure);
         return -17;
@@ -1819,14 +1844,13 @@ void SystemHandler::formUserData(int64_t end, Parcel& out) {
                                   out);
         mDailyRecordSinceUpload = false;
     }
-    if (forEachRow(String8("SELECT module, version FROM module_cloud_update"), 2,
-                   [&out](const Parcel& r) {
-                       Parcel e;
-                       DataUploader::formVarcharData(0, r.readString8().c_str(),
-                                                     kMaxUploadName + 1, e);
-                       DataUploader::formVarcharData(1, r.readString8().c_str(), 33, e);
-                       DataUploader::formClassArray(13, 903009044, e, out);
-                   }) < 0) {
+    if (forEachRow(
+            String8("SELECT module, version FROM module_cloud_update"), 2, [&out](const Parcel& r) {
+                Parcel e;
+                DataUploader::formVarcharData(0, r.readString8().c_str(), kMaxUploadName + 1, e);
+                DataUploader::formVarcharData(1, r.readString8().c_str(), 33, e);
+                DataUploader::formClassArray(13, 903009044, e, out);
+            }) < 0) {
         KLOGE("Failed to query module cloud update information");
     }
     // Mobile-phone data: read for the debug output only (nothing uploaded).

@@ -54,10 +54,10 @@ public:
     enum system_message : int32_t {
         MESSAGE_ALARM_WAKEUP_CHECK = 0,  // int64 wake time
         MESSAGE_ALARM_TIMEOUT = 1,
-        MESSAGE_MISC_DATA = 2,           // int64 time, String8 name, String8 value
-        MESSAGE_ERROR_LOG = 3,           // int64 time, String8 line
+        MESSAGE_MISC_DATA = 2,  // int64 time, String8 name, String8 value
+        MESSAGE_ERROR_LOG = 3,  // int64 time, String8 line
         MESSAGE_FLUSH_ALL = 4,
-        MESSAGE_WIFI_WAKE_CHECK = 5,     // int64 wake time
+        MESSAGE_WIFI_WAKE_CHECK = 5,  // int64 wake time
     };
     // Elector bits.
     static constexpr uint32_t kElectorWakelock = 0x2000;

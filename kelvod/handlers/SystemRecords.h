@@ -17,9 +17,9 @@ public:
     static constexpr size_t kEchoSize = 12;
     static constexpr size_t kSymbolSize = 64;
     static constexpr size_t kDevpathSize = 128;
-    static constexpr size_t kKworkerEntrySize = kSymbolSize + 16;    // symbol, count, time
-    static constexpr size_t kUeventEntrySize = kDevpathSize + 8;     // devpath, action, count
-    static constexpr size_t kBinderHeaderSize = 16;                  // echo, count
+    static constexpr size_t kKworkerEntrySize = kSymbolSize + 16;  // symbol, count, time
+    static constexpr size_t kUeventEntrySize = kDevpathSize + 8;   // devpath, action, count
+    static constexpr size_t kBinderHeaderSize = 16;                // echo, count
     static constexpr size_t kBinderEntrySize = 116;
     static constexpr size_t kBinderNameSize = 48;
     static constexpr size_t kDailyStatisticsSize = 60;

@@ -3,29 +3,27 @@
 
 #include <binder/ServiceControl.h>
 #include <gtest/gtest.h>
+#include <json/json.h>
 #include <unistd.h>
 
+#include <chrono>
 #include <string>
 #include <vector>
 
-#include <json/json.h>
-
-#include <chrono>
-
 #include "HealthCounters.h"
 #include "core/AppsAccounting.h"
-#include "core/KelvoAgent.h"
-#include "kelvo/WallClock.h"
-#include "routines/HourlyRoutine.h"
-#include "routines/PollingRoutine.h"
-#include "storage/DataUploader.h"
 #include "core/Dispatcher.h"
+#include "core/KelvoAgent.h"
 #include "core/Notifier.h"
 #include "handlers/KernelWakelockReader.h"
 #include "handlers/SystemHandler.h"
 #include "kelvo/RootPath.h"
+#include "kelvo/WallClock.h"
 #include "kelvod/storage/StorageTestUtil.h"
+#include "routines/HourlyRoutine.h"
 #include "routines/PollingPayload.h"
+#include "routines/PollingRoutine.h"
+#include "storage/DataUploader.h"
 #include "utils/PackageProperty.h"
 
 using android::Parcel;
@@ -151,10 +149,7 @@ INSTANTIATE_TEST_SUITE_P(
                  kSuspends,
                  {at(-60000) + "|" + at(0), at(0) + "|" + at(kHour),
                   at(kHour) + "|" + at(2 * kHour), at(2 * kHour) + "|" + at(2 * kHour + 5)}},
-        Scenario{"ResumeWithoutWakeupWritesNothing",
-                 {{S, 1000, ""}, {R, 5000, ""}},
-                 kSuspends,
-                 {}},
+        Scenario{"ResumeWithoutWakeupWritesNothing", {{S, 1000, ""}, {R, 5000, ""}}, kSuspends, {}},
         Scenario{"LostSuspendCountsOnce",
                  {{S, 1000, ""},
                   {W, 4000, "irq=X gpio=0"},
@@ -222,6 +217,21 @@ TEST_F(SystemHandlerTest, PackageVersionKeepsOneRowPerName) {
               rows("SELECT timestamp FROM raw_package_version WHERE name = 'com.twice'"));
     PackageProperty::getInstance()->removeUid(10010);
     PackageProperty::getInstance()->removeUid(10011);
+}
+
+// Error lines forwarded by the agent become rows; a malformed one is counted.
+TEST_F(SystemHandlerTest, ErrorLinesAreStored) {
+    const uint64_t dropped = HealthCounters::get(Health::ErrorRowsDropped);
+    Parcel line;
+    line.writeInt64(kH);
+    line.writeString8(String8("[X.cpp] f# it's broken"));
+    EXPECT_EQ(0, mHandler->sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, 3, line)));
+    Parcel shortLine;
+    shortLine.writeInt32(1);
+    EXPECT_EQ(-5, mHandler->sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, 3, shortLine)));
+    EXPECT_EQ(std::vector<std::string>{at(0) + "|[X.cpp] f# it's broken"},
+              rows("SELECT timestamp, error_log FROM debug_error_log"));
+    EXPECT_EQ(dropped + 1, HealthCounters::get(Health::ErrorRowsDropped));
 }
 
 // A batch closed by its last alarm leaves no time-out behind: no "Invalid
@@ -303,8 +313,9 @@ TEST_F(SystemHandlerTest, MemoryRanges) {
 // Kernel wakelock increments, reading after reading.
 TEST(KernelWakelockReaderTest, IncrementsBetweenReadings) {
     kelvo::test::TempRoot root;
-    const std::string title = "name\t\tactive_count\tevent_count\twakeup_count\texpire_count\t"
-                              "active_since\ttotal_time\tmax_time\tlast_change\tprevent\n";
+    const std::string title =
+        "name\t\tactive_count\tevent_count\twakeup_count\texpire_count\t"
+        "active_since\ttotal_time\tmax_time\tlast_change\tprevent\n";
     auto line = [](const std::string& name, int count, long long time) {
         return name + "\t\t" + std::to_string(count) + "\t\t0\t\t0\t\t0\t\t0\t\t" +
                std::to_string(time) + "\t\t0\t\t0\t\t0\n";
@@ -481,17 +492,17 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
         int32_t result;
     } kEntries[] = {
         {"kelvo_driver", 3, binder.b, 0},
-        {"kelvo_driver", 3, echo(4).b + binderEntry("x", "y", 1), -2},       // count beyond entry
-        {"kelvo_driver", 3, echo(-1).b, -2},                                   // negative count
-        {"kelvo_driver", 3, std::string(10, '\0'), -2},                        // short header
+        {"kelvo_driver", 3, echo(4).b + binderEntry("x", "y", 1), -2},  // count beyond entry
+        {"kelvo_driver", 3, echo(-1).b, -2},                            // negative count
+        {"kelvo_driver", 3, std::string(10, '\0'), -2},                 // short header
         {"kelvo_driver", 1, kworker.b, 0},
-        {"kelvo_driver", 1, echo(1000000).b + kworker.b.substr(16), -2},       // huge count
-        {"kelvo_driver", 2, echo(0).b, 0},                                     // no uevents
-        {"KelvoService", 0, daily.b.substr(0, 59), -2},                        // short record
+        {"kelvo_driver", 1, echo(1000000).b + kworker.b.substr(16), -2},  // huge count
+        {"kelvo_driver", 2, echo(0).b, 0},                                // no uevents
+        {"KelvoService", 0, daily.b.substr(0, 59), -2},                   // short record
         {"KelvoService", 0, daily.b, 0},
         {"someone", 0, daily.b, -3},
         {"KelvoService", 1, phone.b, 0},
-        {"KelvoService", 1, "\x02" + phone.b.substr(1), -2},                    // two counted, one sent
+        {"KelvoService", 1, "\x02" + phone.b.substr(1), -2},  // two counted, one sent
         {"KelvoService", 2, package.b, 0},
     };
     for (const auto& e : kEntries) {
@@ -506,10 +517,10 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
               rows("SELECT name, version FROM raw_package_version"));
     EXPECT_EQ(std::vector<std::string>{"worker_fn|9|77"},
               rows("SELECT symbol, count, time FROM raw_kworker"));
-    EXPECT_EQ((std::vector<std::string>{"storage_available|222", "storage_free|111",
-                                        "storage_usb|1"}),
-              rows("SELECT name, value FROM daily_misc_data WHERE name IN ('storage_free', "
-                   "'storage_available', 'storage_usb') ORDER BY name"));
+    EXPECT_EQ(
+        (std::vector<std::string>{"storage_available|222", "storage_free|111", "storage_usb|1"}),
+        rows("SELECT name, value FROM daily_misc_data WHERE name IN ('storage_free', "
+             "'storage_available', 'storage_usb') ORDER BY name"));
 }
 
 }  // namespace
@@ -540,7 +551,8 @@ protected:
         SystemHandlerTest::SetUp();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_POLLING, mPolling);
-        for (const sp<KelvoOperator>& op : {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
+        for (const sp<KelvoOperator>& op :
+             {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
             op->earlyInitialize();
             op->initialize();
         }
@@ -548,7 +560,8 @@ protected:
         mHandler->setCandidateElector();
     }
     void TearDown() override {
-        for (const sp<KelvoOperator>& op : {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
+        for (const sp<KelvoOperator>& op :
+             {sp<KelvoOperator>(mRoutine), sp<KelvoOperator>(mPolling)}) {
             op->readyToDestroy();
             op->requestThreadExit();
             op->join();
