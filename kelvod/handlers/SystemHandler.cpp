@@ -200,7 +200,7 @@ const char* const kTagNames[SystemHandler::TAG_COUNT] = {
     "KELVO_TAG_AP_WAKE_IRQ",        "KELVO_TAG_KERNEL_WAKEUP_PACKET",
     "KELVO_TAG_SENSORHUB_WAKE",     "KELVO_TAG_WIFI_WAKE_IPV4",
     "KELVO_TAG_CLOUD_UPDATE",       "KELVO_TAG_PM_SCENE",
-    "KELVO_TAG_APP_WAKEUP",
+    "KELVO_TAG_APP_WAKEUP",         "KELVO_TAG_PM_STRATEGY",
 };
 
 // How long the kernel has been up, in ms.
@@ -479,6 +479,8 @@ int32_t SystemHandler::handleLogger(int64_t time, int32_t tag, const char* text)
         case TAG_WIFI_WAKE_IPV4:
             mLastWifiWakeTime = time;
             return 0;
+        case TAG_PM_STRATEGY:
+            return handleStrategy(time, text);
         default:
             if (tag > TAG_RESET_BATTERY_STAT && tag < TAG_COUNT) {
                 return handleRecord(time, tag, text);
@@ -1014,6 +1016,48 @@ int32_t SystemHandler::handleRecord(int64_t time, int32_t tag, const char* text)
         return refuse("Failed to parse message");
     }
     return insertEntries(*table, row, 1, false);
+}
+
+int32_t SystemHandler::handleStrategy(int64_t time, const char* text) {
+    std::string names;
+    int32_t type = 0;
+    int32_t count = 0;
+    int32_t update = 0;
+    char buffer[4096] = {};
+    if (parseMessage(text, "name=", "type=", "%s", buffer, sizeof(buffer)) < 0 ||
+        parseInt(text, "type=", "count=", &type) < 0 ||
+        parseInt(text, "count=", "update=", &count) < 0 ||
+        parseInt(text, "update=", nullptr, &update) < 0) {
+        return refuse("Failed to parse message");
+    }
+    names = buffer;
+    std::vector<std::string> list;
+    for (size_t start = 0; start <= names.size();) {
+        size_t comma = names.find(',', start);
+        if (comma == std::string::npos) {
+            comma = names.size();
+        }
+        if (comma > start && comma - start < kNameSize) {
+            list.push_back(names.substr(start, comma - start));
+        }
+        start = comma + 1;
+    }
+    if (count < 1 || count > kMaxStrategyNames || static_cast<size_t>(count) != list.size()) {
+        HealthCounters::add(Health::LoggerMessageRefused);
+        KLOGE("Invalid strategy count: %d, names: %zu", count, list.size());
+        return -5;
+    }
+    if (update == 1) {
+        // Once for the whole list: the type's rows become these names.
+        deleteEntries(k_raw_pelmora_strategy.name, String8::format("type = %d", type).c_str());
+    }
+    Parcel rows;
+    for (const std::string& name : list) {
+        rows.writeInt64(time);
+        rows.writeString8(String8(name.c_str()));
+        rows.writeInt32(type);
+    }
+    return insertEntries(k_raw_pelmora_strategy, rows, count, false);
 }
 
 int32_t SystemHandler::insertMiscData(const Parcel& data) {

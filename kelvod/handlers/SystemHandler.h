@@ -48,7 +48,8 @@ public:
         TAG_CLOUD_UPDATE = 20,
         TAG_PM_SCENE = 21,
         TAG_APP_WAKEUP = 22,
-        TAG_COUNT = 23,
+        TAG_PM_STRATEGY = 23,
+        TAG_COUNT = 24,
     };
     // Customized messages.
     enum system_message : int32_t {
@@ -99,6 +100,7 @@ public:
     // A time change beyond this is no clock adjustment but a broken record.
     static constexpr int64_t kMaxTimeDeltaMs = 100LL * 366 * 24 * 3600 * 1000;
     static constexpr size_t kNameSize = 64;
+    static constexpr int32_t kMaxStrategyNames = 256;
     static constexpr const char* kMemInfoPath = "/proc/meminfo";
     static constexpr const char* kDdrPath = "/sys/class/devfreq/ddrfreq/trans_stat";
     // Kernel up this long when the daemon starts: a restart, whose first
@@ -178,6 +180,9 @@ private:
     int32_t handlePhoneState(int64_t time, const char* text);
     // The records written as one row each.
     int32_t handleRecord(int64_t time, int32_t tag, const char* text);
+    // "name=A,B,C type=T count=3 update=U": with update 1 the type's rows
+    // are replaced by the names.
+    int32_t handleStrategy(int64_t time, const char* text);
     int32_t checkAlarmWakeup(int64_t wake);
     int32_t checkWifiWake(int64_t wake);
     int32_t insertMiscData(const android::Parcel& data);
