@@ -14,6 +14,7 @@
 
 #include "ErrorLogger.h"
 #include "HealthCounters.h"
+#include "KelvoLibEntry.h"
 #include "KelvoLog.h"
 #include "binder/managers/PackageManager.h"
 #include "binder/managers/WakelockManager.h"
@@ -402,6 +403,21 @@ int32_t SystemHandler::insertStartUp(int64_t time, int32_t state) {
     row.writeInt32(state);
     row.writeInt32(static_cast<int32_t>(getpid()));
     return insertEntries(k_debug_start_up, row, 1, false);
+}
+
+int32_t SystemHandler::setConfiguration() {
+    Parcel request;
+    request.writeInt32(1);
+    Parcel reply;
+    int32_t gpio = 0;
+    if (getXmlConfig(CONFIG_FILTER, request, &reply) < 0 ||
+        reply.readInt32(&gpio) != android::NO_ERROR) {
+        // Every GPIO wake-up is then an AP wake interrupt at once.
+        KLOGE("Get filter data failed");
+        return -2;
+    }
+    mWifiWakeGpio = gpio;
+    return 0;
 }
 
 int32_t SystemHandler::lateInitialize() {

@@ -127,6 +127,7 @@ public:
     void registerDispatcherTag() override;
     void setCandidateElector() override;
     int32_t lateInitialize() override;
+    int32_t setConfiguration() override;
     void dump(android::String8& out) override;
 
     int32_t handleLogger(int64_t time, int32_t tag, const char* text) override;
