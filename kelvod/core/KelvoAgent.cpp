@@ -19,6 +19,7 @@
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
@@ -36,6 +37,10 @@ const int32_t kHandlerCreationOrder[HANDLER_COUNT] = {
         HANDLER_CAMERA, HANDLER_GNSS,     HANDLER_THERMAL, HANDLER_WIFI,       HANDLER_BATTERY,
         HANDLER_AUDIO,  HANDLER_MODEM,    HANDLER_GPU,     HANDLER_BLUETOOTH,  HANDLER_DPM,
 };
+
+android::sp<KelvoOperator> makeSystemHandler() {
+    return new SystemHandler();
+}
 
 android::sp<KelvoOperator> makeCpuHandler() {
     return new CpuHandler();
@@ -68,6 +73,7 @@ android::sp<KelvoOperator> makeAbnormalityRoutine() {
 // What start-up creates for each slot; tests and the simulator replace them.
 struct Factories {
     Factories() {
+        handlers[HANDLER_SYSTEM] = &makeSystemHandler;
         handlers[HANDLER_CPU] = &makeCpuHandler;
         routines[ROUTINE_POLLING] = &makePollingRoutine;
         routines[ROUTINE_HOURLY] = &makeHourlyRoutine;

@@ -39,6 +39,7 @@ enum class Health : uint32_t {
     CpuCounterLinesIgnored,  // frequency residency lines beyond the known steps
     ServiceRequestsRefused,  // binder requests refused or cut (caller, path, push message, query, reply size)
     AbnormalityInputRefused, // abnormality reports, records or rows refused or over their cap
+    SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
     Count
 };
 
