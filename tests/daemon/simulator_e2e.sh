@@ -4,7 +4,8 @@
 # rows per package, the hourly event 903001060 with its component (field 6)
 # and top applications (array 7), every package's attributed CPU time against
 # the time the scenario gave it, the applications' energy against the
-# component's. Then a bad scenario is refused by line before anything starts,
+# component's; backlight, GNSS and flashlight time and energy per application
+# against the scenario's, with their hourly rows and upload fields. Then a bad scenario is refused by line before anything starts,
 # and an interrupted run leaves no process behind.
 #   simulator_e2e.sh KELVO_SIM SOURCE_DIR
 set -u
@@ -65,6 +66,48 @@ diff=$(( appEnergy - componentEnergy ))
     fail "applications' energy $appEnergy, component's $componentEnergy"
 [ "$(q "SELECT COUNT(*) FROM hourly_component_cpu")" -ge 1 ] || fail "no hourly_component_cpu row"
 
+# Display, GNSS and flashlight per application (the truths of the scenario's
+# header): the time exactly, as the records carry the scenario's times; the
+# energy within 3 units, as the daemon truncates every interval it accounts
+# (cut by each brightness, foreground, screen and charger change and the hour).
+expected="backlight com.example.mail 15000 1470
+backlight com.example.browser 25000 3800
+gnss com.example.mail 20000 525
+gnss com.example.browser 25000 700
+flashlight com.example.mail 10000 1800"
+componentSql() {
+    if [ "$1" = backlight ]; then
+        echo "SELECT SUM(duration + charge_duration), SUM(energy + charge_energy)
+              FROM raw_applications_backlight WHERE name = '$2'"
+    else
+        echo "SELECT SUM(foreground_duration + background_duration + charge_foreground_duration +
+                         charge_background_duration),
+                     SUM(foreground_energy + background_energy + charge_foreground_energy +
+                         charge_background_energy) FROM raw_applications_$1 WHERE name = '$2'"
+    fi
+}
+while read -r component name ms energy; do
+    read -r gotMs gotEnergy <<<"$(q "$(componentSql "$component" "$name")" | tr '|' ' ')"
+    [ -n "$gotMs" ] || fail "no raw_applications_$component row for $name"
+    (( gotMs == ms )) || fail "$component $name: attributed $gotMs ms, truth $ms ms"
+    (( gotEnergy - energy <= 3 && energy - gotEnergy <= 3 )) ||
+        fail "$component $name: attributed energy $gotEnergy, truth $energy"
+    simTruth=$(awk -F'\t' -v c="$component" -v n="$name" '$1 == c && $2 == n { print $3, $5 }' \
+        "$root/sim/components.tsv")
+    [ "$simTruth" = "$ms $energy" ] || fail "$component $name: the simulator's truth is $simTruth"
+    hourly=$(q "SELECT COUNT(*) FROM hourly_applications_$component WHERE name = '$name'")
+    [ "$hourly" -ge 1 ] || fail "no hourly_applications_$component row for $name"
+done <<<"$expected"
+others=$(q "SELECT (SELECT COUNT(*) FROM raw_applications_gnss WHERE name NOT IN
+                    ('com.example.mail', 'com.example.browser')) +
+                   (SELECT COUNT(*) FROM raw_applications_flashlight WHERE name != 'com.example.mail') +
+                   (SELECT COUNT(*) FROM raw_applications_backlight WHERE name NOT IN
+                    ('com.example.mail', 'com.example.browser', 'screen_off',
+                     'com.tovaro.android.launcher'))")
+[ "$others" = 0 ] || fail "$others display, GNSS or flashlight rows for names the scenario never used"
+ambient=$(q "SELECT SUM(duration) FROM raw_ambient_light WHERE type = 0")
+[ "$ambient" = 3500 ] || fail "ambient light: $ambient ms stored, 3500 written"
+
 python3 - "$root/data/log/zendrel/events.jsonl" <<'PY' || fail "hourly event"
 import json, sys
 events = [json.loads(l) for l in open(sys.argv[1]) if l.strip()]
@@ -80,6 +123,13 @@ assert names == {"com.example.mail", "com.example.browser", "com.example.browser
                  "system_server", "kernel_kworker"}, names
 for a in top:
     assert a["class"] == 903009022 and a["params"]["1"]["class"] == 903009021, a
+# Display (4, 5), GNSS (8, 9) and flashlight (18, 19): all were in use before 11:00.
+for field, array, users in ((4, 5, {"com.example.mail", "com.example.browser"}),
+                            (8, 9, {"com.example.mail", "com.example.browser"}),
+                            (18, 19, {"com.example.mail"})):
+    assert p[str(field)]["class"] == 903009021, (field, p.get(str(field)))
+    names = {a["params"]["3"]["params"]["0"] for a in p[str(array)]}
+    assert names == users, (array, names)
 PY
 
 # A bad scenario is refused by its line before anything starts.

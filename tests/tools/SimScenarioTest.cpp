@@ -1,10 +1,12 @@
 #include <gtest/gtest.h>
 #include <stdlib.h>
 
+#include <algorithm>
 #include <fstream>
 #include <sstream>
 #include <string>
 
+#include "ComponentTruth.h"
 #include "CpuTree.h"
 #include "DeviceModel.h"
 #include "Scenario.h"
@@ -30,7 +32,7 @@ struct Refusal {
 };
 
 const Refusal kRefusals[] = {
-    {"unknown verb", "at 5 brightness 80", "unknown verb \"brightness\""},
+    {"unknown verb", "at 5 vibrate 80", "unknown verb \"vibrate\""},
     {"unknown declaration", "gnss on", "unknown verb \"gnss\""},
     {"percent over the cluster", "at 5 load 2001 0 401%", "percent of one core"},
     {"cluster out of range", "at 5 load 2001 2 10%", "cluster 0|1"},
@@ -42,6 +44,10 @@ const Refusal kRefusals[] = {
     {"unknown foreground package", "at 5 foreground com.other", "no app has the package"},
     {"package not of the uid", "process 5 10061 x com.example.browser", "does not have"},
     {"pid declared twice", "process 2001 10061 again", "pid 2001 is declared twice"},
+    {"brightness over 255", "at 5 brightness 256", "level 0..255"},
+    {"ambient without six durations", "at 5 ambient auto 1 2 3", "six ambient levels"},
+    {"gnss of an unknown package", "at 5 gnss start com.other", "no app has the package"},
+    {"torch user of a shared uid", "at 5 torch 2101", "app with one package"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {
@@ -115,6 +121,58 @@ TEST(DeviceModelTest, CountersAndTruthFollowTheLoad) {
               readFile(std::string(dir) + "/" + CpuTree::timeInStatePath(4)).find("2457600 100\n"));
     std::string rm = std::string("rm -rf ") + dir;
     ASSERT_EQ(0, system(rm.c_str()));
+}
+
+// The truth follows the daemon's rules: the flashlight charges the user known
+// when it came on (nobody before a user is known; a user learnt while on, or
+// a repeated on, waits for the next real switch), GNSS users share its power,
+// the backlight belongs to the foreground at its level's power, and the
+// panel's advanced value covers the span since the previous read.
+TEST(ComponentTruthTest, FollowsTheDaemonsAccountingRules) {
+    Scenario scenario;
+    std::string error;
+    ASSERT_TRUE(scenario.parse(std::string(kHeader) +
+                                   "app 10062 com.example.music\n"
+                                   "process 2002 10062 com.example.music\n"
+                                   "at 0 flashlight on\nat 1 torch 2001\nat 2 flashlight off\n"
+                                   "at 3 flashlight on\nat 4 torch 2002\nat 5 flashlight on\n"
+                                   "at 6 flashlight off\n"
+                                   "at 0 gnss start com.example.mail\nat 2 gnss start com.example.music\n"
+                                   "at 4 gnss stop com.example.mail\nat 6 gnss stop com.example.music\n"
+                                   "at 1 brightness 100\nat 2 foreground com.example.mail\n"
+                                   "at 4 screen off\nat 5 screen on\n",
+                               "s.scn", &error))
+        << error;
+    ComponentTruth::Profile profile;
+    profile.slope = 90;
+    profile.intercept = 800;  // 98 at level 100
+    profile.gnssPower = 35;
+    profile.flashlightPower = 180;
+    ComponentTruth truth(scenario, profile);
+    std::vector<std::string> records;
+    for (const Scenario::Step& step : scenario.steps()) {
+        ComponentTruth::Record record;
+        ASSERT_TRUE(truth.apply(step, &record));
+        records.push_back(record.tag + " " + record.text);
+    }
+    EXPECT_EQ(2801u, truth.takeAdvancedValue(7000));  // mean level 500/7 of 255
+    EXPECT_EQ(3921u, truth.takeAdvancedValue(7000));  // an empty span: level 100
+    EXPECT_NE(records.end(), std::find(records.begin(), records.end(),
+                                       "KELVO_TAG_TORCH_CONNECT uid=10061 pid=2001"));
+    EXPECT_EQ("KELVO_TAG_BRIGHTNESS brightness=100", records.back());  // screen on
+
+    auto figures = [](const std::map<std::string, ComponentTruth::Figures>& m) {
+        std::string out;
+        for (const auto& e : m) {
+            out += e.first + " " + std::to_string(e.second.ms) + "/" +
+                   std::to_string(e.second.energy()) + "; ";
+        }
+        return out;
+    };
+    EXPECT_EQ("com.example.mail 3000/540; ", figures(truth.flashlight()));
+    EXPECT_EQ("com.example.mail 4000/105; com.example.music 4000/105; ", figures(truth.gnss()));
+    EXPECT_EQ("com.example.mail 2000/196; com.tovaro.android.launcher 3000/294; ",
+              figures(truth.backlight()));
 }
 
 }  // namespace

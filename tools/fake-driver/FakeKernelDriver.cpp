@@ -195,6 +195,11 @@ void FakeKernelDriver::setRequestListener(RequestListener listener) {
     mListener = std::move(listener);
 }
 
+void FakeKernelDriver::setBrightnessSource(BrightnessSource source) {
+    std::lock_guard<std::mutex> guard(mLock);
+    mBrightnessSource = std::move(source);
+}
+
 void FakeKernelDriver::serve() {
     for (;;) {
         struct pollfd p[3] = {{mListenFds[0], POLLIN, 0},
@@ -309,6 +314,8 @@ FakeKernelDriver::Answer FakeKernelDriver::answerKelvo(uint32_t request,
             if (!mState.spanBrightness.empty()) {
                 value = mState.spanBrightness.front();
                 mState.spanBrightness.pop_front();
+            } else if (mBrightnessSource) {
+                value = mBrightnessSource();
             }
             putBytes(argument, 0, &value, sizeof(value));
             return Answer();

@@ -89,6 +89,12 @@ public:
 
     void setRequestListener(RequestListener listener);
 
+    // Answers each brightness read once spanBrightness is used up (instead
+    // of `brightness`): the simulator's panel. Called under the driver's
+    // lock; it must not call back into the driver.
+    using BrightnessSource = std::function<uint32_t()>;
+    void setBrightnessSource(BrightnessSource source);
+
 private:
     struct Answer {
         int32_t result = 0;
@@ -108,6 +114,7 @@ private:
     std::map<std::pair<Device, uint32_t>, Answer> mFailures;
     std::vector<Request> mRequests;
     RequestListener mListener;
+    BrightnessSource mBrightnessSource;
 
     std::string mPaths[2];
     int mListenFds[2] = {-1, -1};

@@ -15,6 +15,7 @@
 #include <fstream>
 #include <sstream>
 
+#include "ComponentReport.h"
 #include "CpuTree.h"
 #include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
@@ -38,7 +39,6 @@ constexpr int64_t kReadyTimeoutMs = 15000;
 constexpr int kStopGraceMs = 15000;
 // The idle figures are taken from this long after the start on.
 constexpr int64_t kIdleSettleMs = 10000;
-constexpr int32_t kBrightnessOn = 128;
 constexpr int64_t kHourMs = 3600 * 1000;
 // Eight steps of a round, each waiting at most a minute for its votes.
 constexpr int64_t kLongestRoundMs = 8 * 60 * 1000;
@@ -186,6 +186,17 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot lay out the CPU counters below " + root + ": " + strerror(errno);
         return false;
     }
+    // The daemon prefers a configuration under /data to the customised one.
+    ComponentTruth::Profile profile;
+    std::string config = root + "/data/misc/kelvo/tv_kelvo_config.xml";
+    if (stat(config.c_str(), &st) != 0) {
+        config = root + "/vendor/etc/xml/tv_kelvo_config.xml";
+    }
+    if (!ComponentTruth::readProfile(config, &profile)) {
+        *error = "cannot read the power profile of " + config;
+        return false;
+    }
+    mComponents.reset(new ComponentTruth(mScenario, profile));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -219,6 +230,10 @@ bool DeviceSimulator::startServices(std::string* error) {
         *error = "cannot serve the kernel devices below " + mOptions.root;
         return false;
     }
+    mDriver->setBrightnessSource([this] {
+        std::lock_guard<std::mutex> lock(mLock);
+        return mComponents->takeAdvancedValue(mModelMs);
+    });
     mReporter.reset(new fake::FakeDriverReporter(*mDriver));
     mReporter->setBodyProvider([this](const fake::FakeDriverReporter::Report& report) {
         return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME ? answerCpuRequest()
@@ -308,15 +323,6 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             mModel.setLoad(step.pid, step.cluster, step.percent, step.frequency);
             return;
         }
-        case Scenario::Action::Foreground:
-            result = mLogWriter->write(LogWriter::PRIORITY_INFO, "KELVO_TAG_FOREGROUND_CHANGED",
-                                       ("name=" + step.text).c_str(), t);
-            break;
-        case Scenario::Action::Screen:
-            result = mLogWriter->write(
-                LogWriter::PRIORITY_INFO, "KELVO_TAG_BRIGHTNESS",
-                ("brightness=" + std::to_string(step.flag ? kBrightnessOn : 0)).c_str(), t);
-            break;
         case Scenario::Action::Charger: {
             PlatformState::Battery battery = mServices->state()->battery();
             battery.acOnline = step.text == "ac";
@@ -330,6 +336,19 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             battery.level = step.value;
             mServices->state()->setBattery(battery);
             return;
+        }
+        default: {
+            // Display, GNSS and flashlight: a log-device record each.
+            ComponentTruth::Record record;
+            {
+                std::lock_guard<std::mutex> lock(mLock);
+                if (!mComponents->apply(step, &record)) {
+                    return;
+                }
+            }
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, record.tag.c_str(),
+                                       record.text.c_str(), t);
+            break;
         }
     }
     ++mLogWritten;
@@ -497,12 +516,23 @@ int DeviceSimulator::finish(bool completed) {
         }
     }
     SimReport report(header, truth, mModel.nameUids());
+    std::string components;
+    std::string componentTable;
+    {
+        std::lock_guard<std::mutex> lock(mLock);
+        mComponents->advanceTo(mModelMs);
+        ComponentReport componentReport(*mComponents, SimReport::databasePath(mOptions.root));
+        componentReport.build(&components);
+        componentTable = componentReport.table();
+    }
+    report.addSection(components);
     std::string text;
     bool readable = report.build(&text);
     fputs("\n", stdout);
     fputs(text.c_str(), stdout);
     std::ofstream(mOptions.root + "/sim/summary.txt") << text;
     std::ofstream(mOptions.root + "/sim/truth.tsv") << report.truthTable();
+    std::ofstream(mOptions.root + "/sim/components.tsv") << componentTable;
     if (!mError.empty()) {
         fprintf(stderr, "kelvo-sim: %s\n", mError.c_str());
     }

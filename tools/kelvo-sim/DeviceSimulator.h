@@ -8,6 +8,7 @@
 #include <mutex>
 #include <string>
 
+#include "ComponentTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "Scenario.h"
@@ -91,6 +92,9 @@ private:
     std::mutex mLock;  // the model, the guard and the truth, shared with the driver thread
     DeviceModel mModel;
     std::unique_ptr<CpuTree> mTree;
+    // The display, GNSS and flashlight with their truth (under mLock: the
+    // driver thread reads the panel's advanced brightness).
+    std::unique_ptr<ComponentTruth> mComponents;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -325,11 +325,67 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
             *reason = "expected \"at <time> battery <level 0..100>%\"";
             return false;
         }
+    } else if (!parseComponentStep(words, &step, reason)) {
+        return false;
+    }
+    mSteps.push_back(step);
+    return true;
+}
+
+// The display's, GNSS's and flashlight's verbs (ComponentTruth plays them).
+bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* step,
+                                  std::string* reason) {
+    const std::string& verb = words[0];
+    if (verb == "brightness") {
+        step->action = Action::Brightness;
+        if (words.size() != 2 || !parseInt32(words[1], 0, 255, &step->value)) {
+            *reason = "expected \"at <time> brightness <level 0..255>\"";
+            return false;
+        }
+    } else if (verb == "ambient") {
+        step->action = Action::Ambient;
+        static const std::vector<std::string> kTypes = {"auto", "manual", "app", "front"};
+        auto type = words.size() == 8 ? std::find(kTypes.begin(), kTypes.end(), words[1])
+                                      : kTypes.end();
+        step->value = static_cast<int32_t>(type - kTypes.begin());
+        for (size_t i = 2; type != kTypes.end() && i < words.size(); ++i) {
+            int32_t ms = 0;
+            if (!parseInt32(words[i], 0, 0x7FFFFFFF, &ms)) {
+                break;
+            }
+            step->values.push_back(ms);
+        }
+        if (step->values.size() != 6) {
+            *reason =
+                "expected \"at <time> ambient auto|manual|app|front <ms> <ms> <ms> <ms> <ms> "
+                "<ms>\" (the time at each of the six ambient levels)";
+            return false;
+        }
+    } else if (verb == "gnss") {
+        step->action = Action::Gnss;
+        if (words.size() != 3 || (words[1] != "start" && words[1] != "stop") || !isName(words[2])) {
+            *reason = "expected \"at <time> gnss start|stop <package>\"";
+            return false;
+        }
+        step->flag = words[1] == "start";
+        step->text = words[2];
+    } else if (verb == "flashlight") {
+        step->action = Action::Flashlight;
+        if (words.size() != 2 || (words[1] != "on" && words[1] != "off")) {
+            *reason = "expected \"at <time> flashlight on|off\"";
+            return false;
+        }
+        step->flag = words[1] == "on";
+    } else if (verb == "torch") {
+        step->action = Action::Torch;
+        if (words.size() != 2 || !parseInt32(words[1], 1, 0x7FFFFFFF, &step->pid)) {
+            *reason = "expected \"at <time> torch <pid>\"";
+            return false;
+        }
     } else {
         *reason = "unknown verb \"" + verb + "\"";
         return false;
     }
-    mSteps.push_back(step);
     return true;
 }
 
@@ -372,8 +428,17 @@ bool Scenario::check(std::string* reason, int32_t* line) {
                 return false;
             }
         }
-        if (step.action == Action::Foreground) {
-            bool known = step.text == "screen_off";
+        if (step.action == Action::Torch) {
+            const Process* process = findProcess(step.pid);
+            const App* app = process != nullptr ? findApp(process->uid) : nullptr;
+            if (app == nullptr || app->packages.size() != 1) {
+                *reason = "the torch user " + std::to_string(step.pid) +
+                          " must be a declared process of an app with one package";
+                return false;
+            }
+        }
+        if (step.action == Action::Foreground || step.action == Action::Gnss) {
+            bool known = step.action == Action::Foreground && step.text == "screen_off";
             for (const App& app : mApps) {
                 known = known || std::find(app.packages.begin(), app.packages.end(), step.text) !=
                                      app.packages.end();

@@ -38,6 +38,11 @@ public:
         Screen,      // flag: on
         Charger,     // text: "ac", "usb", "wireless" or "off"
         Battery,     // value: level
+        Brightness,  // value: level 0..255
+        Ambient,     // value: type (0 auto, 1 manual, 2 app, 3 front), values: six durations
+        Gnss,        // flag: start, text: the package
+        Flashlight,  // flag: on
+        Torch,       // pid: the torch user's process
     };
 
     struct Step {
@@ -51,6 +56,7 @@ public:
         int32_t value = 0;
         bool flag = false;
         std::string text;
+        std::vector<int32_t> values;
     };
 
     // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
@@ -81,6 +87,8 @@ public:
 private:
     bool parseLine(const std::vector<std::string>& words, std::string* reason);
     bool parseTimed(int64_t atMs, const std::vector<std::string>& words, std::string* reason);
+    bool parseComponentStep(const std::vector<std::string>& words, Step* step,
+                            std::string* reason);
     bool check(std::string* reason, int32_t* line);
 
     int32_t mLine = 0;

@@ -36,6 +36,8 @@ public:
     // writes the report as text; false (with the reason in the text) when
     // the database cannot be read.
     bool build(std::string* text);
+    // A section of another model, printed before the files.
+    void addSection(const std::string& text) { mSections.push_back(text); }
     // name \t uid \t truth ms \t attributed ms, one line per application.
     std::string truthTable() const;
 
@@ -69,6 +71,7 @@ private:
     int64_t mHourlyComponentTime = 0;
     int64_t mHourlyComponentEnergy = 0;
     int64_t mHourlyComponentRows = 0;
+    std::vector<std::string> mSections;
 };
 
 }  // namespace sim
