@@ -1,11 +1,14 @@
 #include "ComponentReport.h"
 
 #include <inttypes.h>
+#include <json/json.h>
 #include <sqlite3.h>
 #include <stdarg.h>
 #include <stdio.h>
 
+#include <fstream>
 #include <functional>
+#include <sstream>
 
 namespace kelvo {
 namespace sim {
@@ -45,6 +48,26 @@ const Source kSources[] = {
 
 const char* const kAmbientTypes[4] = {"auto", "manual", "app", "front"};
 
+// Fields of the hourly event: component class, top applications array.
+struct EventFields {
+    const char* component;
+    int componentField;
+    int topField;
+};
+const EventFields kEventFields[] = {{"display", 4, 5}, {"gnss", 8, 9}, {"flashlight", 18, 19}};
+
+int64_t paramInt(const Json::Value& params, int id) {
+    const Json::Value& value = params[std::to_string(id)];
+    return value.isIntegral() ? value.asInt64() : 0;
+}
+
+// Parameters 5/4 foreground time/energy, 7/6 background.
+std::string energyClass(const Json::Value& object) {
+    const Json::Value& p = object["params"];
+    return std::to_string(paramInt(p, 5) + paramInt(p, 7)) + " ms/" +
+           std::to_string(paramInt(p, 4) + paramInt(p, 6));
+}
+
 using RowFn = std::function<void(sqlite3_stmt*)>;
 
 bool query(sqlite3* db, const char* sql, const RowFn& row, std::string* error) {
@@ -81,8 +104,9 @@ std::string line(const char* fmt, ...) {
 
 }  // namespace
 
-ComponentReport::ComponentReport(const ComponentTruth& truth, const std::string& databasePath)
-    : mTruth(truth), mDatabasePath(databasePath) {
+ComponentReport::ComponentReport(const ComponentTruth& truth, const std::string& databasePath,
+                                 const std::string& eventsPath)
+    : mTruth(truth), mDatabasePath(databasePath), mEventsPath(eventsPath) {
     const std::map<std::string, ComponentTruth::Figures>* truths[] = {
         &truth.backlight(), &truth.gnss(), &truth.flashlight()};
     for (size_t i = 0; i < 3; ++i) {
@@ -138,6 +162,36 @@ bool ComponentReport::readDatabase(std::string* error) {
     return ok;
 }
 
+void ComponentReport::describeHourlyEvents(std::string* out) const {
+    std::ifstream in(mEventsPath);
+    std::string text;
+    Json::CharReaderBuilder builder;
+    while (std::getline(in, text)) {
+        Json::Value event;
+        std::string errors;
+        std::istringstream stream(text);
+        if (!Json::parseFromStream(builder, stream, &event, &errors) || !event.isObject() ||
+            event["event"].asUInt() != 903001060u) {
+            continue;
+        }
+        const Json::Value& params = event["params"];
+        *out += "Hourly event 903001060 for " + params["1"].asString() + ":\n";
+        for (const EventFields& f : kEventFields) {
+            const Json::Value& component = params[std::to_string(f.componentField)];
+            *out += line("  %-10s (field %d) %s; top (array %d):", f.component, f.componentField,
+                         component.isObject() ? energyClass(component).c_str() : "absent",
+                         f.topField);
+            const Json::Value& top = params[std::to_string(f.topField)];
+            for (Json::ArrayIndex i = 0; top.isArray() && i < top.size(); ++i) {
+                const Json::Value& p = top[i]["params"];
+                *out += " " + p["3"]["params"]["0"].asString() + " " + energyClass(p["1"]) +
+                        (i + 1 < top.size() ? "," : "");
+            }
+            *out += "\n";
+        }
+    }
+}
+
 bool ComponentReport::build(std::string* text) {
     std::string& out = *text;
     std::string error;
@@ -187,7 +241,7 @@ bool ComponentReport::build(std::string* text) {
         }
         out += "\n";
     }
-    out += "\n";
+    describeHourlyEvents(&out);
     return true;
 }
 

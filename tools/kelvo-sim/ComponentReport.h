@@ -13,10 +13,12 @@ namespace sim {
 
 // The report's part on the display, GNSS and flashlight: per application the
 // truth of the scenario beside what the daemon stored in its raw and hourly
-// application tables, and the ambient light written beside the stored.
+// application tables, their fields of the uploaded hourly events, and the
+// ambient light written beside the stored.
 class ComponentReport {
 public:
-    ComponentReport(const ComponentTruth& truth, const std::string& databasePath);
+    ComponentReport(const ComponentTruth& truth, const std::string& databasePath,
+                    const std::string& eventsPath);
 
     // Reads the database and writes the section; false (with the reason in
     // the text) when it cannot be read.
@@ -40,9 +42,12 @@ private:
 
     bool readDatabase(std::string* error);
     bool energyTruth(const std::string& component) const;
+    // The components' fields of every uploaded hourly event.
+    void describeHourlyEvents(std::string* out) const;
 
     const ComponentTruth& mTruth;
     std::string mDatabasePath;
+    std::string mEventsPath;
     Rows mRows;
     std::map<int32_t, int64_t> mAmbientStoredMs;
 };

@@ -521,7 +521,8 @@ int DeviceSimulator::finish(bool completed) {
     {
         std::lock_guard<std::mutex> lock(mLock);
         mComponents->advanceTo(mModelMs);
-        ComponentReport componentReport(*mComponents, SimReport::databasePath(mOptions.root));
+        ComponentReport componentReport(*mComponents, SimReport::databasePath(mOptions.root),
+                                        SimReport::eventsPath(mOptions.root));
         componentReport.build(&components);
         componentTable = componentReport.table();
     }
