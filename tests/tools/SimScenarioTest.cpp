@@ -131,17 +131,18 @@ TEST(DeviceModelTest, CountersAndTruthFollowTheLoad) {
 TEST(ComponentTruthTest, FollowsTheDaemonsAccountingRules) {
     Scenario scenario;
     std::string error;
-    ASSERT_TRUE(scenario.parse(std::string(kHeader) +
-                                   "app 10062 com.example.music\n"
-                                   "process 2002 10062 com.example.music\n"
-                                   "at 0 flashlight on\nat 1 torch 2001\nat 2 flashlight off\n"
-                                   "at 3 flashlight on\nat 4 torch 2002\nat 5 flashlight on\n"
-                                   "at 6 flashlight off\n"
-                                   "at 0 gnss start com.example.mail\nat 2 gnss start com.example.music\n"
-                                   "at 4 gnss stop com.example.mail\nat 6 gnss stop com.example.music\n"
-                                   "at 1 brightness 100\nat 2 foreground com.example.mail\n"
-                                   "at 4 screen off\nat 5 screen on\n",
-                               "s.scn", &error))
+    ASSERT_TRUE(
+        scenario.parse(std::string(kHeader) +
+                           "app 10062 com.example.music\n"
+                           "process 2002 10062 com.example.music\n"
+                           "at 0 flashlight on\nat 1 torch 2001\nat 2 flashlight off\n"
+                           "at 3 flashlight on\nat 4 torch 2002\nat 5 flashlight on\n"
+                           "at 6 flashlight off\n"
+                           "at 0 gnss start com.example.mail\nat 2 gnss start com.example.music\n"
+                           "at 4 gnss stop com.example.mail\nat 6 gnss stop com.example.music\n"
+                           "at 1 brightness 100\nat 2 foreground com.example.mail\n"
+                           "at 4 screen off\nat 5 screen on\n",
+                       "s.scn", &error))
         << error;
     ComponentTruth::Profile profile;
     profile.slope = 90;

@@ -112,7 +112,6 @@ ComponentReport::ComponentReport(const ComponentTruth& truth, const std::string&
     for (size_t i = 0; i < 3; ++i) {
         for (const auto& entry : *truths[i]) {
             Row& row = mRows[kSources[i].component][entry.first];
-            row.hasTruth = true;
             row.truth = entry.second;
         }
     }
@@ -178,9 +177,9 @@ void ComponentReport::describeHourlyEvents(std::string* out) const {
         *out += "Hourly event 903001060 for " + params["1"].asString() + ":\n";
         for (const EventFields& f : kEventFields) {
             const Json::Value& component = params[std::to_string(f.componentField)];
-            *out += line("  %-10s (field %d) %s; top (array %d):", f.component, f.componentField,
-                         component.isObject() ? energyClass(component).c_str() : "absent",
-                         f.topField);
+            *out +=
+                line("  %-10s (field %d) %s; top (array %d):", f.component, f.componentField,
+                     component.isObject() ? energyClass(component).c_str() : "absent", f.topField);
             const Json::Value& top = params[std::to_string(f.topField)];
             for (Json::ArrayIndex i = 0; top.isArray() && i < top.size(); ++i) {
                 const Json::Value& p = top[i]["params"];
@@ -205,13 +204,14 @@ bool ComponentReport::build(std::string* text) {
         "front with the screen on and its backlight energy, GNSS time with an equal share of\n"
         "its power, flashlight time of the torch user); attributed = raw_applications_*\n"
         "(with charging time); hourly = hourly_applications_* (without). Times in ms.\n";
-    out += line("  profile: backlight (%d + %d x level) / 100, GNSS %d, flashlight %d; display "
-                "policy %d%s\n",
-                profile.intercept, profile.slope, profile.gnssPower, profile.flashlightPower,
-                profile.displayPolicy,
-                profile.displayPolicy == 1 ? "" : " (advanced values: no backlight energy truth)");
-    out += line("%-10s %-30s %8s %10s %6s %9s %10s %6s %15s\n", "component", "application",
-                "truth", "attributed", "diff", "truth en", "attributed", "diff", "hourly ms/en");
+    out += line(
+        "  profile: backlight (%d + %d x level) / 100, GNSS %d, flashlight %d; display "
+        "policy %d%s\n",
+        profile.intercept, profile.slope, profile.gnssPower, profile.flashlightPower,
+        profile.displayPolicy,
+        profile.displayPolicy == 1 ? "" : " (advanced values: no backlight energy truth)");
+    out += line("%-10s %-30s %8s %10s %6s %9s %10s %6s %15s\n", "component", "application", "truth",
+                "attributed", "diff", "truth en", "attributed", "diff", "hourly ms/en");
     for (const auto& component : mRows) {
         bool withEnergy = energyTruth(component.first);
         for (const auto& entry : component.second) {
@@ -225,8 +225,8 @@ bool ComponentReport::build(std::string* text) {
             out += line("%-10s %-30s %8" PRId64 " %10" PRId64 " %6" PRId64 " %9s %10" PRId64
                         " %6s %15s\n",
                         component.first.c_str(), entry.first.c_str(), row.truth.ms, row.ms,
-                        row.ms - row.truth.ms, truthEnergy.c_str(), row.energy,
-                        energyDiff.c_str(), hourly.c_str());
+                        row.ms - row.truth.ms, truthEnergy.c_str(), row.energy, energyDiff.c_str(),
+                        hourly.c_str());
         }
     }
     const std::map<int32_t, int64_t>& written = mTruth.ambientMs();

@@ -30,7 +30,6 @@ public:
 
 private:
     struct Row {
-        bool hasTruth = false;
         ComponentTruth::Figures truth;
         int64_t ms = 0;
         int64_t energy = 0;

@@ -211,8 +211,9 @@ bool ComponentTruth::apply(const Scenario::Step& step, Record* record) {
             if (app != nullptr && app->packages.size() == 1) {
                 (mFlashOn ? mPendingUser : mTorchUser) = app->packages[0];
             }
-            *record = {"KELVO_TAG_TORCH_CONNECT", "uid=" + std::to_string(process ? process->uid : 0) +
-                                                      " pid=" + std::to_string(step.pid)};
+            *record = {"KELVO_TAG_TORCH_CONNECT",
+                       "uid=" + std::to_string(process ? process->uid : 0) +
+                           " pid=" + std::to_string(step.pid)};
             return true;
         }
         default:

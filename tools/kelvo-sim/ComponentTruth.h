@@ -25,7 +25,7 @@ class ComponentTruth {
 public:
     // The power profile's figures the truth uses.
     struct Profile {
-        int32_t slope = 0;      // backlight: power = (intercept + slope x level) / 100
+        int32_t slope = 0;  // backlight: power = (intercept + slope x level) / 100
         int32_t intercept = 0;
         int32_t gnssPower = 0;
         int32_t flashlightPower = 0;

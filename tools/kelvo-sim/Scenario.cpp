@@ -345,8 +345,8 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
     } else if (verb == "ambient") {
         step->action = Action::Ambient;
         static const std::vector<std::string> kTypes = {"auto", "manual", "app", "front"};
-        auto type = words.size() == 8 ? std::find(kTypes.begin(), kTypes.end(), words[1])
-                                      : kTypes.end();
+        auto type =
+            words.size() == 8 ? std::find(kTypes.begin(), kTypes.end(), words[1]) : kTypes.end();
         step->value = static_cast<int32_t>(type - kTypes.begin());
         for (size_t i = 2; type != kTypes.end() && i < words.size(); ++i) {
             int32_t ms = 0;

@@ -87,8 +87,7 @@ public:
 private:
     bool parseLine(const std::vector<std::string>& words, std::string* reason);
     bool parseTimed(int64_t atMs, const std::vector<std::string>& words, std::string* reason);
-    bool parseComponentStep(const std::vector<std::string>& words, Step* step,
-                            std::string* reason);
+    bool parseComponentStep(const std::vector<std::string>& words, Step* step, std::string* reason);
     bool check(std::string* reason, int32_t* line);
 
     int32_t mLine = 0;
