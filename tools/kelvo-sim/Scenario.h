@@ -38,6 +38,7 @@ public:
         Screen,      // flag: on
         Charger,     // text: "ac", "usb", "wireless" or "off"
         Battery,     // value: level
+        System,      // text: the record (SystemScene::parseStep)
     };
 
     struct Step {
