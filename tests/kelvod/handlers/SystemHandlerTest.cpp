@@ -15,6 +15,7 @@
 #include "HealthCounters.h"
 #include "KelvoLog.h"
 #include "core/AppsAccounting.h"
+#include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/KelvoAgent.h"
 #include "core/Notifier.h"
@@ -585,6 +586,8 @@ protected:
         WallClock::setFixedTimeMs(kH);
         mUserType = gLogUserType.exchange(3);
         ASSERT_TRUE(mDriver.start());
+        // The process-wide server listens below the root of its first start.
+        ASSERT_EQ(0, BufferedLogServer::getInstance()->start());
         mRoot->writeFile("/data/misc/kelvo/tv_kelvo_config.xml",
                          kelvo::test::readHostFile(KELVO_SAMPLE_CONFIG));
         XmlParser::resetInstance();
