@@ -165,10 +165,10 @@ void BM_SystemRecords(benchmark::State& state) {
     }
     android::Parcel reply;
     int32_t rows = 0;
-    if (ok && (kelvo::StorageOperator::queryEntriesSimple(
-                   android::String8("SELECT COUNT(*) FROM raw_system_suspend"), &reply, 1, rows) <
-                   0 ||
-               rows != 1 || reply.readInt64() < static_cast<int64_t>(kRounds * kTriples))) {
+    if (ok &&
+        (kelvo::StorageOperator::queryEntriesSimple(
+             android::String8("SELECT COUNT(*) FROM raw_system_suspend"), &reply, 1, rows) < 0 ||
+         rows != 1 || reply.readInt64() < static_cast<int64_t>(kRounds * kTriples))) {
         ok = false;
     }
     kelvo::Dispatcher::resetForTest();

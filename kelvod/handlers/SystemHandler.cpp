@@ -3,8 +3,8 @@
 #include <cutils/properties.h>
 #include <errno.h>
 #include <limits.h>
-#include <stdlib.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <time.h>
 #include <unistd.h>
@@ -193,19 +193,15 @@ const table_attribute* const kKeptTables[] = {
 };
 
 const char* const kTagNames[SystemHandler::TAG_COUNT] = {
-    "KELVO_TAG_TIME_CHANGED",       "KELVO_TAG_KERNEL_SUSPEND",
-    "KELVO_TAG_KERNEL_RESUME",      "KELVO_TAG_KERNEL_WAKEUP",
-    "KELVO_TAG_ALARM_TRIGGER",      "KELVO_TAG_ALARM_WORKSOURCE",
-    "KELVO_TAG_PACKAGE_REMOVED",    "KELVO_TAG_PACKAGE_ADDED",
-    "KELVO_TAG_UID_REMOVED",        "KELVO_TAG_BOOT_COMPLETED",
-    "KELVO_TAG_SHUTDOWN",           "KELVO_TAG_PHONE_STATE",
-    "KELVO_TAG_RESET_BATTERY_STAT", "KELVO_TAG_WAKE_STATUS",
-    "KELVO_TAG_FREEZING_FAILED",    "KELVO_TAG_MODEM_WAKEUP_SOURCE",
-    "KELVO_TAG_AP_WAKE_IRQ",        "KELVO_TAG_KERNEL_WAKEUP_PACKET",
-    "KELVO_TAG_SENSORHUB_WAKE",     "KELVO_TAG_WIFI_WAKE_IPV4",
-    "KELVO_TAG_CLOUD_UPDATE",       "KELVO_TAG_PM_STRATEGY",
-    "KELVO_TAG_PM_SCENE",           "KELVO_TAG_LOCATION_COUNTER",
-    "KELVO_TAG_APP_WAKEUP",         "KELVO_TAG_APP_TYPE",
+    "KELVO_TAG_TIME_CHANGED",        "KELVO_TAG_KERNEL_SUSPEND", "KELVO_TAG_KERNEL_RESUME",
+    "KELVO_TAG_KERNEL_WAKEUP",       "KELVO_TAG_ALARM_TRIGGER",  "KELVO_TAG_ALARM_WORKSOURCE",
+    "KELVO_TAG_PACKAGE_REMOVED",     "KELVO_TAG_PACKAGE_ADDED",  "KELVO_TAG_UID_REMOVED",
+    "KELVO_TAG_BOOT_COMPLETED",      "KELVO_TAG_SHUTDOWN",       "KELVO_TAG_PHONE_STATE",
+    "KELVO_TAG_RESET_BATTERY_STAT",  "KELVO_TAG_WAKE_STATUS",    "KELVO_TAG_FREEZING_FAILED",
+    "KELVO_TAG_MODEM_WAKEUP_SOURCE", "KELVO_TAG_AP_WAKE_IRQ",    "KELVO_TAG_KERNEL_WAKEUP_PACKET",
+    "KELVO_TAG_SENSORHUB_WAKE",      "KELVO_TAG_WIFI_WAKE_IPV4", "KELVO_TAG_CLOUD_UPDATE",
+    "KELVO_TAG_PM_STRATEGY",         "KELVO_TAG_PM_SCENE",       "KELVO_TAG_LOCATION_COUNTER",
+    "KELVO_TAG_APP_WAKEUP",          "KELVO_TAG_APP_TYPE",
 };
 
 // How long the kernel has been up, in ms.
@@ -473,8 +469,8 @@ int32_t SystemHandler::lateInitialize() {
             KLOGE("Failed to enable stats logging");
         }
         // Only today's dumps count against the daily cap.
-        const long long today = TimeProvider(TimeProvider::getCurrentTime(TIME_TYPE_WALL))
-                                    .startOfDay() * 1000;
+        const long long today =
+            TimeProvider(TimeProvider::getCurrentTime(TIME_TYPE_WALL)).startOfDay() * 1000;
         Parcel dumps;
         int32_t dumpRows = 0;
         if (queryEntriesSimple(String8::format("SELECT COUNT(*) FROM daily_misc_data WHERE name "
@@ -1195,8 +1191,7 @@ int32_t SystemHandler::handleAppType(int64_t time, const char* text) {
     const bool hasTypes = strstr(text, " type=") != nullptr;
     if (parseInt(text, "count=", "flag=", &count) < 0 ||
         parseInt(text, "flag=", "name=", &flag) < 0 ||
-        parseMessage(text, "name=", hasTypes ? "type=" : nullptr, "%s", names, sizeof(names)) <
-            0 ||
+        parseMessage(text, "name=", hasTypes ? "type=" : nullptr, "%s", names, sizeof(names)) < 0 ||
         (hasTypes && parseMessage(text, "type=", nullptr, "%s", types, sizeof(types)) < 0)) {
         return refuse("Failed to parse message");
     }
@@ -1230,10 +1225,10 @@ int32_t SystemHandler::handleAppType(int64_t time, const char* text) {
             forget.writeString8(name);
             forget.setDataPosition(0);
             packages->removePackageType(forget);
-            deleteEntries(k_raw_app_type.name,
-                          String8::format("name = %s",
-                                          KelvoUtils::quoteSqlText(nameList[i].c_str()).c_str())
-                              .c_str());
+            deleteEntries(
+                k_raw_app_type.name,
+                String8::format("name = %s", KelvoUtils::quoteSqlText(nameList[i].c_str()).c_str())
+                    .c_str());
             continue;
         }
         const long long type = typeValues[i];

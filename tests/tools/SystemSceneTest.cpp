@@ -42,8 +42,7 @@ TEST(SystemSceneTest, FilesReadByTheDaemonsReaders) {
     ASSERT_EQ(0, kernel.read(sources, &got));
     std::vector<std::string> names;
     for (const auto& inc : got) {
-        names.push_back(inc.name + "|" + std::to_string(inc.count) + "|" +
-                        std::to_string(inc.time));
+        names.push_back(inc.name + "|" + std::to_string(inc.count) + "|" + std::to_string(inc.time));
     }
     EXPECT_EQ((std::vector<std::string>{"PowerManagerService.WakeLocks|8|6000", "ipa_ws|6|1300",
                                         "qcom_rx_wakelock|6|2400"}),
@@ -104,9 +103,8 @@ TEST(SystemSceneTest, VerbsBecomeRecords) {
     const std::string header = "start 10:00:00\nduration 60\n";
     Scenario scenario;
     std::string error;
-    ASSERT_TRUE(scenario.parse(header +
-                                   "at 1 suspend\nat 2 wakeup RTC0\nat 3 alarm 10061 com.a 2 "
-                                   "sync 3\nat 4 package remove 10061 com.a\n",
+    ASSERT_TRUE(scenario.parse(header + "at 1 suspend\nat 2 wakeup RTC0\nat 3 alarm 10061 com.a 2 "
+                                        "sync 3\nat 4 package remove 10061 com.a\n",
                                "s", &error))
         << error;
     std::vector<std::string> records;

@@ -158,7 +158,7 @@ void SystemScene::configureDriver(fake::FakeKernelDriver& driver) const {
     std::vector<fake::FakeKernelDriver::BinderCall> calls;
     int32_t count = 3;
     for (const Scenario::Process& p : mScenario.processes()) {
-        if (system != nullptr && !p.package.empty()) {
+        if (system != nullptr && p.nameType == 1 && p.uid >= 10000) {
             calls.push_back({system->uid, system->pid, system->name, p.uid, p.pid, p.name, count});
             calls.push_back({p.uid, p.pid, p.name, system->uid, system->pid, system->name, 1});
             count += 2;
@@ -183,8 +183,8 @@ std::string SystemScene::dailyStatistics(int64_t dayMs) {
     std::string body;
     append<int32_t>(&body, 0);
     append<int64_t>(&body, dayMs);
-    append<int64_t>(&body, 23LL * 1024 * 1024 * 1024);   // free storage
-    append<int64_t>(&body, 25LL * 1024 * 1024 * 1024);   // available storage
+    append<int64_t>(&body, 23LL * 1024 * 1024 * 1024);  // free storage
+    append<int64_t>(&body, 25LL * 1024 * 1024 * 1024);  // available storage
     for (int32_t setting : {0, 0, 1, 1, 0, 1, 1, 0}) {  // sdcard .. inscreen
         append<int32_t>(&body, setting);
     }

@@ -51,7 +51,7 @@ public:
     // Lays out the files (before the daemon starts). False with errno set.
     bool layout();
     // The kernel workers, uevents and binder calls the driver reports: calls
-    // from each application process to the first system process.
+    // between each application process and the first system process.
     void configureDriver(fake::FakeKernelDriver& driver) const;
     // Starts the "KelvoService" client, once the daemon listens; its clock
     // is the host's plus the daemon's offset.

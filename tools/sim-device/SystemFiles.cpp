@@ -37,12 +37,8 @@ SystemFiles::SystemFiles(std::string root)
 
 std::vector<SystemFiles::Source> SystemFiles::phoneSources() {
     return {
-        {"PowerManagerService.WakeLocks", 300, 4},
-        {"ipa_ws", 40, 2},
-        {"ipa_ws", 25, 1},
-        {"qcom_rx_wakelock    ", 120, 3},
-        {"alarmtimer", 10, 1},
-        {"eventpoll", 2, 1},
+        {"PowerManagerService.WakeLocks", 300, 4}, {"ipa_ws", 40, 2},     {"ipa_ws", 25, 1},
+        {"qcom_rx_wakelock    ", 120, 3},          {"alarmtimer", 10, 1}, {"eventpoll", 2, 1},
     };
 }
 
@@ -57,8 +53,8 @@ std::string SystemFiles::wakeupSourcesText(const std::vector<Source>& sources) {
     char line[256];
     for (const Source& s : sources) {
         snprintf(line, sizeof(line), "%s\t%lld\t\t%lld\t\t0\t\t0\t\t0\t\t%lld\t\t%lld\t\t0\t\t0\n",
-                 s.name.c_str(), static_cast<long long>(s.count),
-                 static_cast<long long>(s.count), static_cast<long long>(s.totalMs),
+                 s.name.c_str(), static_cast<long long>(s.count), static_cast<long long>(s.count),
+                 static_cast<long long>(s.totalMs),
                  static_cast<long long>(s.totalMs / (s.count > 0 ? s.count : 1)));
         text += line;
     }
@@ -119,8 +115,7 @@ bool SystemFiles::writeCounters() const {
 }
 
 bool SystemFiles::layout() {
-    return writeFile("sys/class/tv_power/charger/charge_data/enable_hiz", "0\n") &&
-           writeCounters();
+    return writeFile("sys/class/tv_power/charger/charge_data/enable_hiz", "0\n") && writeCounters();
 }
 
 void SystemFiles::setMemory(int64_t freeKb, int64_t availableKb) {

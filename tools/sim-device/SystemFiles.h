@@ -20,7 +20,7 @@ namespace kelvo {
 class SystemFiles {
 public:
     struct Source {
-        std::string name;  // as written: blanks after it are kept
+        std::string name;     // as written: blanks after it are kept
         int64_t msPerSecond;  // held time added per second
         int32_t activations;  // active count added per 10 s
         int64_t count = 0;

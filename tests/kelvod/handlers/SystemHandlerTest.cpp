@@ -663,8 +663,7 @@ TEST_F(SystemLateInitTest, DriverReportsBecomeRows) {
         "SELECT end_time, service, client, forward, backward, foreground FROM raw_binder_stats";
     const std::string kworker = "SELECT timestamp, symbol, count, time FROM raw_kworker";
     ASSERT_TRUE(waitFor([&] { return !rows(binder).empty() && !rows(kworker).empty(); }));
-    EXPECT_EQ(std::vector<std::string>{at(1000) + "|com.server|com.app|5|3|1"},
-              rows(binder));
+    EXPECT_EQ(std::vector<std::string>{at(1000) + "|com.server|com.app|5|3|1"}, rows(binder));
     EXPECT_EQ(std::vector<std::string>{at(0) + "|flush_to_disk|7|120"}, rows(kworker));
     EXPECT_EQ(0u, capture.count("Invalid data length"));
 }
