@@ -230,11 +230,6 @@ void SystemScene::stop() {
     }
 }
 
-std::map<int32_t, int32_t> SystemScene::answered() const {
-    std::lock_guard<std::mutex> guard(mLock);
-    return mAnswered;
-}
-
 void SystemScene::serve() {
     BufferedLogClient client;
     bool connected = false;
@@ -272,10 +267,7 @@ void SystemScene::serve() {
         if (client.send(magic, body) != 0) {
             client.close();
             connected = false;
-            continue;
         }
-        std::lock_guard<std::mutex> guard(mLock);
-        ++mAnswered[magic];
     }
     client.close();
 }

@@ -5,7 +5,6 @@
 #include <atomic>
 #include <map>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <thread>
 #include <vector>
@@ -63,9 +62,6 @@ public:
     // result.
     int write(LogWriter& writer, const std::string& record, int64_t timeMs);
 
-    // Requests answered so far, by request code.
-    std::map<int32_t, int32_t> answered() const;
-
     // The record bodies (docs/system-records.md).
     static std::string dailyStatistics(int64_t dayMs);
     static std::string mobilePhone();
@@ -79,8 +75,6 @@ private:
     std::atomic<bool> mStop{false};
     int64_t mClockOffsetMs = 0;
     std::thread mThread;
-    mutable std::mutex mLock;
-    std::map<int32_t, int32_t> mAnswered;
 };
 
 }  // namespace sim
