@@ -433,18 +433,11 @@ int32_t SystemHandler::lateInitialize() {
         KLOGE("Failed to query error log count: %d", rows);
     }
     // The versions, one row per key.
-    const struct {
-        const char* key;
-        std::string value;
-    } kVersions[] = {
+    std::vector<std::pair<const char*, std::string>> versions = {
         {"kelvod_version", "000.1.4.0"},
         {"product_version", readProperty("ro.build.description")},
         {"software_version", readProperty("ro.build.display.id")},
     };
-    std::vector<std::pair<const char*, std::string>> versions;
-    for (const auto& v : kVersions) {
-        versions.emplace_back(v.key, v.value);
-    }
     Parcel textRequest;
     textRequest.writeInt32(0);
     Parcel textReply;
