@@ -1,8 +1,10 @@
 #include "handlers/SystemHandler.h"
 
 #include <cutils/properties.h>
+#include <errno.h>
 #include <limits.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 #include <time.h>
 #include <unistd.h>
@@ -28,6 +30,7 @@
 #include "utils/KelvoUtils.h"
 #include "utils/LoggerMessage.h"
 #include "utils/PackageProperty.h"
+#include "utils/SystraceDumper.h"
 #include "utils/TimeProvider.h"
 #include "utils/devices/KelvoDevice.h"
 
@@ -190,18 +193,15 @@ const table_attribute* const kKeptTables[] = {
 };
 
 const char* const kTagNames[SystemHandler::TAG_COUNT] = {
-    "KELVO_TAG_TIME_CHANGED",       "KELVO_TAG_KERNEL_SUSPEND",
-    "KELVO_TAG_KERNEL_RESUME",      "KELVO_TAG_KERNEL_WAKEUP",
-    "KELVO_TAG_ALARM_TRIGGER",      "KELVO_TAG_ALARM_WORKSOURCE",
-    "KELVO_TAG_PACKAGE_REMOVED",    "KELVO_TAG_PACKAGE_ADDED",
-    "KELVO_TAG_UID_REMOVED",        "KELVO_TAG_BOOT_COMPLETED",
-    "KELVO_TAG_SHUTDOWN",           "KELVO_TAG_PHONE_STATE",
-    "KELVO_TAG_RESET_BATTERY_STAT", "KELVO_TAG_WAKE_STATUS",
-    "KELVO_TAG_FREEZING_FAILED",    "KELVO_TAG_MODEM_WAKEUP_SOURCE",
-    "KELVO_TAG_AP_WAKE_IRQ",        "KELVO_TAG_KERNEL_WAKEUP_PACKET",
-    "KELVO_TAG_SENSORHUB_WAKE",     "KELVO_TAG_WIFI_WAKE_IPV4",
-    "KELVO_TAG_CLOUD_UPDATE",       "KELVO_TAG_PM_SCENE",
-    "KELVO_TAG_APP_WAKEUP",         "KELVO_TAG_PM_STRATEGY",
+    "KELVO_TAG_TIME_CHANGED",        "KELVO_TAG_KERNEL_SUSPEND", "KELVO_TAG_KERNEL_RESUME",
+    "KELVO_TAG_KERNEL_WAKEUP",       "KELVO_TAG_ALARM_TRIGGER",  "KELVO_TAG_ALARM_WORKSOURCE",
+    "KELVO_TAG_PACKAGE_REMOVED",     "KELVO_TAG_PACKAGE_ADDED",  "KELVO_TAG_UID_REMOVED",
+    "KELVO_TAG_BOOT_COMPLETED",      "KELVO_TAG_SHUTDOWN",       "KELVO_TAG_PHONE_STATE",
+    "KELVO_TAG_RESET_BATTERY_STAT",  "KELVO_TAG_WAKE_STATUS",    "KELVO_TAG_FREEZING_FAILED",
+    "KELVO_TAG_MODEM_WAKEUP_SOURCE", "KELVO_TAG_AP_WAKE_IRQ",    "KELVO_TAG_KERNEL_WAKEUP_PACKET",
+    "KELVO_TAG_SENSORHUB_WAKE",      "KELVO_TAG_WIFI_WAKE_IPV4", "KELVO_TAG_CLOUD_UPDATE",
+    "KELVO_TAG_PM_STRATEGY",         "KELVO_TAG_PM_SCENE",       "KELVO_TAG_LOCATION_COUNTER",
+    "KELVO_TAG_APP_WAKEUP",          "KELVO_TAG_APP_TYPE",
 };
 
 // How long the kernel has been up, in ms.
@@ -433,21 +433,59 @@ int32_t SystemHandler::lateInitialize() {
         KLOGE("Failed to query error log count: %d", rows);
     }
     // The versions, one row per key.
-    const struct {
-        const char* key;
-        std::string value;
-    } kVersions[] = {
+    std::vector<std::pair<const char*, std::string>> versions = {
         {"kelvod_version", "000.1.4.0"},
         {"product_version", readProperty("ro.build.description")},
         {"software_version", readProperty("ro.build.display.id")},
     };
-    for (const auto& v : kVersions) {
+    Parcel textRequest;
+    textRequest.writeInt32(0);
+    Parcel textReply;
+    String8 xmlVersion;
+    if (getXmlConfig(CONFIG_TEXT, textRequest, &textReply) >= 0 &&
+        textReply.readString8(&xmlVersion) == android::NO_ERROR && xmlVersion.length() > 0) {
+        versions.emplace_back("xml_version", xmlVersion.c_str());
+    } else {
+        KLOGD("Get xml version failed");
+    }
+    for (const auto& v : versions) {
         Parcel row;
         row.writeInt64(KelvoAgent::getInstance()->getSystemBootTime());
-        row.writeString8(String8(v.key));
-        row.writeString8(String8(v.value.c_str()));
-        updateEntries(k_about_kelvo_daemon, row,
-                      String8::format("key = %s", KelvoUtils::quoteSqlText(v.key).c_str()).c_str());
+        row.writeString8(String8(v.first));
+        row.writeString8(String8(v.second.c_str()));
+        updateEntries(
+            k_about_kelvo_daemon, row,
+            String8::format("key = %s", KelvoUtils::quoteSqlText(v.first).c_str()).c_str());
+    }
+    if (mStatsUser) {
+        if (KelvoDevice::setLogStatsEnable(true) < 0) {
+            KLOGE("Failed to enable stats logging");
+        }
+        // Only today's dumps count against the daily cap.
+        const long long today =
+            TimeProvider(TimeProvider::getCurrentTime(TIME_TYPE_WALL)).startOfDay() * 1000;
+        Parcel dumps;
+        int32_t dumpRows = 0;
+        if (queryEntriesSimple(String8::format("SELECT COUNT(*) FROM daily_misc_data WHERE name "
+                                               "== 'systrace' AND timestamp >= %lld",
+                                               today),
+                               &dumps, 1, dumpRows) >= 0 &&
+            dumpRows == 1) {
+            SystraceDumper::getInstance()->setDumpCount(
+                KelvoUtils::saturateInt32(dumps.readInt64()));
+        } else {
+            KLOGE("Failed to query entries");
+        }
+    }
+    Parcel types;
+    int32_t typeRows = 0;
+    int32_t ret = queryEntriesSimple(
+        String8::format("SELECT timestamp, name, type FROM %s", k_raw_app_type.name), &types, 3,
+        typeRows);
+    if (ret < 0) {
+        KLOGE("Failed to query app type: %d", ret);
+    } else if (typeRows > 0) {
+        PackageProperty::getInstance()->addPackageType(types);
     }
     // Nothing read the current state yet: the first poll only sets the baseline.
     std::vector<KernelWakelockReader::increment> ignored;
@@ -497,6 +535,10 @@ int32_t SystemHandler::handleLogger(int64_t time, int32_t tag, const char* text)
             return 0;
         case TAG_PM_STRATEGY:
             return handleStrategy(time, text);
+        case TAG_LOCATION_COUNTER:
+            return handleLocationCounter(time, text);
+        case TAG_APP_TYPE:
+            return handleAppType(time, text);
         default:
             if (tag > TAG_RESET_BATTERY_STAT && tag < TAG_COUNT) {
                 return handleRecord(time, tag, text);
@@ -1034,8 +1076,49 @@ int32_t SystemHandler::handleRecord(int64_t time, int32_t tag, const char* text)
     return insertEntries(*table, row, 1, false);
 }
 
+namespace {
+
+// The items of a comma-separated list; empty or over-long items are left
+// out, so that the caller's count check refuses the record.
+std::vector<std::string> splitList(const std::string& text, size_t maxItem) {
+    std::vector<std::string> list;
+    for (size_t start = 0; start <= text.size();) {
+        size_t comma = text.find(',', start);
+        if (comma == std::string::npos) {
+            comma = text.size();
+        }
+        if (comma > start && comma - start < maxItem) {
+            list.push_back(text.substr(start, comma - start));
+        }
+        start = comma + 1;
+    }
+    return list;
+}
+
+// A whole decimal number in [min, max].
+bool parseWhole(const std::string& text, long long min, long long max, long long* out) {
+    if (text.empty() || text.size() > 19) {
+        return false;
+    }
+    char* end = nullptr;
+    errno = 0;
+    long long value = strtoll(text.c_str(), &end, 10);
+    if (errno != 0 || end == nullptr || *end != '\0' || value < min || value > max) {
+        return false;
+    }
+    *out = value;
+    return true;
+}
+
+int32_t refuseCount(const char* what, int32_t count, size_t items) {
+    HealthCounters::add(Health::LoggerMessageRefused);
+    KLOGE("Invalid %s count: %d, names: %zu", what, count, items);
+    return -5;
+}
+
+}  // namespace
+
 int32_t SystemHandler::handleStrategy(int64_t time, const char* text) {
-    std::string names;
     int32_t type = 0;
     int32_t count = 0;
     int32_t update = 0;
@@ -1046,22 +1129,9 @@ int32_t SystemHandler::handleStrategy(int64_t time, const char* text) {
         parseInt(text, "update=", nullptr, &update) < 0) {
         return refuse("Failed to parse message");
     }
-    names = buffer;
-    std::vector<std::string> list;
-    for (size_t start = 0; start <= names.size();) {
-        size_t comma = names.find(',', start);
-        if (comma == std::string::npos) {
-            comma = names.size();
-        }
-        if (comma > start && comma - start < kNameSize) {
-            list.push_back(names.substr(start, comma - start));
-        }
-        start = comma + 1;
-    }
+    const std::vector<std::string> list = splitList(buffer, kNameSize);
     if (count < 1 || count > kMaxStrategyNames || static_cast<size_t>(count) != list.size()) {
-        HealthCounters::add(Health::LoggerMessageRefused);
-        KLOGE("Invalid strategy count: %d, names: %zu", count, list.size());
-        return -5;
+        return refuseCount("strategy", count, list.size());
     }
     if (update == 1) {
         // Once for the whole list: the type's rows become these names.
@@ -1074,6 +1144,103 @@ int32_t SystemHandler::handleStrategy(int64_t time, const char* text) {
         rows.writeInt32(type);
     }
     return insertEntries(k_raw_pelmora_strategy, rows, count, false);
+}
+
+int32_t SystemHandler::handleLocationCounter(int64_t time, const char* text) {
+    int32_t num = 0;
+    char counts[4096] = {};
+    char names[4096] = {};
+    if (parseInt(text, "num=", "count=", &num) < 0 ||
+        parseMessage(text, "count=", "name=", "%s", counts, sizeof(counts)) < 0 ||
+        parseMessage(text, "name=", nullptr, "%s", names, sizeof(names)) < 0) {
+        return refuse("Failed to parse message");
+    }
+    const std::vector<std::string> countList = splitList(counts, 12);
+    const std::vector<std::string> nameList = splitList(names, kNameSize);
+    if (num < 1 || num > kMaxStrategyNames || static_cast<size_t>(num) != nameList.size() ||
+        nameList.size() != countList.size()) {
+        return refuseCount("location counter", num, nameList.size());
+    }
+    Parcel rows;
+    for (int32_t i = 0; i < num; ++i) {
+        long long value = 0;
+        if (!parseWhole(countList[i], 0, INT32_MAX, &value)) {
+            return refuse("Failed to parse message");
+        }
+        KLOGI("id: %d, timestamp: %lld, name: %s, number: %lld", i, static_cast<long long>(time),
+              nameList[i].c_str(), value);
+        rows.writeInt64(time);
+        rows.writeString8(String8(nameList[i].c_str()));
+        rows.writeInt32(static_cast<int32_t>(value));
+    }
+    return insertEntries(k_raw_location_counter, rows, num, false);
+}
+
+int32_t SystemHandler::handleAppType(int64_t time, const char* text) {
+    int32_t count = 0;
+    int32_t flag = -1;
+    char names[4096] = {};
+    char types[4096] = {};
+    const bool hasTypes = strstr(text, " type=") != nullptr;
+    if (parseInt(text, "count=", "flag=", &count) < 0 ||
+        parseInt(text, "flag=", "name=", &flag) < 0 ||
+        parseMessage(text, "name=", hasTypes ? "type=" : nullptr, "%s", names, sizeof(names)) < 0 ||
+        (hasTypes && parseMessage(text, "type=", nullptr, "%s", types, sizeof(types)) < 0)) {
+        return refuse("Failed to parse message");
+    }
+    if (flag != 0 && flag != 1) {
+        HealthCounters::add(Health::LoggerMessageRefused);
+        KLOGE("Invalid flag: %d", flag);
+        return -5;
+    }
+    const std::vector<std::string> nameList = splitList(names, kNameSize);
+    const std::vector<std::string> typeList = splitList(types, 20);
+    if (count < 1 || count > kMaxStrategyNames || static_cast<size_t>(count) != nameList.size() ||
+        (flag == 1 && typeList.size() != nameList.size())) {
+        HealthCounters::add(Health::LoggerMessageRefused);
+        KLOGE("Invalid app count: %d, flag: %d", count, flag);
+        return -5;
+    }
+    // Every type is checked before anything is recorded.
+    std::vector<long long> typeValues(typeList.size());
+    for (size_t i = 0; flag == 1 && i < typeList.size(); ++i) {
+        if (!parseWhole(typeList[i], 1, INT32_MAX, &typeValues[i])) {
+            return refuse("Failed to parse message");
+        }
+    }
+    PackageProperty* packages = PackageProperty::getInstance();
+    Parcel rows;
+    int32_t added = 0;
+    for (int32_t i = 0; i < count; ++i) {
+        const String8 name(nameList[i].c_str());
+        if (flag == 0) {
+            Parcel forget;
+            forget.writeString8(name);
+            forget.setDataPosition(0);
+            packages->removePackageType(forget);
+            deleteEntries(
+                k_raw_app_type.name,
+                String8::format("name = %s", KelvoUtils::quoteSqlText(nameList[i].c_str()).c_str())
+                    .c_str());
+            continue;
+        }
+        const long long type = typeValues[i];
+        if (packages->getPackageType(name) != 0) {
+            KLOGI("App type exist, name: %s", name.c_str());
+            continue;
+        }
+        Parcel record;
+        record.writeInt64(time);
+        record.writeString8(name);
+        record.writeInt64(type);
+        record.setDataPosition(0);
+        packages->addPackageType(record);
+        rows.writeInt64(time);
+        rows.writeString8(name);
+        rows.writeInt64(type);
+        ++added;
+    }
+    return added > 0 ? insertEntries(k_raw_app_type, rows, added, false) : 0;
 }
 
 int32_t SystemHandler::insertMiscData(const Parcel& data) {
@@ -1662,6 +1829,7 @@ int32_t SystemHandler::onDailyTick(const Parcel& data) {
     readDdr(hour);
     voteCandidate(hour, kCandidateDailyTick, elector);
     ErrorLogger::setCounter(0);
+    SystraceDumper::getInstance()->setDumpCount(0);
     mKernelWakelocks.prune();
     mPartialWakelocks.prune();
     return 0;

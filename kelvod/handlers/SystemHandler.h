@@ -46,10 +46,12 @@ public:
         TAG_SENSORHUB_WAKE = 18,
         TAG_WIFI_WAKE_IPV4 = 19,
         TAG_CLOUD_UPDATE = 20,
-        TAG_PM_SCENE = 21,
-        TAG_APP_WAKEUP = 22,
-        TAG_PM_STRATEGY = 23,
-        TAG_COUNT = 24,
+        TAG_PM_STRATEGY = 21,
+        TAG_PM_SCENE = 22,
+        TAG_LOCATION_COUNTER = 23,
+        TAG_APP_WAKEUP = 24,
+        TAG_APP_TYPE = 25,
+        TAG_COUNT = 26,
     };
     // Customized messages.
     enum system_message : int32_t {
@@ -100,6 +102,7 @@ public:
     // A time change beyond this is no clock adjustment but a broken record.
     static constexpr int64_t kMaxTimeDeltaMs = 100LL * 366 * 24 * 3600 * 1000;
     static constexpr size_t kNameSize = 64;
+    // Names in one strategy, location-counter or application-type record.
     static constexpr int32_t kMaxStrategyNames = 256;
     static constexpr const char* kMemInfoPath = "/proc/meminfo";
     static constexpr const char* kDdrPath = "/sys/class/devfreq/ddrfreq/trans_stat";
@@ -184,6 +187,11 @@ private:
     // "name=A,B,C type=T count=3 update=U": with update 1 the type's rows
     // are replaced by the names.
     int32_t handleStrategy(int64_t time, const char* text);
+    // "num=N count=C1,..,CN name=A1,..,AN": one row per name.
+    int32_t handleLocationCounter(int64_t time, const char* text);
+    // "count=N flag=F name=A1,..,AN type=T1,..,TN": flag 1 records the
+    // types of new names, flag 0 forgets the names.
+    int32_t handleAppType(int64_t time, const char* text);
     int32_t checkAlarmWakeup(int64_t wake);
     int32_t checkWifiWake(int64_t wake);
     int32_t insertMiscData(const android::Parcel& data);

@@ -8,7 +8,9 @@ namespace kelvo {
 namespace fake {
 
 FakeDriverReporter::FakeDriverReporter(FakeKernelDriver& driver)
-    : mDriver(driver), mShared(std::make_shared<Shared>()) {}
+    : mDriver(driver), mShared(std::make_shared<Shared>()) {
+    mShared->driver = &driver;
+}
 
 FakeDriverReporter::~FakeDriverReporter() {
     stop();
@@ -87,6 +89,59 @@ bool FakeDriverReporter::parseRequest(const FakeKernelDriver::Request& request, 
     return true;
 }
 
+namespace {
+
+template <typename T>
+void append(std::string* out, T value) {
+    out->append(reinterpret_cast<const char*>(&value), sizeof(value));
+}
+
+void appendText(std::string* out, const std::string& text, size_t field) {
+    std::string cut = text.substr(0, field);
+    cut.resize(field, '\0');
+    *out += cut;
+}
+
+}  // namespace
+
+std::string FakeDriverReporter::reportBody(const Report& report,
+                                           const FakeKernelDriver::State& state) {
+    std::string body;
+    switch (report.magic) {
+        case MAGIC_KWORKER:
+            append<int32_t>(&body, static_cast<int32_t>(state.kworkers.size()));
+            for (const FakeKernelDriver::Kworker& k : state.kworkers) {
+                appendText(&body, k.symbol, 64);
+                append<int64_t>(&body, k.count);
+                append<int64_t>(&body, k.timeMs);
+            }
+            break;
+        case MAGIC_UEVENT:
+            append<int32_t>(&body, static_cast<int32_t>(state.uevents.size()));
+            for (const FakeKernelDriver::Uevent& u : state.uevents) {
+                appendText(&body, u.devpath, 128);
+                append<int32_t>(&body, u.action);
+                append<int32_t>(&body, u.count);
+            }
+            break;
+        case MAGIC_BINDER_STATS:
+            append<int32_t>(&body, static_cast<int32_t>(state.binderCalls.size()));
+            for (const FakeKernelDriver::BinderCall& b : state.binderCalls) {
+                append<int32_t>(&body, b.serviceUid);
+                append<int32_t>(&body, b.servicePid);
+                appendText(&body, b.service, 48);
+                append<int32_t>(&body, b.clientUid);
+                append<int32_t>(&body, b.clientPid);
+                appendText(&body, b.client, 48);
+                append<int32_t>(&body, b.count);
+            }
+            break;
+        default:
+            break;
+    }
+    return body;
+}
+
 void FakeDriverReporter::Shared::answer(const FakeKernelDriver::Request& request) {
     Report report;
     if (!parseRequest(request, &report)) {
@@ -101,6 +156,9 @@ void FakeDriverReporter::Shared::answer(const FakeKernelDriver::Request& request
     memcpy(&data[sizeof(report.time)], &report.reason, sizeof(report.reason));
     if (body) {
         data += body(report);
+    } else if (driver != nullptr) {
+        // The listener runs outside the driver's lock.
+        data += reportBody(report, driver->state());
     }
     if (sendLocked(report.magic, data)) {
         ++sent;

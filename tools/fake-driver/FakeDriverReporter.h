@@ -19,7 +19,8 @@ namespace fake {
 // report (0 per-process CPU time, 1 kernel workers, 2 uevents, 3 binder
 // statistics); its data starts with the request's echo, int64 time and int32
 // reason (0 for the kernel-worker and uevent requests, which carry a time
-// only), followed by the body the user supplies (empty by default).
+// only), followed by the body the user supplies; without a supplier, the
+// driver's kernel workers, uevents or binder calls (reportBody).
 class FakeDriverReporter {
 public:
     static constexpr const char* kClientName = "kelvo_driver";
@@ -52,8 +53,12 @@ public:
     // daemon's receivers exist by then) and again after the daemon closed it.
     void start();
     void stop();
-    // A null provider sends empty bodies.
+    // A null provider sends the driver state's bodies.
     void setBodyProvider(BodyProvider provider);
+    // The body after the echo for a kernel-worker, uevent or binder
+    // statistics report: int32 n, then n entries of 80, 136 or 116 bytes
+    // (texts cut to their fields); empty for the other reports.
+    static std::string reportBody(const Report& report, const FakeKernelDriver::State& state);
 
     // Entries sent, and reports that could not be sent (no server, or the
     // connection failed twice).
@@ -72,6 +77,7 @@ private:
         std::mutex lock;
         bool active = false;
         BodyProvider body;
+        FakeKernelDriver* driver = nullptr;
         BufferedLogClient client;
         bool connected = false;
         size_t sent = 0;

@@ -35,6 +35,28 @@ public:
         int64_t idleUs;
     };
 
+    // What the kernel-worker, uevent and binder statistics reports carry
+    // (FakeDriverReporter::reportBody lays them out).
+    struct Kworker {
+        std::string symbol;
+        int64_t count;
+        int64_t timeMs;
+    };
+    struct Uevent {
+        std::string devpath;
+        int32_t action;
+        int32_t count;
+    };
+    struct BinderCall {
+        int32_t serviceUid;
+        int32_t servicePid;
+        std::string service;
+        int32_t clientUid;
+        int32_t clientPid;
+        std::string client;
+        int32_t count;
+    };
+
     struct State {
         // "/dev/kelvo"
         std::map<uint32_t, bool> flags;  // the switch requests, by number
@@ -48,6 +70,9 @@ public:
         // Process names by pid; a name of 48 bytes or more fills the field
         // without a terminator.
         std::map<int32_t, std::string> processNames;
+        std::vector<Kworker> kworkers;
+        std::vector<Uevent> uevents;
+        std::vector<BinderCall> binderCalls;
         // "/dev/dpm_ldm"
         int32_t version = 1;
         int32_t enable = 0;

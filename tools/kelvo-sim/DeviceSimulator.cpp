@@ -197,6 +197,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         return false;
     }
     mComponents.reset(new ComponentTruth(mScenario, profile));
+    mSystem.reset(new SystemScene(mScenario, root));
+    if (!mSystem->layout()) {
+        *error = "cannot lay out the system files below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -234,10 +239,12 @@ bool DeviceSimulator::startServices(std::string* error) {
         std::lock_guard<std::mutex> lock(mLock);
         return mComponents->takeAdvancedValue(mModelMs);
     });
+    mSystem->configureDriver(*mDriver);
     mReporter.reset(new fake::FakeDriverReporter(*mDriver));
     mReporter->setBodyProvider([this](const fake::FakeDriverReporter::Report& report) {
-        return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME ? answerCpuRequest()
-                                                                            : std::string();
+        return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME
+                   ? answerCpuRequest()
+                   : fake::FakeDriverReporter::reportBody(report, mDriver->state());
     });
     mReporter->start();
     mLogWriter.reset(new LogWriter(RootPath::resolve("/dev/tvlog_kelvo")));
@@ -331,6 +338,9 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             mServices->state()->setBattery(battery);
             return;
         }
+        case Scenario::Action::System:
+            result = mSystem->write(*mLogWriter, step.text, t);
+            break;
         case Scenario::Action::Battery: {
             PlatformState::Battery battery = mServices->state()->battery();
             battery.level = step.value;
@@ -361,6 +371,9 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
 void DeviceSimulator::advanceTo(int64_t ms) {
     std::lock_guard<std::mutex> lock(mLock);
     mModel.advance(ms - mModelMs);
+    if (mSystem) {
+        mSystem->advance(ms - mModelMs);
+    }
     mModelMs = ms;
 }
 
@@ -469,6 +482,9 @@ bool DeviceSimulator::play() {
 }
 
 void DeviceSimulator::stopAll() {
+    if (mSystem) {
+        mSystem->stop();
+    }
     if (mReporter) {
         mReporter->stop();
     }
@@ -585,6 +601,7 @@ int DeviceSimulator::run() {
         }
         return 1;
     }
+    mSystem->startService(mOffsetMs);
     // The steps count from here, once the daemon is up.
     mStartMs = simulatedNowMs();
     mNextHourMs = (mStartMs / kHourMs + 1) * kHourMs - mStartMs;

@@ -12,6 +12,7 @@
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "Scenario.h"
+#include "SystemScene.h"
 
 namespace kelvo {
 
@@ -105,6 +106,7 @@ private:
     std::unique_ptr<fake::FakeKernelDriver> mDriver;
     std::unique_ptr<fake::FakeDriverReporter> mReporter;
     std::unique_ptr<LogWriter> mLogWriter;
+    std::unique_ptr<SystemScene> mSystem;
     int32_t mLogWritten = 0;
     int32_t mLogUnread = 0;
     DaemonProcess mDaemon;

@@ -9,6 +9,7 @@
 #include <sstream>
 
 #include "CpuTree.h"
+#include "SystemScene.h"
 
 namespace kelvo {
 namespace sim {
@@ -325,6 +326,11 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
             *reason = "expected \"at <time> battery <level 0..100>%\"";
             return false;
         }
+    } else if (int system = SystemScene::parseStep(words, &step.text, reason)) {
+        if (system < 0) {
+            return false;
+        }
+        step.action = Action::System;
     } else if (!parseComponentStep(words, &step, reason)) {
         return false;
     }

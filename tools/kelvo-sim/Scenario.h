@@ -43,6 +43,7 @@ public:
         Gnss,        // flag: start, text: the package
         Flashlight,  // flag: on
         Torch,       // pid: the torch user's process
+        System,      // text: the record (SystemScene::parseStep)
     };
 
     struct Step {

@@ -10,13 +10,18 @@
 #include <string>
 #include <vector>
 
+#include "FakeDriverReporter.h"
+#include "FakeKernelDriver.h"
 #include "HealthCounters.h"
+#include "KelvoLog.h"
 #include "core/AppsAccounting.h"
+#include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/KelvoAgent.h"
 #include "core/Notifier.h"
 #include "handlers/KernelWakelockReader.h"
 #include "handlers/SystemHandler.h"
+#include "kelvo/BufferedLogClient.h"
 #include "kelvo/RootPath.h"
 #include "kelvo/WallClock.h"
 #include "kelvod/storage/StorageTestUtil.h"
@@ -25,6 +30,9 @@
 #include "routines/PollingRoutine.h"
 #include "storage/DataUploader.h"
 #include "utils/PackageProperty.h"
+#include "utils/SystraceDumper.h"
+#include "utils/XmlParser.h"
+#include "utils/devices/KelvoDevice.h"
 
 using android::Parcel;
 using android::sp;
@@ -68,12 +76,30 @@ protected:
         mHandler->initialize();
     }
     void TearDown() override {
+        stopHandler();
+        // The process-wide type cache forgets the names the tests record.
+        Parcel types;
+        for (const char* name : {"t.a", "t'b", "com.typed"}) {
+            types.writeString8(String8(name));
+        }
+        types.setDataPosition(0);
+        PackageProperty::getInstance()->removePackageType(types);
+        ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
+        kelvo::test::AgentStorageTest::TearDown();
+    }
+    void stopHandler() {
         Dispatcher::resetForTest();
         mHandler->readyToDestroy();
         mHandler->requestThreadExit();
         mHandler->join();
-        ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
-        kelvo::test::AgentStorageTest::TearDown();
+    }
+    // A new handler over the same database, as after a daemon restart.
+    void restart() {
+        StorageOperator::forceFlushEntries();
+        stopHandler();
+        mHandler = new SystemHandler();
+        ASSERT_EQ(0, mHandler->earlyInitialize());
+        mHandler->initialize();
     }
     void run(const Step& s) {
         if (s.tag < 0) {
@@ -209,6 +235,22 @@ INSTANTIATE_TEST_SUITE_P(
                   {SystemHandler::TAG_PM_STRATEGY, 3000, "name=e,f type=1 count=9 update=1"}},
                  "SELECT name, type FROM raw_pelmora_strategy ORDER BY name",
                  {"c|1", "d|1", "z|2"}},
+        Scenario{"LocationCounters",
+                 {{SystemHandler::TAG_LOCATION_COUNTER, 1000, "num=2 count=3,7 name=com.a,com.b"},
+                  {SystemHandler::TAG_LOCATION_COUNTER, 2000, "num=2 count=1 name=com.c,com.d"},
+                  {SystemHandler::TAG_LOCATION_COUNTER, 3000, "num=1 count=-4 name=com.e"},
+                  {SystemHandler::TAG_LOCATION_COUNTER, 4000, "num=9999 count=1 name=com.f"}},
+                 "SELECT name, count FROM raw_location_counter ORDER BY name",
+                 {"com.a|3", "com.b|7"}},
+        Scenario{"AppTypesFirstWinsAndForget",
+                 {{SystemHandler::TAG_APP_TYPE, 1000, "count=2 flag=1 name=t.a,t'b type=4,8"},
+                  {SystemHandler::TAG_APP_TYPE, 2000, "count=1 flag=1 name=t.a type=16"},
+                  {SystemHandler::TAG_APP_TYPE, 3000, "count=1 flag=0 name=t'b"},
+                  {SystemHandler::TAG_APP_TYPE, 4000, "count=1 flag=2 name=t.c type=1"},
+                  {SystemHandler::TAG_APP_TYPE, 5000, "count=2 flag=1 name=t.d,t.e type=1,x"},
+                  {SystemHandler::TAG_APP_TYPE, 6000, "count=3 flag=1 name=t.f type=1"}},
+                 "SELECT name, type FROM raw_app_type ORDER BY name",
+                 {"t.a|4"}},
         Scenario{"SensorHubSourceAndReason",
                  {{SystemHandler::TAG_SENSORHUB_WAKE, 1000, "data=196613"},
                   {SystemHandler::TAG_SENSORHUB_WAKE, 2000, "data=x"}},
@@ -528,6 +570,102 @@ TEST_F(SystemHandlerTest, BufferedRecords) {
         (std::vector<std::string>{"storage_available|222", "storage_free|111", "storage_usb|1"}),
         rows("SELECT name, value FROM daily_misc_data WHERE name IN ('storage_free', "
              "'storage_available', 'storage_usb') ORDER BY name"));
+}
+
+}  // namespace
+
+namespace {
+
+// A handler of a log user type that collects kernel statistics, with the
+// sample configuration, on a fixed clock.
+class SystemLateInitTest : public SystemHandlerTest {
+protected:
+    void addTables() override {
+        setenv("TZ", "UTC", 1);
+        tzset();
+        WallClock::setFixedTimeMs(kH);
+        mUserType = gLogUserType.exchange(3);
+        ASSERT_TRUE(mDriver.start());
+        // The process-wide server listens below the root of its first start.
+        ASSERT_EQ(0, BufferedLogServer::getInstance()->start());
+        mRoot->writeFile("/data/misc/kelvo/tv_kelvo_config.xml",
+                         kelvo::test::readHostFile(KELVO_SAMPLE_CONFIG));
+        XmlParser::resetInstance();
+        SystemHandlerTest::addTables();
+    }
+    void TearDown() override {
+        SystemHandlerTest::TearDown();
+        gLogUserType = mUserType;
+        XmlParser::resetInstance();
+        SystraceDumper::getInstance()->resetForTest();
+        WallClock::setFixedTimeMs(-1);
+        unsetenv("TZ");
+        tzset();
+    }
+    int32_t mUserType = 0;
+    fake::FakeKernelDriver mDriver;
+};
+
+// A restart takes back today's trace dumps (the daily tick clears them), the
+// application types and the configuration's version.
+TEST_F(SystemLateInitTest, RestartReadsItsStateBack) {
+    for (int64_t t : {kH - 1000, kH - 2000, kH - 11 * kHour}) {
+        Parcel misc;
+        misc.writeInt64(t);
+        misc.writeString8(String8("systrace"));
+        misc.writeString8(String8("1"));
+        mHandler->sendMessageSync(
+            ParcelMessage(MESSAGE_CUSTOMIZED, SystemHandler::MESSAGE_MISC_DATA, misc));
+    }
+    run({SystemHandler::TAG_APP_TYPE, 0, "count=1 flag=1 name=com.typed type=6"});
+    Parcel forget;
+    forget.writeString8(String8("com.typed"));
+    forget.setDataPosition(0);
+    PackageProperty::getInstance()->removePackageType(forget);
+    restart();
+    EXPECT_EQ(2, SystraceDumper::getInstance()->getDumpCount());
+    EXPECT_EQ(6, PackageProperty::getInstance()->getPackageType(String8("com.typed")));
+    EXPECT_EQ(std::vector<std::string>{"SIM_1.0.0"},
+              rows("SELECT value FROM about_kelvo_daemon WHERE key = 'xml_version'"));
+    Parcel day;
+    day.writeInt64(kH);
+    day.writeInt64(kH);
+    notify(NOTIFICATION_DAILY_TICK, day);
+    EXPECT_EQ(0, SystraceDumper::getInstance()->getDumpCount());
+    EXPECT_TRUE(mDriver.state().flags[KelvoDevice::kSetLogStatsEnable]);
+}
+
+// Binder statistics asked at a foreground change and kernel workers asked
+// at the hourly tick come back from the driver over the buffered log.
+TEST_F(SystemLateInitTest, DriverReportsBecomeRows) {
+    if (!kelvo::test::hostPathExists(mRoot->path() + "/dev/socket/" +
+                                     BufferedLogClient::kSocketName)) {
+        GTEST_SKIP() << "the process-wide buffered log server listens below another root";
+    }
+    LogCapture capture;
+    fake::FakeDriverReporter reporter(mDriver);
+    reporter.start();
+    mDriver.update([](fake::FakeKernelDriver::State& s) {
+        s.binderCalls = {{10020, 11, "com.server", 10030, 22, "com.app", 4},
+                         {10030, 22, "com.app", 10020, 11, "com.server", 3},
+                         {10020, 11, "com.server", 10030, 22, "com.app", 1}};
+        s.kworkers = {{"flush_to_disk", 7, 120}};
+    });
+    Parcel foreground;
+    foreground.writeInt64(kH + 1000);
+    foreground.writeString8(String8("com.app"));
+    notify(NOTIFICATION_FOREGROUND_CHANGED, foreground);
+    Parcel tick;
+    tick.writeInt64(kH + 5);
+    tick.writeInt64(kH);
+    notify(NOTIFICATION_HOURLY_TICK, tick);
+    const std::string binder =
+        "SELECT end_time, service, client, forward, backward, foreground FROM raw_binder_stats";
+    const std::string kworker = "SELECT timestamp, symbol, count, time FROM raw_kworker";
+    ASSERT_TRUE(waitFor([&] { return !rows(binder).empty() && !rows(kworker).empty(); }));
+    EXPECT_EQ(std::vector<std::string>{at(1000) + "|com.server|com.app|5|3|1"}, rows(binder));
+    EXPECT_EQ(std::vector<std::string>{at(0) + "|flush_to_disk|7|120"}, rows(kworker));
+    EXPECT_EQ(0u, capture.count("Invalid data length"));
 }
 
 }  // namespace
