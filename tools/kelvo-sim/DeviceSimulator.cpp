@@ -202,6 +202,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot lay out the system files below " + root + ": " + strerror(errno);
         return false;
     }
+    mTraffic.reset(new TrafficModel(mScenario, root));
+    if (!mTraffic->write()) {
+        *error = "cannot write the traffic counters below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -341,6 +346,16 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
         case Scenario::Action::System:
             result = mSystem->write(*mLogWriter, step.text, t);
             break;
+        case Scenario::Action::Traffic:
+        case Scenario::Action::SystemTraffic: {
+            std::lock_guard<std::mutex> lock(mLock);
+            mTraffic->apply(step);
+            if (!mTraffic->write()) {
+                fprintf(stderr, "kelvo-sim: cannot rewrite the traffic files: %s\n",
+                        strerror(errno));
+            }
+            return;
+        }
         case Scenario::Action::Battery: {
             PlatformState::Battery battery = mServices->state()->battery();
             battery.level = step.value;
@@ -550,6 +565,12 @@ int DeviceSimulator::finish(bool completed) {
     std::ofstream(mOptions.root + "/sim/summary.txt") << text;
     std::ofstream(mOptions.root + "/sim/truth.tsv") << report.truthTable();
     std::ofstream(mOptions.root + "/sim/components.tsv") << componentTable;
+    if (mTraffic) {
+        std::string traffic = mTraffic->summary(SimReport::databasePath(mOptions.root));
+        fputs(traffic.c_str(), stdout);
+        std::ofstream(mOptions.root + "/sim/summary.txt", std::ios::app) << traffic;
+        std::ofstream(mOptions.root + "/sim/traffic-truth.tsv") << mTraffic->truthTable();
+    }
     if (!mError.empty()) {
         fprintf(stderr, "kelvo-sim: %s\n", mError.c_str());
     }

@@ -13,6 +13,7 @@
 #include "DeviceModel.h"
 #include "Scenario.h"
 #include "SystemScene.h"
+#include "TrafficModel.h"
 
 namespace kelvo {
 
@@ -96,6 +97,7 @@ private:
     // The display, GNSS and flashlight with their truth (under mLock: the
     // driver thread reads the panel's advanced brightness).
     std::unique_ptr<ComponentTruth> mComponents;
+    std::unique_ptr<TrafficModel> mTraffic;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

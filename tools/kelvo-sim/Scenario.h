@@ -44,6 +44,8 @@ public:
         Flashlight,  // flag: on
         Torch,       // pid: the torch user's process
         System,      // text: the record (SystemScene::parseStep)
+        Traffic,        // pid: uid, text: interface, value: counter set, counters
+        SystemTraffic,  // pid, text: interface, counters
     };
 
     struct Step {
@@ -58,6 +60,7 @@ public:
         bool flag = false;
         std::string text;
         std::vector<int32_t> values;
+        int64_t counters[4] = {};  // traffic: rx bytes, tx bytes, rx packets, tx packets
     };
 
     // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
