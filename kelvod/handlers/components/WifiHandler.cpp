@@ -136,7 +136,10 @@ int64_t saturatedSum(int64_t a, int64_t b) {
 
 }  // namespace
 
-WifiHandler::WifiHandler()
+WifiHandler::WifiHandler() : WifiHandler(nullptr, nullptr) {}
+
+WifiHandler::WifiHandler(TrafficCollector::PackageLookup packages,
+                         TrafficReader::NameLookup processes)
     : ComponentHandler("WifiHandler", ACCOUNTER_WIFI, kElector, {&kFamily}),
       mActivityState(0),
       mActivityStart(0),
@@ -144,7 +147,14 @@ WifiHandler::WifiHandler()
       mDistribution{},
       mForeground("com.tovaro.android.launcher"),
       mScreenOn(true),
-      mNameLogHour(-1) {}
+      mNameLogHour(-1) {
+    // The collector lives inside the handler and runs on its thread.
+    mTraffic = std::make_unique<TrafficCollector>(
+        kWifiTrafficConfig, [this](const Parcel& action) { return feedAccounter(action); },
+        std::move(packages), std::move(processes));
+    // Traffic from before the daemon started is never counted.
+    mTraffic->takeBaseline();
+}
 
 WifiHandler::~WifiHandler() = default;
 
@@ -153,16 +163,18 @@ const component_family& WifiHandler::family() {
 }
 
 void WifiHandler::addSchemaTable() {
-    for (const table_attribute* table : {&kWifiState, &kWifiApState, &kWifiScan, &kWifiBand,
-                                         &kWifiActivity, &kWifiActivityDuration}) {
+    for (const table_attribute* table :
+         {&kWifiState, &kWifiApState, &kWifiScan, &kWifiBand, &kWifiActivity, &kWifiActivityDuration,
+          kWifiTrafficConfig.packageTable, kWifiTrafficConfig.interfaceTable}) {
         addSchema(*table);
     }
     ComponentHandler::addSchemaTable();
 }
 
 void WifiHandler::cleanTables(int64_t time) {
-    for (const table_attribute* table : {&kWifiState, &kWifiApState, &kWifiScan, &kWifiBand,
-                                         &kWifiActivity, &kWifiActivityDuration}) {
+    for (const table_attribute* table :
+         {&kWifiState, &kWifiApState, &kWifiScan, &kWifiBand, &kWifiActivity, &kWifiActivityDuration,
+          kWifiTrafficConfig.packageTable, kWifiTrafficConfig.interfaceTable}) {
         cleanObsoleteEntries(table->name, time, "timestamp");
     }
     ComponentHandler::cleanTables(time);
@@ -390,10 +402,10 @@ void WifiHandler::changeActivity(int64_t time, bool active) {
 }
 
 void WifiHandler::pollAll(int64_t time) {
-    collectInterfaceTraffic(time);
+    mTraffic->collectInterfaces(time);
     collectActivity(time);
-    collectSystemTraffic(time);
-    collectPackageTraffic(time);
+    mTraffic->collectSystem(time, mForeground.c_str());
+    mTraffic->collectPackages(time);
     collectScans(time);
 }
 
@@ -420,12 +432,6 @@ void WifiHandler::collectActivity(int64_t time) {
         insertEntries(kWifiActivityDuration, row, 1, false);
     }
 }
-
-void WifiHandler::collectInterfaceTraffic(int64_t time) {}
-
-void WifiHandler::collectSystemTraffic(int64_t time) {}
-
-void WifiHandler::collectPackageTraffic(int64_t time) {}
 
 // One record per uid and fg/bg with scans, at most kMaxBatchRecords a
 // batch; the uids left over keep their counts for the next batch.
@@ -513,6 +519,7 @@ int32_t WifiHandler::onUidRemoved(const Parcel& data) {
     if (data.readInt32(&uid) != NO_ERROR) {
         return -5;
     }
+    mTraffic->removeUid(uid);
     // Its scans so far are still charged, under the name they were made by.
     auto it = mScanData.find(uid);
     if (it != mScanData.end()) {
@@ -545,7 +552,7 @@ int32_t WifiHandler::onForegroundChanged(const Parcel& data) {
         return -5;
     }
     // The increments so far belong to the old foreground.
-    collectSystemTraffic(time);
+    mTraffic->collectSystem(time, mForeground.c_str());
     mForeground = package;
     return 0;
 }

@@ -5,11 +5,13 @@
 #include <utils/String8.h>
 
 #include <map>
+#include <memory>
 #include <set>
 #include <string>
 #include <vector>
 
 #include "handlers/components/ComponentHandler.h"
+#include "handlers/components/TrafficCollector.h"
 
 namespace kelvo {
 
@@ -45,6 +47,9 @@ public:
     };
 
     WifiHandler();
+    // With lookups of the caller's own for the traffic's package and process
+    // names (tests and the bench); null ones use the package properties.
+    WifiHandler(TrafficCollector::PackageLookup packages, TrafficReader::NameLookup processes);
     ~WifiHandler() override;
 
     static const component_family& family();
@@ -78,10 +83,7 @@ private:
 
     // The five collectors, in their order.
     void pollAll(int64_t time);
-    void collectInterfaceTraffic(int64_t time);
     void collectActivity(int64_t time);
-    void collectSystemTraffic(int64_t time);
-    void collectPackageTraffic(int64_t time);
     void collectScans(int64_t time);
 
     int32_t sendSetValue(int32_t subtype, const android::Parcel& fields);
@@ -90,6 +92,7 @@ private:
     int32_t storeApplicationList(const android::Parcel& data);
     int32_t storeHotspotResult(const android::Parcel& data);
 
+    std::unique_ptr<TrafficCollector> mTraffic;
     std::map<int32_t, scan_data> mScanData;
     // Scans of uids removed since the last scans collector.
     std::vector<scan_data> mRemovedScans;
