@@ -247,4 +247,66 @@ TEST_F(WifiHandlerTest, TrafficScansAndHotspotThroughTheHour) {
     EXPECT_EQ(8058, upload["26"][1]["params"]["1"]["params"]["6"].asInt64());
 }
 
+// Time is booked to the level in force while the link is active; the
+// screen going off ends the span and later activity is ignored. Levels 0
+// and 1 stay apart in the row.
+TEST_F(WifiHandlerTest, ActivitySpansFollowLevelAndScreen) {
+    auto screen = [&](int64_t time, bool on) {
+        Parcel body;
+        body.writeInt64(time);
+        body.writeBool(on);
+        return mWifi->sendMessageSync(
+            ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_SCREEN_STATE_CHANGED, body));
+    };
+    gMonotonic = 1000;
+    ASSERT_EQ(0, log(WifiHandler::TAG_WIFI_SIGNAL_LEVEL, kT, "level=1"));
+    ASSERT_EQ(0, log(WifiHandler::TAG_WIFI_ACTIVITY, kT, "activity=1"));
+    gMonotonic = 11000;
+    ASSERT_EQ(0, log(WifiHandler::TAG_WIFI_SIGNAL_LEVEL, kT + 10000, "level=0"));
+    gMonotonic = 31000;
+    ASSERT_EQ(0, screen(kT + 30000, false));
+    ASSERT_EQ(0, log(WifiHandler::TAG_WIFI_ACTIVITY, kT + 31000, "activity=1"));
+    gMonotonic = 91000;
+    ASSERT_EQ(0, screen(kT + 90000, true));
+    const std::string t = std::to_string(kT);
+    EXPECT_EQ((std::vector<std::string>{t + "|1|1", std::to_string(kT + 30000) + "|0|0"}),
+              rows("SELECT timestamp, activity, signal_level FROM raw_wifi_activity"));
+    EXPECT_EQ(std::vector<std::string>{std::to_string(kT + 30000) + "|20000|10000|0|0|0"},
+              rows("SELECT timestamp, signal_level_0, signal_level_1, signal_level_2, "
+                   "signal_level_3, signal_level_4 FROM raw_wifi_activity_duration"));
+}
+
+// An application list is trusted no further than its count (0 to 5000) and
+// its complete rows; other headers are refused.
+TEST_F(WifiHandlerTest, ResultsAreCheckedBeforeTheyAreStored) {
+    struct Case {
+        int32_t header;
+        int32_t count;
+        int32_t rowsGiven;
+        int32_t result;
+    } cases[] = {{1, -1, 1, -2}, {1, 5001, 1, -2}, {1, 3, 2, -2}, {1, 1, 1, 0}, {7, 1, 1, -2}};
+    const uint64_t refused = HealthCounters::get(Health::LibraryParcelRefused);
+    for (const Case& c : cases) {
+        Parcel result;
+        result.writeInt32(c.header);
+        result.writeInt32(c.count);
+        for (int32_t r = 0; r < c.rowsGiven; ++r) {
+            result.writeInt64(kT);
+            result.writeInt64(kT + 1000);
+            result.writeString8(android::String8("com.r"));
+            for (int i = 0; i < 6; ++i) {
+                result.writeInt32(1);
+                result.writeInt64(2);
+                result.writeInt64(3);
+                result.writeInt64(4);
+            }
+        }
+        result.writeInt32(77);  // a cut row
+        EXPECT_EQ(c.result, mWifi->handleLibraryEvent(LIBRARY_EVENT_APPLICATION, result));
+    }
+    EXPECT_EQ(refused + 4, HealthCounters::get(Health::LibraryParcelRefused));
+    EXPECT_EQ(std::vector<std::string>{"3"},
+              rows("SELECT COUNT(*) FROM raw_applications_wifi WHERE name = 'com.r'"));
+}
+
 }  // namespace
