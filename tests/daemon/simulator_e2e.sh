@@ -47,6 +47,8 @@ while read -r name truth; do
     hourly=$(q "SELECT COUNT(*) FROM hourly_applications_cpu WHERE name = '$name'")
     [ "$hourly" -ge 1 ] || fail "no hourly_applications_cpu row for $name"
 done <<<"$expected"
+traffic=$(awk -F'\t' '$1 == "com.example.mail" { print $3 "/" $4 }' "$root/sim/traffic-truth.tsv")
+[ "$traffic" = "150000/4000" ] || fail "com.example.mail: the simulator's traffic truth is $traffic"
 others=$(q "SELECT COUNT(*) FROM raw_applications_cpu WHERE name NOT IN
             ('com.example.mail', 'com.example.browser', 'com.example.browser-renderer',
              'system_server', 'kernel_kworker')")

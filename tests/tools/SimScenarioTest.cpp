@@ -38,6 +38,8 @@ const Refusal kRefusals[] = {
     {"undeclared pid", "at 5 load 999 0 10%", "pid 999 is not declared"},
     {"step after the end", "at 3:01 battery 50%", "after the end"},
     {"bad time", "at 1:75 battery 50%", "expected \"at <time>"},
+    {"traffic without packets", "at 5 traffic 10061 wlan0 fg 100", "expected \"at <time> traffic"},
+    {"system traffic of an app", "at 5 systraffic 2001 wlan0 10 1", "not a declared process"},
     {"battery over 100", "at 5 battery 101%", "level 0..100"},
     {"unknown foreground package", "at 5 foreground com.other", "no app has the package"},
     {"package not of the uid", "process 5 10061 x com.example.browser", "does not have"},

@@ -186,6 +186,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot lay out the CPU counters below " + root + ": " + strerror(errno);
         return false;
     }
+    mTraffic.reset(new TrafficModel(mScenario, root));
+    if (!mTraffic->write()) {
+        *error = "cannot write the traffic counters below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -323,6 +328,16 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             battery.usbOnline = step.text == "usb";
             battery.wirelessOnline = step.text == "wireless";
             mServices->state()->setBattery(battery);
+            return;
+        }
+        case Scenario::Action::Traffic:
+        case Scenario::Action::SystemTraffic: {
+            std::lock_guard<std::mutex> lock(mLock);
+            mTraffic->apply(step);
+            if (!mTraffic->write()) {
+                fprintf(stderr, "kelvo-sim: cannot rewrite the traffic files: %s\n",
+                        strerror(errno));
+            }
             return;
         }
         case Scenario::Action::Battery: {
@@ -503,6 +518,12 @@ int DeviceSimulator::finish(bool completed) {
     fputs(text.c_str(), stdout);
     std::ofstream(mOptions.root + "/sim/summary.txt") << text;
     std::ofstream(mOptions.root + "/sim/truth.tsv") << report.truthTable();
+    if (mTraffic) {
+        std::string traffic = mTraffic->summary(SimReport::databasePath(mOptions.root));
+        fputs(traffic.c_str(), stdout);
+        std::ofstream(mOptions.root + "/sim/summary.txt", std::ios::app) << traffic;
+        std::ofstream(mOptions.root + "/sim/traffic-truth.tsv") << mTraffic->truthTable();
+    }
     if (!mError.empty()) {
         fprintf(stderr, "kelvo-sim: %s\n", mError.c_str());
     }

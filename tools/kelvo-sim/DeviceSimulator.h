@@ -11,6 +11,7 @@
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "Scenario.h"
+#include "TrafficModel.h"
 
 namespace kelvo {
 
@@ -91,6 +92,7 @@ private:
     std::mutex mLock;  // the model, the guard and the truth, shared with the driver thread
     DeviceModel mModel;
     std::unique_ptr<CpuTree> mTree;
+    std::unique_ptr<TrafficModel> mTraffic;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -9,6 +9,7 @@
 #include <sstream>
 
 #include "CpuTree.h"
+#include "TrafficModel.h"
 
 namespace kelvo {
 namespace sim {
@@ -325,6 +326,10 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
             *reason = "expected \"at <time> battery <level 0..100>%\"";
             return false;
         }
+    } else if (verb == "traffic" || verb == "systraffic") {
+        if (!TrafficModel::parseStep(words, &step, reason)) {
+            return false;
+        }
     } else {
         *reason = "unknown verb \"" + verb + "\"";
         return false;
@@ -358,6 +363,9 @@ bool Scenario::check(std::string* reason, int32_t* line) {
         *line = step.line;
         if (step.atMs > mDurationMs) {
             *reason = "this step comes after the end of the scenario";
+            return false;
+        }
+        if (!TrafficModel::checkStep(*this, step, reason)) {
             return false;
         }
         if (step.action == Action::Load && findProcess(step.pid) == nullptr) {

@@ -38,6 +38,8 @@ public:
         Screen,      // flag: on
         Charger,     // text: "ac", "usb", "wireless" or "off"
         Battery,     // value: level
+        Traffic,        // pid: uid, text: interface, value: counter set, counters
+        SystemTraffic,  // pid, text: interface, counters
     };
 
     struct Step {
@@ -51,6 +53,7 @@ public:
         int32_t value = 0;
         bool flag = false;
         std::string text;
+        int64_t counters[4] = {};  // traffic: rx bytes, tx bytes, rx packets, tx packets
     };
 
     // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
