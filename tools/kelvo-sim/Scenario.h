@@ -40,6 +40,7 @@ public:
         Battery,     // value: level
         Traffic,        // pid: uid, text: interface, value: counter set, counters
         SystemTraffic,  // pid, text: interface, counters
+        Wifi,           // value: record kind, pid: its number (WifiRecords)
     };
 
     struct Step {
