@@ -22,6 +22,8 @@ namespace kelvo {
 namespace {
 
 constexpr int64_t kHourMs = 3600000;
+// Uids whose missing name is remembered within an hour, at most.
+constexpr size_t kMaxNameLogged = 1000;
 constexpr int32_t kRowsPerInsert = 200;
 // Numeric message values start here, so a value that is no number fails.
 constexpr int32_t kUnparsed = INT32_MIN;
@@ -284,7 +286,9 @@ void WifiHandler::logMissingName(int64_t time, int32_t uid) {
         mNameLogHour = hour;
         mNameLogged.clear();
     }
-    // The set only grows within one hour and by uids that really scanned.
+    if (mNameLogged.size() >= kMaxNameLogged) {
+        mNameLogged.clear();
+    }
     if (mNameLogged.insert(uid).second) {
         KLOGE("Can not find name for uid=%d", uid);
     } else {
