@@ -211,6 +211,23 @@ bool TrafficReader::account(view<K>& v, const K& key, const traffic_throughput& 
     return moved;
 }
 
+int64_t TrafficReader::addCounter(int64_t a, int64_t b) {
+    int64_t sum = 0;
+    if (__builtin_add_overflow(a, b, &sum)) {
+        HealthCounters::add(Health::ValuesSaturated);
+        return INT64_MAX;
+    }
+    return sum;
+}
+
+void TrafficReader::addThroughput(traffic_throughput* to, int64_t rxBytes, int64_t rxPackets,
+                                  int64_t txBytes, int64_t txPackets) {
+    to->rxBytes = addCounter(to->rxBytes, rxBytes);
+    to->rxPackets = addCounter(to->rxPackets, rxPackets);
+    to->txBytes = addCounter(to->txBytes, txBytes);
+    to->txPackets = addCounter(to->txPackets, txPackets);
+}
+
 bool TrafficReader::belongs(const char* interface) const {
     return strstr(interface, mFragment.c_str()) != nullptr;
 }
@@ -343,11 +360,7 @@ int32_t TrafficReader::getPidTrafficData(std::vector<pid_traffic_data>* out) {
             sums.emplace(ProcessKey(name, f[0]), sum{now, uid, pid});
             continue;
         }
-        traffic_throughput& t = it->second.t;
-        t.rxBytes += now.rxBytes;
-        t.rxPackets += now.rxPackets;
-        t.txBytes += now.txBytes;
-        t.txPackets += now.txPackets;
+        addThroughput(&it->second.t, now.rxBytes, now.rxPackets, now.txBytes, now.txPackets);
     }
     fclose(r.file);
     // A lower sum (a process of the name ended) becomes the new last reading

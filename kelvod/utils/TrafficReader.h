@@ -104,6 +104,12 @@ public:
     int32_t getPidTrafficData(std::vector<pid_traffic_data>* out);
     int32_t getInterfaceTrafficData(std::vector<interface_traffic_data>* out);
 
+    // Adds counters (each at least 0), held at INT64_MAX; a held sum is
+    // counted as saturated.
+    static int64_t addCounter(int64_t a, int64_t b);
+    static void addThroughput(traffic_throughput* to, int64_t rxBytes, int64_t rxPackets,
+                              int64_t txBytes, int64_t txPackets);
+
     // Forgets the uid's last readings; its next sighting is a baseline only.
     void removeUid(int32_t uid);
     // Every package is accepted.

@@ -91,8 +91,8 @@ int32_t TrafficCollector::collectInterfaces(int64_t time) {
     int64_t rx = 0;
     for (const interface_traffic_data& d : data) {
         writeInterfaceRow(rows, time, d);
-        tx += d.txPackets;
-        rx += d.rxPackets;
+        tx = TrafficReader::addCounter(tx, d.txPackets);
+        rx = TrafficReader::addCounter(rx, d.rxPackets);
     }
     StorageOperator::insertEntries(*mConfig.interfaceTable, rows, static_cast<int32_t>(data.size()),
                                    false);
@@ -125,11 +125,8 @@ int32_t TrafficCollector::collectSystem(int64_t time, const std::string& foregro
               " tb=%" PRId64 " rb=%" PRId64,
               d.uid, d.pid, d.name.c_str(), d.interface.c_str(), index, d.txPackets, d.rxPackets,
               d.txBytes, d.rxBytes);
-        traffic_throughput& t = mSystem[index][d.name][d.interface];
-        t.rxBytes += d.rxBytes;
-        t.rxPackets += d.rxPackets;
-        t.txBytes += d.txBytes;
-        t.txPackets += d.txPackets;
+        TrafficReader::addThroughput(&mSystem[index][d.name][d.interface], d.rxBytes, d.rxPackets,
+                                     d.txBytes, d.txPackets);
         writePackageRow(rows, time, d.name, d, 0);
     }
     StorageOperator::insertEntries(*mConfig.packageTable, rows, static_cast<int32_t>(data.size()),
