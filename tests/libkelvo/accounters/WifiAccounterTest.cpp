@@ -132,53 +132,37 @@ TEST_F(WifiAccounterTest, TrafficEnergyByLevelTimeAndTotals) {
         const char* what;
         int64_t levelTime;  // at level 0
         int64_t tx, rx;     // interface totals
-        int32_t bandCode;   // 0: none sent
+        int32_t bandCode;   // -1: none sent
         std::vector<Entry> entries;
         std::map<std::string, Charged> expected;
     } cases[] = {
         // (1000 x 2 + 500 x 3) / 1000 = 3.5.
-        {"level times", 600000, 0, 0, 0, {{"com.a", 1000, 500, 70, 80}}, {{"com.a", {0, 70, 80, 3}}}},
-        {"no level times: weakest level per hundred",
-         0,
-         0,
-         0,
-         0,
-         {{"com.a", 1000, 500, 1, 2}},
-         {{"com.a", {0, 1, 2, (1000 * 8 + 500 * 9) / 100}}}},
-        {"660000 ms still weighted",
-         660000,
-         0,
-         0,
-         0,
-         {{"com.a", 1000, 500, 0, 0}},
-         {{"com.a", {0, 0, 0, 3}}}},
-        {"660001 ms falls back",
-         660001,
-         0,
-         0,
-         0,
-         {{"com.a", 1000, 500, 0, 0}},
-         {{"com.a", {0, 0, 0, 125}}}},
+        {"weighted", 600000, 0, 0, -1, {{"com.a", 1000, 500, 70, 80}}, {{"com.a", {0, 70, 80, 3}}}},
+        // No level times: the weakest level, (1000 x 8 + 500 x 9) / 100.
+        {"L = 0", 0, 0, 0, -1, {{"com.a", 1000, 500, 1, 2}}, {{"com.a", {0, 1, 2, 125}}}},
+        {"L = 660000", 660000, 0, 0, -1, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 3}}}},
+        {"L = 660001", 660001, 0, 0, -1, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 125}}}},
         // Et = 10; the fixed 600000 x 40 / 1000 = 24000 split 3 : 7.
-        {"two applications split the fixed power",
+        {"two split",
          600000,
          3000,
          1500,
-         0,
+         -1,
          {{"com.a", 1000, 500, 0, 0}, {"com.b", 2000, 1000, 0, 0}},
          {{"com.a", {200000, 0, 0, 3 + 7200}}, {"com.b", {400000, 0, 0, 7 + 16800}}}},
-        {"one application carries all",
+        {"one carries all",
          600000,
          3000,
          1500,
-         0,
+         -1,
          {{"com.a", 3000, 1500, 0, 0}},
          {{"com.a", {600000, 0, 0, 10 + 24000}}}},
-        {"counts read after the totals",
+        // Counts read after the totals: held at the whole.
+        {"late counts",
          600000,
          3000,
          1500,
-         0,
+         -1,
          {{"com.a", 3500, 1500, 0, 0}},
          {{"com.a", {600000, 0, 0, 11 + 24000}}}},
         // 600000 x 2e12 x 40 is beyond 64 bits; the fixed part stays 24000.
@@ -186,24 +170,20 @@ TEST_F(WifiAccounterTest, TrafficEnergyByLevelTimeAndTotals) {
          600000,
          1000000000000000,
          0,
-         0,
+         -1,
          {{"com.a", 1000000000000000, 0, 0, 0}},
          {{"com.a", {600000, 0, 0, 2000000094994 + 24000}}}},
-        // Band 1: ten times the powers, fixed power 400.
+        // Band 1: ten times the powers, fixed power 400; codes 0 (none known)
+        // and 3 keep it, code 2 is band 0.
         {"band 1", 600000, 0, 0, 1, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 35}}}},
-        {"band 0 again", 600000, 0, 0, 2, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 3}}}},
-        {"band code 3 keeps band 0",
-         600000,
-         0,
-         0,
-         3,
-         {{"com.a", 1000, 500, 0, 0}},
-         {{"com.a", {0, 0, 0, 3}}}},
+        {"code 0", 600000, 0, 0, 0, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 35}}}},
+        {"code 3", 600000, 0, 0, 3, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 35}}}},
+        {"band 0", 600000, 0, 0, 2, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 3}}}},
     };
     int64_t t = 0;
     for (const Case& c : cases) {
         SCOPED_TRACE(c.what);
-        if (c.bandCode != 0) {
+        if (c.bandCode >= 0) {
             ASSERT_EQ(0, setValue(WIFI_BAND).i32(c.bandCode).send());
         }
         ASSERT_EQ(0, setValue(WIFI_INTERFACE_TRAFFIC).i64(c.tx).i64(c.rx).send());
