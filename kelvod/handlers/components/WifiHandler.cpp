@@ -527,7 +527,12 @@ int32_t WifiHandler::onUidRemoved(const Parcel& data) {
     // Its scans so far are still charged, under the name they were made by.
     auto it = mScanData.find(uid);
     if (it != mScanData.end()) {
-        mRemovedScans.push_back(it->second);
+        if (mRemovedScans.size() < kMaxScanUids) {
+            mRemovedScans.push_back(it->second);
+        } else {
+            HealthCounters::add(Health::AccounterStateCapped);
+            KLOGE("Too many removed uids with scans, dropped: %d", uid);
+        }
         mScanData.erase(it);
     }
     return 0;
