@@ -19,6 +19,7 @@
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/components/WifiHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -58,6 +59,10 @@ android::sp<KelvoOperator> makeFlashlightHandler() {
     return new FlashlightHandler();
 }
 
+android::sp<KelvoOperator> makeWifiHandler() {
+    return new WifiHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -81,6 +86,7 @@ struct Factories {
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
+        handlers[HANDLER_WIFI] = &makeWifiHandler;
     }
 
     std::mutex lock;

@@ -12,6 +12,7 @@
 #include "accounters/GnssAccounter.h"
 #include "accounters/GpuAccounter.h"
 #include "accounters/SensorAccounter.h"
+#include "accounters/WifiAccounter.h"
 #include "SqlTypes.h"
 
 namespace kelvo {
@@ -48,6 +49,8 @@ KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
             return [] { return std::make_unique<SensorAccounter>(); };
         case ACCOUNTER_AUDIO:
             return [] { return std::make_unique<AudioAccounter>(); };
+        case ACCOUNTER_WIFI:
+            return [] { return std::make_unique<WifiAccounter>(); };
         case ACCOUNTER_CPU:
             return [] {
                 return std::make_unique<CpuAccounter>(

@@ -56,4 +56,16 @@ enum LibraryEvent : int32_t {
     LIBRARY_EVENT_COMPONENT = 1,   // the component record
 };
 
+// Wi-Fi subtypes: the int32 after the action code of every Wi-Fi action.
+enum WifiSubtype : int32_t {
+    WIFI_INTERFACE_TRAFFIC = 0, // SetValue: int64 tx packets, int64 rx packets
+    WIFI_PACKAGE_TRAFFIC = 1,   // SetValue: a traffic batch
+    WIFI_HOTSPOT = 2,           // Activate / Deactivate of the hotspot
+    WIFI_SCANS = 3,             // SetValue: a scan batch
+    WIFI_BAND = 4,              // SetValue: int32 band code
+    WIFI_ACTIVITY = 5,          // SetValue: int32 4, four int64 level times
+    WIFI_CHARGER = 6,           // SetValue: bool charger online
+    WIFI_SUBTYPE_MAX = WIFI_CHARGER,
+};
+
 } // namespace kelvo

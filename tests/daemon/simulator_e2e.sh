@@ -134,6 +134,26 @@ for field, array, users in ((4, 5, {"com.example.mail", "com.example.browser"}),
     assert names == users, (array, names)
 PY
 
+# Wi-Fi: the hotspot's 10 s at 160, com.example.mail's bytes, its scans and
+# its part of the band's fixed power (about 29 s x 40 / 1000), hourly rows
+# and the hourly event's Wi-Fi component (25) and top applications (26).
+[ "$(q "SELECT background_duration || '/' || background_energy FROM raw_applications_wifi
+        WHERE name = 'wifi_ap'")" = "10000/1600" ] || fail "no hotspot record"
+read -r mailBytes mailEnergy <<<"$(q "SELECT SUM(foreground_tx_bytes + foreground_rx_bytes +
+    background_tx_bytes + background_rx_bytes), SUM(foreground_energy + background_energy)
+    FROM raw_applications_wifi WHERE name = 'com.example.mail'" | tr '|' ' ')"
+[ "$mailBytes" = 150000 ] || fail "com.example.mail: $mailBytes Wi-Fi bytes"
+(( mailEnergy > 1000 && mailEnergy < 1700 )) || fail "com.example.mail: Wi-Fi energy $mailEnergy"
+[ "$(q "SELECT COUNT(*) FROM hourly_applications_wifi WHERE name = 'com.example.mail'")" = 1 ] ||
+    fail "no hourly_applications_wifi row"
+python3 - "$root/data/log/zendrel/events.jsonl" <<'PY' || fail "hourly Wi-Fi upload"
+import json, sys
+events = [json.loads(l) for l in open(sys.argv[1]) if l.strip()]
+p = [e for e in events if e["event"] == 903001060][0]["params"]
+assert p["25"]["class"] == 903009021 and p["25"]["params"]["13"] == 100000, p["25"]
+assert p["26"][0]["params"]["3"]["params"]["0"] == "com.example.mail", p["26"]
+PY
+
 # A bad scenario is refused by its line before anything starts.
 printf 'start 10:00:00\nduration 30\nat 5 screen dim\n' >"$work/bad.scn"
 "$sim" --quiet --root "$work/bad-root" "$work/bad.scn" 2>"$work/bad.err"

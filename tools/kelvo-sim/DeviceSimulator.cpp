@@ -21,6 +21,7 @@
 #include "FakeKernelDriver.h"
 #include "PlatformServices.h"
 #include "SimReport.h"
+#include "WifiRecords.h"
 #include "kelvo/BufferedLogClient.h"
 #include "kelvo/LogWriter.h"
 #include "kelvo/RootPath.h"
@@ -346,6 +347,13 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
         case Scenario::Action::System:
             result = mSystem->write(*mLogWriter, step.text, t);
             break;
+        case Scenario::Action::Wifi: {
+            std::string tag;
+            std::string text;
+            WifiRecords::record(step, &tag, &text);
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, tag.c_str(), text.c_str(), t);
+            break;
+        }
         case Scenario::Action::Traffic:
         case Scenario::Action::SystemTraffic: {
             std::lock_guard<std::mutex> lock(mLock);

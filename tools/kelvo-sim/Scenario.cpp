@@ -11,6 +11,7 @@
 #include "CpuTree.h"
 #include "SystemScene.h"
 #include "TrafficModel.h"
+#include "WifiRecords.h"
 
 namespace kelvo {
 namespace sim {
@@ -329,6 +330,10 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
         }
     } else if (verb == "traffic" || verb == "systraffic") {
         if (!TrafficModel::parseStep(words, &step, reason)) {
+            return false;
+        }
+    } else if (verb == "wifi") {
+        if (!WifiRecords::parseStep(words, &step, reason)) {
             return false;
         }
     } else if (int system = SystemScene::parseStep(words, &step.text, reason)) {

@@ -46,6 +46,7 @@ public:
         System,      // text: the record (SystemScene::parseStep)
         Traffic,        // pid: uid, text: interface, value: counter set, counters
         SystemTraffic,  // pid, text: interface, counters
+        Wifi,           // value: record kind, pid: its number (WifiRecords)
     };
 
     struct Step {

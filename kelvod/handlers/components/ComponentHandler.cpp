@@ -43,9 +43,23 @@ const upload_pair kResultPairs[] = {{0, 1, 5, 4}, {2, 3, 7, 6}, {4, 5, 1, 0}, {6
 // duration is at least 1, the energy scaled by the period's ratio.
 void energyClass(const component_family& family, const ComponentHandler::sum_row& row, float ratio,
                  Parcel& out) {
+    const int32_t values = static_cast<int32_t>(row.v.size());
+    if (family.uploadTraffic != nullptr) {
+        for (int32_t i = 0; i < family.uploadTrafficCount; ++i) {
+            const upload_traffic& group = family.uploadTraffic[i];
+            if (group.tx >= values || group.rx >= values || group.energy >= values ||
+                (row.v[group.tx] < 1 && row.v[group.rx] < 1)) {
+                continue;
+            }
+            DataUploader::formIntData(group.txField, row.v[group.tx], out);
+            DataUploader::formIntData(group.rxField, row.v[group.rx], out);
+            DataUploader::formIntData(group.energyField,
+                                      KelvoUtils::scaleEnergy(row.v[group.energy], ratio), out);
+        }
+        return;
+    }
     const upload_pair* pairs = family.uploadPairs != nullptr ? family.uploadPairs : kResultPairs;
     int32_t count = family.uploadPairs != nullptr ? family.uploadPairCount : 4;
-    const int32_t values = static_cast<int32_t>(row.v.size());
     for (int32_t i = 0; i < count; ++i) {
         const upload_pair& pair = pairs[i];
         if (pair.duration < values && pair.energy < values && row.v[pair.duration] >= 1) {

@@ -83,6 +83,18 @@ struct upload_pair {
     uint32_t energyField;
 };
 
+// One (tx bytes, rx bytes, energy) group of a traffic member's energy class:
+// indexes into a row's summed values and the class fields they go to. The
+// group is sent when either byte count is at least 1.
+struct upload_traffic {
+    int32_t tx;
+    int32_t rx;
+    int32_t energy;
+    uint32_t txField;
+    uint32_t rxField;
+    uint32_t energyField;
+};
+
 // What tells one member of the component handler family from another: its
 // tables, its word in log texts, its applications-accounting code and its
 // upload fields. Every member shares the hourly cycle built on them.
@@ -105,6 +117,10 @@ struct component_family {
     // The pairs of the energy class; null for the four result pairs.
     const upload_pair* uploadPairs = nullptr;
     int32_t uploadPairCount = 0;
+    // The groups of a member whose energy class carries traffic; when set,
+    // they replace the pairs.
+    const upload_traffic* uploadTraffic = nullptr;
+    int32_t uploadTrafficCount = 0;
     // The summed values whose total is the hour's compensation energy (-1
     // unused): by default the foreground and background energies.
     int32_t compensationValues[2] = {1, 3};
