@@ -1,17 +1,13 @@
 // kelvo-as-uid -r ROOT -u UID [-w WAIT_MS] CALL [CALL ...]
 //
 // Takes the uid (and the same gid, no supplementary groups) before it first
-// touches binder, then makes the calls to "KelvoService" in order, as a
-// caller of that uid would. The tests run it so that calls of another uid
-// come from a process of their own instead of a child forked from the
-// multi-threaded test program. Calls and what each prints:
-//   component START END MASK FLAG  the formatted answer ("no answer" after
-//   apps START END TOP             WAIT_MS, default 5000), then a line "--"
-//   open MESSAGE                   the result, one line
-//   capture PATH                   the result, one line
-//   close                          the result, one line
-//   sample MESSAGE PATH            the result, one line
-//   dump [ARGS ...]                the dump text (takes the remaining words)
+// touches binder, then makes the calls to "KelvoService" in order. The tests
+// run it so that calls of another uid come from a process of its own, never
+// from a child forked from the multi-threaded test program. Calls:
+//   component START END MASK FLAG | apps START END TOP: the formatted answer
+//       ("no answer" after WAIT_MS, default 5000), then a line "--"
+//   open MESSAGE | capture PATH | close | sample MESSAGE PATH: the result
+//   dump [ARGS ...]: the dump text (takes the remaining words)
 // Exit status: 0 every call made, 1 no service, 2 bad usage, 3 the uid could
 // not be taken.
 
@@ -25,74 +21,32 @@
 #include <utils/String16.h>
 #include <utils/Vector.h>
 
+#include <map>
 #include <string>
-#include <vector>
 
 #include "KelvoQueryClient.h"
 #include "kelvo/RootPath.h"
 
 using android::String16;
-using kelvo::IKelvoService;
+using kelvo::KelvoQueryClient;
 
 namespace {
 
-// A call that hangs must not hold the test up beyond its own time-out.
-constexpr unsigned kLifetimeSeconds = 100;
+// Words each call takes after its name (-1: all that are left).
+const std::map<std::string, int> kArity = {{"component", 4}, {"apps", 3}, {"open", 1},
+                                           {"capture", 1},   {"close", 0}, {"sample", 2},
+                                           {"dump", -1}};
 
-void usage() {
-    fprintf(stderr,
-            "usage: kelvo-as-uid -r ROOT -u UID [-w WAIT_MS] CALL [CALL ...]\n"
-            "  calls: component START END MASK FLAG | apps START END TOP | open MESSAGE |\n"
-            "         capture PATH | close | sample MESSAGE PATH | dump [ARGS ...]\n");
+int usage() {
+    fprintf(stderr, "usage: kelvo-as-uid -r ROOT -u UID [-w WAIT_MS] CALL [CALL ...]\n");
+    return 2;
 }
 
-bool parseNumber(const char* text, long long* out) {
+bool number(const char* text, long long* out) {
     char* end = nullptr;
     errno = 0;
-    long long value = strtoll(text, &end, 0);
-    if (errno != 0 || end == text || *end != '\0') {
-        return false;
-    }
-    *out = value;
-    return true;
-}
-
-// Words each call takes after its name (-1: all that are left).
-int arityOf(const std::string& call) {
-    if (call == "component") return 4;
-    if (call == "apps") return 3;
-    if (call == "open" || call == "capture") return 1;
-    if (call == "close") return 0;
-    if (call == "sample") return 2;
-    if (call == "dump") return -1;
-    return -2;
-}
-
-// Numbers of a query call, all checked before any call is made.
-bool numbersOf(const std::vector<std::string>& words, std::vector<long long>* out) {
-    out->clear();
-    for (const std::string& w : words) {
-        long long value = 0;
-        if (!parseNumber(w.c_str(), &value)) {
-            return false;
-        }
-        out->push_back(value);
-    }
-    return true;
-}
-
-struct Call {
-    std::string name;
-    std::vector<std::string> words;
-};
-
-int dump(const android::sp<IKelvoService>& service, const std::vector<std::string>& words) {
-    android::Vector<String16> args;
-    for (const std::string& w : words) {
-        args.add(String16(w.c_str()));
-    }
-    fflush(stdout);
-    return android::IInterface::asBinder(service)->dump(STDOUT_FILENO, args);
+    *out = strtoll(text, &end, 0);
+    return errno == 0 && end != text && *end == '\0';
 }
 
 }  // namespace
@@ -100,102 +54,72 @@ int dump(const android::sp<IKelvoService>& service, const std::vector<std::strin
 int main(int argc, char** argv) {
     const char* root = nullptr;
     long long uid = -1;
-    long long waitMs = kelvo::KelvoQueryClient::kDefaultTimeoutMs;
-    int opt;
-    while ((opt = getopt(argc, argv, "+r:u:w:")) != -1) {
-        bool ok = true;
-        switch (opt) {
-            case 'r':
-                root = optarg;
-                break;
-            case 'u':
-                ok = parseNumber(optarg, &uid) && uid >= 0 && uid <= 0x7fffffff;
-                break;
-            case 'w':
-                ok = parseNumber(optarg, &waitMs) && waitMs >= 0 && waitMs <= 600000;
-                break;
-            default:
-                ok = false;
+    long long waitMs = KelvoQueryClient::kDefaultTimeoutMs;
+    for (int opt; (opt = getopt(argc, argv, "+r:u:w:")) != -1;) {
+        if ((opt == 'u' && !number(optarg, &uid)) || (opt == 'w' && !number(optarg, &waitMs)) ||
+            opt == '?') {
+            return usage();
         }
-        if (!ok) {
-            usage();
-            return 2;
-        }
+        root = opt == 'r' ? optarg : root;
     }
-    std::vector<Call> calls;
-    std::vector<long long> numbers;
+    // Every call is checked before the first is made.
     for (int i = optind; i < argc;) {
-        Call call{argv[i++], {}};
-        int arity = arityOf(call.name);
-        int left = argc - i;
-        if (arity < -1 || arity > left) {
-            usage();
-            return 2;
+        auto call = kArity.find(argv[i++]);
+        long long value;
+        if (call == kArity.end() || call->second > argc - i) return usage();
+        bool numeric = call->first == "component" || call->first == "apps";
+        for (int k = 0; numeric && k < call->second; ++k) {
+            if (!number(argv[i + k], &value)) return usage();
         }
-        int take = arity < 0 ? left : arity;
-        call.words.assign(argv + i, argv + i + take);
-        i += take;
-        if ((call.name == "component" || call.name == "apps") && !numbersOf(call.words, &numbers)) {
-            usage();
-            return 2;
-        }
-        calls.push_back(call);
+        i = call->second < 0 ? argc : i + call->second;
     }
-    if (root == nullptr || uid < 0 || calls.empty()) {
-        usage();
-        return 2;
+    if (root == nullptr || uid < 0 || uid > 0x7fffffff || waitMs < 0 || optind >= argc) {
+        return usage();
     }
     kelvo::RootPath::setRoot(root);
-    alarm(kLifetimeSeconds);
-    gid_t id = static_cast<gid_t>(uid);
-    if (setgroups(0, nullptr) != 0 || setgid(id) != 0 || setuid(id) != 0) {
+    // A call that hangs must not outlast the test waiting for it.
+    alarm(100);
+    if (setgroups(0, nullptr) != 0 || setgid(uid) != 0 || setuid(uid) != 0) {
         fprintf(stderr, "kelvo-as-uid: cannot take uid %lld: %s\n", uid, strerror(errno));
         return 3;
     }
-    android::sp<IKelvoService> service = kelvo::KelvoQueryClient::connect();
+    android::sp<kelvo::IKelvoService> service = KelvoQueryClient::connect();
     if (service == nullptr) {
         fprintf(stderr, "kelvo-as-uid: no KelvoService below %s\n", root);
         return 1;
     }
-    kelvo::KelvoQueryClient client(service);
-    for (const Call& call : calls) {
-        const std::vector<std::string>& w = call.words;
-        if (call.name == "component" || call.name == "apps") {
-            numbersOf(w, &numbers);
-            android::Parcel reply;
-            bool answered;
-            std::string text;
-            if (call.name == "component") {
-                int32_t flag = static_cast<int32_t>(numbers[3]);
-                answered = client.queryComponent(numbers[0], numbers[1],
-                                                 static_cast<int32_t>(numbers[2]), flag, &reply,
-                                                 static_cast<int>(waitMs));
-                text = answered ? kelvo::KelvoQueryClient::formatComponent(reply, flag) : "";
-            } else {
-                answered = client.queryApplications(numbers[0], numbers[1],
-                                                    static_cast<int32_t>(numbers[2]), &reply,
-                                                    static_cast<int>(waitMs));
-                text = answered ? kelvo::KelvoQueryClient::formatApplications(reply) : "";
-            }
-            printf("%s--\n", answered ? text.c_str() : "no answer\n");
-        } else if (call.name == "dump") {
-            android::status_t err = dump(service, w);
-            if (err != android::NO_ERROR) {
-                printf("dump failed: %d\n", err);
-            }
+    KelvoQueryClient client(service);
+    for (int i = optind; i < argc;) {
+        const std::string call = argv[i++];
+        char** w = argv + i;
+        i = call == "dump" ? argc : i + kArity.at(call);
+        long long n[4] = {};
+        for (int k = 0; (call == "component" || call == "apps") && k < kArity.at(call); ++k) {
+            number(w[k], &n[k]);
+        }
+        android::Parcel reply;
+        if (call == "component") {
+            bool answered = client.queryComponent(n[0], n[1], n[2], n[3], &reply, waitMs);
+            printf("%s--\n", answered ? KelvoQueryClient::formatComponent(reply, n[3]).c_str()
+                                      : "no answer\n");
+        } else if (call == "apps") {
+            bool answered = client.queryApplications(n[0], n[1], n[2], &reply, waitMs);
+            printf("%s--\n", answered ? KelvoQueryClient::formatApplications(reply).c_str()
+                                      : "no answer\n");
+        } else if (call == "dump") {
+            android::Vector<String16> args;
+            for (char** a = w; a < argv + argc; ++a) args.add(String16(*a));
+            fflush(stdout);
+            android::status_t err = android::IInterface::asBinder(service)->dump(1, args);
+            if (err != android::NO_ERROR) printf("dump failed: %d\n", err);
+        } else if (call == "open") {
+            printf("%d\n", service->remoteDebugOpen(String16(w[0])));
+        } else if (call == "capture") {
+            printf("%d\n", service->remoteDebugCapture(String16(w[0])));
+        } else if (call == "close") {
+            printf("%d\n", service->remoteDebugClose());
         } else {
-            int32_t result;
-            if (call.name == "open") {
-                result = service->remoteDebugOpen(String16(w[0].c_str()));
-            } else if (call.name == "capture") {
-                result = service->remoteDebugCapture(String16(w[0].c_str()));
-            } else if (call.name == "close") {
-                result = service->remoteDebugClose();
-            } else {
-                result = service->noteSamplingMessage(String16(w[0].c_str()),
-                                                      String16(w[1].c_str()));
-            }
-            printf("%d\n", result);
+            printf("%d\n", service->noteSamplingMessage(String16(w[0]), String16(w[1])));
         }
         fflush(stdout);
     }

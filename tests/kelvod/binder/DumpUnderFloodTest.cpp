@@ -5,7 +5,6 @@
 #include <fcntl.h>
 #include <limits.h>
 #include <signal.h>
-#include <string.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <time.h>
@@ -59,10 +58,9 @@ TEST(DumpUnderFloodTest, EveryOperatorDumpsAndNoRecordIsLost) {
     root.writeFile("/vendor/etc/xml/tv_kelvo_config.xml",
                    kelvo::test::readHostFile(KELVO_SAMPLE_CONFIG));
     const std::string log = root.path() + "/daemon.log";
+    // The first of the name wins.
     std::vector<std::string> env = {"KELVO_ROOT=" + root.path()};
-    for (char** e = environ; *e != nullptr; ++e) {
-        if (strncmp(*e, "KELVO_ROOT=", 11) != 0) env.push_back(*e);
-    }
+    for (char** e = environ; *e != nullptr; ++e) env.push_back(*e);
     std::vector<char*> envp;
     for (std::string& e : env) envp.push_back(&e[0]);
     envp.push_back(nullptr);
