@@ -33,7 +33,7 @@ using kelvo::KelvoQueryClient;
 namespace {
 
 // Words each call takes after its name (-1: all that are left).
-const std::map<std::string, int> kArity = {{"component", 4}, {"apps", 3}, {"open", 1},
+const std::map<std::string, int> kArity = {{"component", 4}, {"apps", 3},  {"open", 1},
                                            {"capture", 1},   {"close", 0}, {"sample", 2},
                                            {"dump", -1}};
 
@@ -104,8 +104,8 @@ int main(int argc, char** argv) {
                                       : "no answer\n");
         } else if (call == "apps") {
             bool answered = client.queryApplications(n[0], n[1], n[2], &reply, waitMs);
-            printf("%s--\n", answered ? KelvoQueryClient::formatApplications(reply).c_str()
-                                      : "no answer\n");
+            printf("%s--\n",
+                   answered ? KelvoQueryClient::formatApplications(reply).c_str() : "no answer\n");
         } else if (call == "dump") {
             android::Vector<String16> args;
             for (char** a = w; a < argv + argc; ++a) args.add(String16(*a));

@@ -1,8 +1,8 @@
 // The real daemon on a private root: dumpsys --dump while another thread
 // floods the log device with suspend/wake-up/resume records.
 
-#include <gtest/gtest.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <limits.h>
 #include <signal.h>
 #include <sys/stat.h>
@@ -40,8 +40,8 @@ std::string besideTests(const char* name) {
 // Standard output of dumpsys for the arguments, "[exit status N]" appended
 // when it failed.
 std::string dumpsys(const std::string& root, const std::string& args) {
-    FILE* p = popen((besideTests("dumpsys") + " -r " + root + " -t 30 KelvoService " + args).c_str(),
-                    "r");
+    FILE* p = popen(
+        (besideTests("dumpsys") + " -r " + root + " -t 30 KelvoService " + args).c_str(), "r");
     std::string out;
     char buf[4096];
     for (size_t got; p != nullptr && (got = fread(buf, 1, sizeof(buf), p)) > 0;) {

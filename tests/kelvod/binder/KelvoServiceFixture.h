@@ -7,8 +7,8 @@
 #include <binder/IServiceManager.h>
 #include <binder/PermissionCache.h>
 #include <binder/ServiceControl.h>
-#include <gtest/gtest.h>
 #include <fcntl.h>
+#include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
@@ -53,8 +53,8 @@ protected:
     // failed run ends with its exit status. *pid: the caller's process id.
     std::string asUid(uid_t uid, const std::vector<std::string>& calls, pid_t* pid = nullptr,
                       int waitMs = 5000) const {
-        std::vector<std::string> words = {KELVO_AS_UID,           "-r", mRoot->path(), "-u",
-                                          std::to_string(uid), "-w", std::to_string(waitMs)};
+        std::vector<std::string> words = {KELVO_AS_UID, "-r", mRoot->path()};
+        words.insert(words.end(), {"-u", std::to_string(uid), "-w", std::to_string(waitMs)});
         words.insert(words.end(), calls.begin(), calls.end());
         std::vector<char*> argv;
         for (std::string& w : words) argv.push_back(&w[0]);

@@ -49,8 +49,9 @@ TEST_F(KelvoServiceTest, OnlyTheSystemUidIsServedAndDumpNeedsThePermission) {
         mState->grant("android.permission.DUMP", c.uid, c.granted);
         pid_t pid = -1;
         std::string out = asUid(c.uid, {"dump", "--version"}, &pid);
-        std::string denial = "Permission Denial: cannot dump KELVO information from pid=" +
-                             std::to_string(pid) + ", uid=" + std::to_string(c.uid) + "\n";
+        std::string denial =
+            "Permission Denial: cannot dump KELVO information from pid=" + std::to_string(pid) +
+            ", uid=" + std::to_string(c.uid) + "\n";
         EXPECT_EQ(c.allowed ? kVersionLine : denial, out) << c.uid << " " << c.granted;
         android::PermissionCache::purge();
     }
