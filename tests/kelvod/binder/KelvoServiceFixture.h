@@ -1,18 +1,18 @@
 #pragma once
 
 // The process-wide agent's storage on a fresh root, with "KelvoService"
-// published and a permission service. Callers of another uid are forked
-// children (root only).
+// published and a permission service. Callers of another uid are the
+// kelvo-as-uid helper, run as that uid (root only).
 
 #include <binder/IServiceManager.h>
 #include <binder/PermissionCache.h>
 #include <binder/ServiceControl.h>
+#include <fcntl.h>
 #include <gtest/gtest.h>
 #include <sys/stat.h>
 #include <sys/wait.h>
 #include <unistd.h>
 
-#include <functional>
 #include <memory>
 #include <string>
 #include <vector>
@@ -49,27 +49,36 @@ protected:
         AgentStorageTest::TearDown();
     }
 
-    // What body returns, run in a child of the uid ("" when it failed).
-    static std::string asUid(uid_t uid, const std::function<std::string()>& body) {
+    // What the kelvo-as-uid helper prints for the calls, run as the uid; a
+    // failed run ends with its exit status. *pid: the caller's process id.
+    std::string asUid(uid_t uid, const std::vector<std::string>& calls, pid_t* pid = nullptr,
+                      int waitMs = 5000) const {
+        std::vector<std::string> words = {KELVO_AS_UID, "-r", mRoot->path()};
+        words.insert(words.end(), {"-u", std::to_string(uid), "-w", std::to_string(waitMs)});
+        words.insert(words.end(), calls.begin(), calls.end());
+        std::vector<char*> argv;
+        for (std::string& w : words) argv.push_back(&w[0]);
+        argv.push_back(nullptr);
         int fds[2];
-        if (pipe(fds) != 0) return "";
-        pid_t pid = fork();
-        if (pid == 0) {
-            close(fds[0]);
-            alarm(30);
-            if (setgid(uid) != 0 || setuid(uid) != 0) _exit(100);
-            std::string out = body();
-            ssize_t ignored = write(fds[1], out.data(), out.size());
-            (void)ignored;
-            _exit(0);
+        if (pipe2(fds, O_CLOEXEC) != 0) return "no pipe";
+        // Only async-signal-safe calls between the fork and the exec: the
+        // other threads of this process may hold any lock at the fork.
+        pid_t child = fork();
+        if (child == 0) {
+            if (dup2(fds[1], STDOUT_FILENO) < 0) _exit(126);
+            execv(argv[0], argv.data());
+            _exit(127);
         }
         close(fds[1]);
+        if (pid != nullptr) *pid = child;
         std::string out;
         char buf[4096];
-        for (ssize_t n; (n = read(fds[0], buf, sizeof(buf))) > 0;) out.append(buf, n);
+        for (ssize_t n; child > 0 && (n = read(fds[0], buf, sizeof(buf))) > 0;) out.append(buf, n);
         close(fds[0]);
-        waitpid(pid, nullptr, 0);
-        return out;
+        int status = -1;
+        if (child < 0 || waitpid(child, &status, 0) != child) return out + "[not run]";
+        if (WIFEXITED(status) && WEXITSTATUS(status) == 0) return out;
+        return out + "[exit status " + std::to_string(status) + "]";
     }
 
     // The dump output for the arguments, asked through the given binder.
@@ -97,16 +106,8 @@ protected:
     android::sp<android::IBinder> mService;
 };
 
-// Calls as another uid run in a child forked from this multi-threaded
-// process, which can inherit a lock another thread held at the fork; the
-// sanitizer runtimes make that likely, so those calls run in the plain
-// build only.
-#ifdef KELVO_SANITIZED
-#define SKIP_UNLESS_ROOT() GTEST_SKIP() << "calls as another uid fork a multi-threaded process"
-#else
 #define SKIP_UNLESS_ROOT() \
     if (getuid() != 0) GTEST_SKIP() << "needs root to call as another uid"
-#endif
 
 }  // namespace test
 }  // namespace kelvo

@@ -30,20 +30,11 @@ TEST_F(KelvoServiceTest, OnlyTheSystemUidIsServedAndDumpNeedsThePermission) {
     SKIP_UNLESS_ROOT();
     LogCapture log;
     // The system uid is served and answered; another uid gets -1 and its
-    // query never reaches the query service.
-    // The answer may take seconds under the sanitizers; the refused call
-    // has none to wait for.
-    auto call = [](int waitMs) {
-        return [waitMs] {
-            sp<IKelvoService> service = KelvoQueryClient::connect();
-            android::Parcel response;
-            bool answered =
-                    KelvoQueryClient(service).queryComponent(0, 1, 0, 0, &response, waitMs);
-            return std::to_string(service->remoteDebugClose()) + " " + std::to_string(answered);
-        };
-    };
-    EXPECT_EQ("0 1", asUid(1000, call(30000)));
-    EXPECT_EQ("-1 0", asUid(1001, call(1000)));
+    // query never reaches the query service. The answer may take seconds
+    // under the sanitizers; the refused call has none to wait for.
+    const std::vector<std::string> calls = {"component", "0", "1", "0", "0", "close"};
+    EXPECT_EQ("--\n0\n", asUid(1000, calls, nullptr, 30000));
+    EXPECT_EQ("no answer\n--\n-1\n", asUid(1001, calls, nullptr, 1000));
     EXPECT_EQ(2u, log.count("Permission Denial: can't communicate with kelvo, uid=1001",
                             ANDROID_LOG_ERROR));
 
@@ -56,14 +47,12 @@ TEST_F(KelvoServiceTest, OnlyTheSystemUidIsServedAndDumpNeedsThePermission) {
     for (const Case& c :
          {Case{1001, false, false}, Case{1001, true, true}, Case{2000, false, true}}) {
         mState->grant("android.permission.DUMP", c.uid, c.granted);
-        std::string out = asUid(c.uid, [] {
-            std::string denial = "Permission Denial: cannot dump KELVO information from pid=" +
-                                 std::to_string(getpid()) + ", uid=" + std::to_string(getuid()) +
-                                 "\n";
-            std::string text = dumpOf(service(), {"--version"});
-            return text == denial ? std::string("denied") : text;
-        });
-        EXPECT_EQ(c.allowed ? kVersionLine : "denied", out) << c.uid << " " << c.granted;
+        pid_t pid = -1;
+        std::string out = asUid(c.uid, {"dump", "--version"}, &pid);
+        std::string denial =
+            "Permission Denial: cannot dump KELVO information from pid=" + std::to_string(pid) +
+            ", uid=" + std::to_string(c.uid) + "\n";
+        EXPECT_EQ(c.allowed ? kVersionLine : denial, out) << c.uid << " " << c.granted;
         android::PermissionCache::purge();
     }
 }
@@ -101,25 +90,24 @@ TEST_F(KelvoServiceTest, CollectionPathsAndPushMessagesAreCheckedBeforeForwardin
     chmod(collect.c_str(), 0777);
     LogCapture log;
     uint64_t refused = HealthCounters::get(Health::ServiceRequestsRefused);
-    std::string got = asUid(1000, [&cases] {
-        sp<IKelvoService> service = KelvoQueryClient::connect();
-        std::string out;
-        for (const Case& c : cases) {
-            int32_t r = c.message == nullptr
-                            ? service->remoteDebugCapture(String16(c.path))
-                            : service->noteSamplingMessage(String16(c.message), String16(c.path));
-            out += std::to_string(r) + " ";
+    std::vector<std::string> calls;
+    for (const Case& c : cases) {
+        if (c.message == nullptr) {
+            calls.insert(calls.end(), {"capture", c.path});
+        } else {
+            calls.insert(calls.end(), {"sample", c.message, c.path});
         }
-        // Still serving after all that.
-        return out + std::to_string(service->remoteDebugOpen(String16("1")));
-    });
+    }
+    // Still serving after all that.
+    calls.insert(calls.end(), {"open", "1"});
+    std::string got = asUid(1000, calls);
     std::string expected;
     size_t refusals = 0;
     for (const Case& c : cases) {
-        expected += std::to_string(c.result) + " ";
+        expected += std::to_string(c.result) + "\n";
         refusals += c.result < 0 ? 1 : 0;
     }
-    EXPECT_EQ(expected + "0", got);
+    EXPECT_EQ(expected + "0\n", got);
     EXPECT_EQ(refused + refusals, HealthCounters::get(Health::ServiceRequestsRefused));
     EXPECT_TRUE(log.contains("Invalid field id: 904", ANDROID_LOG_ERROR));
     EXPECT_TRUE(log.contains("Failed to parse transaction id", ANDROID_LOG_ERROR));

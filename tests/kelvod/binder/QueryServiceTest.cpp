@@ -73,23 +73,14 @@ TEST_F(QueryServiceTest, ComponentAndApplicationsQueriesAnswerEveryBlock) {
         {true, 1000000000, 2000000000, 3, 0, "no data\n"},
     };
     uint64_t refused = HealthCounters::get(Health::ServiceRequestsRefused);
-    std::string got = asUid(1000, [&queries] {
-        KelvoQueryClient client(KelvoQueryClient::connect());
-        std::string out;
-        for (const Query& q : queries) {
-            android::Parcel r;
-            // The oversized block takes seconds under the sanitizers.
-            const int waitMs = 60000;
-            bool answered =
-                    q.apps ? client.queryApplications(q.start, q.end, q.maskOrTop, &r, waitMs)
-                           : client.queryComponent(q.start, q.end, q.maskOrTop, q.flag, &r, waitMs);
-            out += !answered ? "no answer\n"
-                   : q.apps  ? KelvoQueryClient::formatApplications(r)
-                             : KelvoQueryClient::formatComponent(r, q.flag);
-            out += "--\n";
-        }
-        return out;
-    });
+    std::vector<std::string> calls;
+    for (const Query& q : queries) {
+        calls.insert(calls.end(), {q.apps ? "apps" : "component", std::to_string(q.start),
+                                   std::to_string(q.end), std::to_string(q.maskOrTop)});
+        if (!q.apps) calls.push_back(std::to_string(q.flag));
+    }
+    // The oversized block takes seconds under the sanitizers.
+    std::string got = asUid(1000, calls, nullptr, 60000);
     std::string expected;
     for (const Query& q : queries) expected += q.expected + "--\n";
     EXPECT_EQ(expected, got);
