@@ -307,7 +307,9 @@ TEST_P(PelmoraMessageTest, RecordsAreStoredAndReportedAtOnce) {
     if (*c.abnormal != '\0') abnormal.push_back(c.abnormal);
     EXPECT_EQ(abnormal, rows("SELECT type, name, reason, count FROM raw_pelmora_abnormal"));
     EXPECT_EQ(c.events, sent());
-    if (c.debug != nullptr) EXPECT_EQ(c.debugRows, rows(c.debug));
+    if (c.debug != nullptr) {
+        EXPECT_EQ(c.debugRows, rows(c.debug));
+    }
     SystraceDumper::setClockForTest(nullptr);
     gLogUserType = saved;
 }
