@@ -40,6 +40,7 @@ enum class Health : uint32_t {
     ServiceRequestsRefused,  // binder requests refused or cut (caller, path, push message, query, reply size)
     AbnormalityInputRefused, // abnormality reports, records or rows refused or over their cap
     SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
+    BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     Count
 };
 

@@ -42,6 +42,9 @@ const Refusal kRefusals[] = {
     {"unknown foreground package", "at 5 foreground com.other", "no app has the package"},
     {"package not of the uid", "process 5 10061 x com.example.browser", "does not have"},
     {"pid declared twice", "process 2001 10061 again", "pid 2001 is declared twice"},
+    {"battery model without level", "battery-model 3000", "battery-model <capacity mAh>"},
+    {"battery model bad current", "battery-model 3000 50% idle -5", "battery-model <capacity mAh>"},
+    {"wakelock of no app", "at 5 held-wakelock com.other Tag 20:00", "no app has the package"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

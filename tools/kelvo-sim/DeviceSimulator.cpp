@@ -15,6 +15,8 @@
 #include <fstream>
 #include <sstream>
 
+#include "BatteryModel.h"
+#include "BatteryReport.h"
 #include "CpuTree.h"
 #include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
@@ -186,6 +188,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot lay out the CPU counters below " + root + ": " + strerror(errno);
         return false;
     }
+    mBattery.reset(new BatteryModel(root, mScenario.battery()));
+    if (!mBattery->writeFiles()) {
+        *error = "cannot lay out the battery files below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -209,6 +216,9 @@ bool DeviceSimulator::startServices(std::string* error) {
         processes.push_back(entry);
     }
     state->setProcesses(processes);
+    PlatformState::Battery battery = state->battery();
+    battery.level = mBattery->level();
+    state->setBattery(battery);
     android::ProcessState::self()->startThreadPool();
     if (mServices->startAll() != android::NO_ERROR) {
         *error = "cannot register the platform services below " + mOptions.root;
@@ -306,6 +316,7 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
         case Scenario::Action::Load: {
             std::lock_guard<std::mutex> lock(mLock);
             mModel.setLoad(step.pid, step.cluster, step.percent, step.frequency);
+            mBattery->setLoad(step.pid, step.cluster, step.percent);
             return;
         }
         case Scenario::Action::Foreground:
@@ -313,6 +324,7 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
                                        ("name=" + step.text).c_str(), t);
             break;
         case Scenario::Action::Screen:
+            mBattery->setScreen(step.flag);
             result = mLogWriter->write(
                 LogWriter::PRIORITY_INFO, "KELVO_TAG_BRIGHTNESS",
                 ("brightness=" + std::to_string(step.flag ? kBrightnessOn : 0)).c_str(), t);
@@ -322,15 +334,24 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             battery.acOnline = step.text == "ac";
             battery.usbOnline = step.text == "usb";
             battery.wirelessOnline = step.text == "wireless";
-            mServices->state()->setBattery(battery);
+            mBattery->setCharger(step.text != "off");
+            pushBattery(battery);
             return;
         }
         case Scenario::Action::Battery: {
-            PlatformState::Battery battery = mServices->state()->battery();
-            battery.level = step.value;
-            mServices->state()->setBattery(battery);
+            mBattery->setLevel(step.value);
+            pushBattery(mServices->state()->battery());
             return;
         }
+        case Scenario::Action::HeldWakelock:
+            // What the power-management application writes when it finds
+            // a wakelock held too long.
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, "KELVO_TAG_PM_POWER_CONTROL",
+                                       ("type=21 package=" + step.text + " reason=" + step.tag +
+                                        "#held count=" + std::to_string(step.value))
+                                           .c_str(),
+                                       t);
+            break;
     }
     ++mLogWritten;
     if (result != 0) {
@@ -339,10 +360,29 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
     }
 }
 
+void DeviceSimulator::pushBattery(PlatformState::Battery battery) {
+    // The daemon reads the gauge when it hears of the change: the files
+    // hold the new state first.
+    if (!mBattery->writeFiles()) {
+        fprintf(stderr, "kelvo-sim: cannot rewrite the battery files: %s\n", strerror(errno));
+    }
+    battery.level = mBattery->level();
+    mServices->state()->setBattery(battery);
+}
+
 void DeviceSimulator::advanceTo(int64_t ms) {
-    std::lock_guard<std::mutex> lock(mLock);
-    mModel.advance(ms - mModelMs);
-    mModelMs = ms;
+    bool levelChanged = false;
+    {
+        std::lock_guard<std::mutex> lock(mLock);
+        mModel.advance(ms - mModelMs);
+        levelChanged = mBattery->advance(ms - mModelMs);
+        mModelMs = ms;
+    }
+    if (levelChanged) {
+        pushBattery(mServices->state()->battery());
+    } else if (!mBattery->writeFiles()) {
+        fprintf(stderr, "kelvo-sim: cannot rewrite the battery files: %s\n", strerror(errno));
+    }
 }
 
 int32_t DeviceSimulator::hourlyRoundsFinished() const {
@@ -497,6 +537,15 @@ int DeviceSimulator::finish(bool completed) {
         }
     }
     SimReport report(header, truth, mModel.nameUids());
+    BatteryReport::Model battery;
+    battery.capacityMah = mScenario.battery().capacityMah;
+    battery.startLevel = mScenario.battery().startLevel;
+    battery.endLevel = mBattery ? mBattery->level() : battery.startLevel;
+    battery.drawnMah = mBattery ? mBattery->drawnMah() : 0;
+    battery.chargedMah = mBattery ? mBattery->chargedMah() : 0;
+    report.addSection(BatteryReport(SimReport::databasePath(mOptions.root),
+                                    SimReport::eventsPath(mOptions.root), battery)
+                          .build());
     std::string text;
     bool readable = report.build(&text);
     fputs("\n", stdout);

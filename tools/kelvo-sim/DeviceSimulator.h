@@ -10,10 +10,12 @@
 
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
+#include "PlatformState.h"
 #include "Scenario.h"
 
 namespace kelvo {
 
+class BatteryModel;
 class CpuTree;
 class LogWriter;
 class PlatformServices;
@@ -64,6 +66,8 @@ private:
     void apply(const Scenario::Step& step);
     void advanceTo(int64_t ms);
     void writeCounters();
+    // Writes the battery files, then has the registrar push the state.
+    void pushBattery(PlatformState::Battery battery);
     // The per-process report of one request (the bytes after the echoed
     // time and mode).
     std::string answerCpuRequest();
@@ -91,6 +95,7 @@ private:
     std::mutex mLock;  // the model, the guard and the truth, shared with the driver thread
     DeviceModel mModel;
     std::unique_ptr<CpuTree> mTree;
+    std::unique_ptr<BatteryModel> mBattery;  // the play thread's
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

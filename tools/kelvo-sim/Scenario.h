@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "BatteryModel.h"
+
 namespace kelvo {
 namespace sim {
 
@@ -38,6 +40,7 @@ public:
         Screen,      // flag: on
         Charger,     // text: "ac", "usb", "wireless" or "off"
         Battery,     // value: level
+        HeldWakelock,  // text: package, tag: the wakelock, value: ms held
     };
 
     struct Step {
@@ -51,6 +54,7 @@ public:
         int32_t value = 0;
         bool flag = false;
         std::string text;
+        std::string tag;
     };
 
     // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
@@ -66,6 +70,8 @@ public:
     int32_t tickMs() const { return mTickMs; }
     const std::vector<App>& apps() const { return mApps; }
     const std::vector<Process>& processes() const { return mProcesses; }
+    // The battery (the defaults without a "battery-model" line).
+    const BatteryModel::Config& battery() const { return mBattery; }
     // In time order (lines of equal time keep their order).
     const std::vector<Step>& steps() const { return mSteps; }
 
@@ -91,6 +97,7 @@ private:
     std::vector<App> mApps;
     std::vector<Process> mProcesses;
     std::vector<Step> mSteps;
+    BatteryModel::Config mBattery;
 };
 
 }  // namespace sim

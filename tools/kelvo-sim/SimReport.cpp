@@ -275,6 +275,9 @@ bool SimReport::build(std::string* text) {
                   " ms, energy %" PRId64 "\n\n",
                   mHourlyComponentRows, mHourlyComponentTime, mHourlyComponentEnergy);
     describeHourlyEvent(&out);
+    for (const std::string& section : mSections) {
+        out += "\n" + section;
+    }
     out += "\nFiles\n";
     out += "  database         " + databasePath(mHeader.root) + "\n";
     out += "  uploaded events  " + eventsPath(mHeader.root) + "\n";

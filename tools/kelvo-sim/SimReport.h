@@ -38,6 +38,8 @@ public:
     bool build(std::string* text);
     // name \t uid \t truth ms \t attributed ms, one line per application.
     std::string truthTable() const;
+    // A section of another part of the device, printed before the files.
+    void addSection(const std::string& text) { mSections.push_back(text); }
 
     static std::string databasePath(const std::string& root);
     static std::string eventsPath(const std::string& root);
@@ -69,6 +71,7 @@ private:
     int64_t mHourlyComponentTime = 0;
     int64_t mHourlyComponentEnergy = 0;
     int64_t mHourlyComponentRows = 0;
+    std::vector<std::string> mSections;
 };
 
 }  // namespace sim
