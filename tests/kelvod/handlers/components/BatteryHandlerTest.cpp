@@ -243,6 +243,10 @@ struct NoiseCase {
     int32_t level;
     const char* span;       // discharging gas gauge and level
     uint64_t kept;          // values that could not be read
+    // charge_now of a second span (screen off), and the hour's compensation
+    // over both: the valid spans' discharge x 3600.
+    const char* nextChargeNow;
+    const char* compensation;
 };
 
 void PrintTo(const NoiseCase& c, std::ostream* os) {
@@ -268,20 +272,24 @@ TEST_P(BatteryNoiseTest, SpansBookNoiseAsZeroAndFailuresAsNothing) {
     }
     file("capacity", std::to_string(c.level));
     level(kT + 60000, c.level);
-    EXPECT_EQ(std::vector<std::string>{std::string("0|60000|") + c.span + "|0|0|0|0|0|0"},
-              spans());
+    EXPECT_EQ(std::string("0|60000|") + c.span + "|0|0|0|0|0|0", spans().at(0));
     EXPECT_EQ(kept + c.kept, HealthCounters::get(Health::BatteryReadingsKept));
+    file("charge_now", c.nextChargeNow);
+    notify(NOTIFICATION_SCREEN_STATE_CHANGED, kT + 120000, {0});
+    notify(NOTIFICATION_COMPONENT_ACCOUNTING, kH);
+    EXPECT_EQ(std::string("3:240000:64=") + c.compensation + " 0:240000:3", mHourly->got());
 }
 
 INSTANTIATE_TEST_SUITE_P(
     Cases, BatteryNoiseTest,
-    ::testing::Values(NoiseCase{"rise_within_tolerance", false, "1649", 50, "0|0", 0},
-                      NoiseCase{"rise_beyond_tolerance", false, "1650", 50, "-150|0", 0},
-                      NoiseCase{"level_rise_noise", false, "1490", 54, "10|0", 0},
-                      NoiseCase{"level_rise_kept", false, "1490", 55, "10|-5", 0},
-                      NoiseCase{"charge_now_garbage", false, "x12", 49, "0|1", 1},
-                      NoiseCase{"charge_now_missing", false, nullptr, 49, "0|1", 1},
-                      NoiseCase{"micro_units_day_one", true, "0", 49, "30|1", 0}),
+    ::testing::Values(
+        NoiseCase{"rise_within_tolerance", false, "1649", 50, "0|0", 0, "1639", "36000"},
+        NoiseCase{"rise_beyond_tolerance", false, "1650", 50, "-150|0", 0, "1640", "36000"},
+        NoiseCase{"level_rise_noise", false, "1490", 54, "10|0", 0, "1480", "72000"},
+        NoiseCase{"level_rise_kept", false, "1490", 55, "10|-5", 0, "1480", "36000"},
+        NoiseCase{"charge_now_garbage", false, "x12", 49, "0|1", 1, "1490", "36000"},
+        NoiseCase{"charge_now_missing", false, nullptr, 49, "0|1", 1, "1490", "36000"},
+        NoiseCase{"micro_units_day_one", true, "0", 49, "30|1", 0, "0", "108000"}),
     [](const ::testing::TestParamInfo<NoiseCase>& i) { return std::string(i.param.name); });
 
 // The day: capacity and charge count refreshed at the daily tick and sent
