@@ -56,13 +56,20 @@ bool query(sqlite3* db, const char* sql, const std::function<void(sqlite3_stmt*)
 
 const char* eventName(uint32_t id) {
     switch (id) {
-        case 903002051: return "battery capacity decrease";
-        case 903002052: return "battery level decrease";
-        case 903002053: return "system (wake-ups, alarms, wakelocks, modem, sensor hub, location)";
-        case 903002054: return "screen-off drain";
-        case 903002055: return "applications (energy, CPU, trace)";
-        case 903002056: return "restarts";
-        default: return nullptr;
+        case 903002051:
+            return "battery capacity decrease";
+        case 903002052:
+            return "battery level decrease";
+        case 903002053:
+            return "system (wake-ups, alarms, wakelocks, modem, sensor hub, location)";
+        case 903002054:
+            return "screen-off drain";
+        case 903002055:
+            return "applications (energy, CPU, trace)";
+        case 903002056:
+            return "restarts";
+        default:
+            return nullptr;
     }
 }
 
@@ -78,10 +85,10 @@ std::string nameOf(const Json::Value& value) {
 
 void BatteryReport::describeBattery(std::string* out) const {
     *out += "Battery\n";
-    *out += format("  model     %d mAh, level %d%% .. %d%%; the load drew %.1f mAh, the charger "
-                   "gave %.1f mAh\n",
-                   mModel.capacityMah, mModel.startLevel, mModel.endLevel, mModel.drawnMah,
-                   mModel.chargedMah);
+    *out += format(
+        "  model     %d mAh, level %d%% .. %d%%; the load drew %.1f mAh, the charger "
+        "gave %.1f mAh\n",
+        mModel.capacityMah, mModel.startLevel, mModel.endLevel, mModel.drawnMah, mModel.chargedMah);
     sqlite3* db = nullptr;
     std::string error;
     if (sqlite3_open_v2(mDatabasePath.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
@@ -109,31 +116,32 @@ void BatteryReport::describeBattery(std::string* out) const {
                 *out += "  measured  no battery span was recorded\n";
                 return;
             }
-            *out += format("  measured  %" PRId64 " spans %s .. %s: discharge %.0f mAh and %.0f%% "
+            *out += format("  measured  %" PRId64
+                           " spans %s .. %s: discharge %.0f mAh and %.0f%% "
                            "(screen on %.0f s, off %.0f s), charged %.0f mAh in %.0f s\n",
                            spans, clockOf(sqlite3_column_int64(s, 1)).c_str(),
-                           clockOf(sqlite3_column_int64(s, 2)).c_str(),
-                           sqlite3_column_double(s, 3), sqlite3_column_double(s, 4),
-                           sqlite3_column_double(s, 6) / 1000, sqlite3_column_double(s, 7) / 1000,
-                           sqlite3_column_double(s, 5), sqlite3_column_double(s, 8) / 1000);
+                           clockOf(sqlite3_column_int64(s, 2)).c_str(), sqlite3_column_double(s, 3),
+                           sqlite3_column_double(s, 4), sqlite3_column_double(s, 6) / 1000,
+                           sqlite3_column_double(s, 7) / 1000, sqlite3_column_double(s, 5),
+                           sqlite3_column_double(s, 8) / 1000);
         },
         &error);
     int32_t rounds = 0;
-    ok = ok && query(db,
-                     "SELECT end_time, battery, power_model, free, ratio FROM "
-                     "debug_energy_compensation ORDER BY end_time",
-                     [out, &rounds](sqlite3_stmt* s) {
-                         ++rounds;
-                         *out += format(
-                             "  hour to %s: measured %" PRId64 " mA·s, modelled %" PRId64
-                             " mA·s, free %" PRId64 ", compensation ratio %.3f\n",
-                             clockOf(sqlite3_column_int64(s, 0)).c_str(),
-                             static_cast<int64_t>(sqlite3_column_int64(s, 1)),
-                             static_cast<int64_t>(sqlite3_column_int64(s, 2)),
-                             static_cast<int64_t>(sqlite3_column_int64(s, 3)),
-                             sqlite3_column_int64(s, 4) / 1000.0);
-                     },
-                     &error);
+    ok = ok && query(
+                   db,
+                   "SELECT end_time, battery, power_model, free, ratio FROM "
+                   "debug_energy_compensation ORDER BY end_time",
+                   [out, &rounds](sqlite3_stmt* s) {
+                       ++rounds;
+                       *out += format("  hour to %s: measured %" PRId64 " mA·s, modelled %" PRId64
+                                      " mA·s, free %" PRId64 ", compensation ratio %.3f\n",
+                                      clockOf(sqlite3_column_int64(s, 0)).c_str(),
+                                      static_cast<int64_t>(sqlite3_column_int64(s, 1)),
+                                      static_cast<int64_t>(sqlite3_column_int64(s, 2)),
+                                      static_cast<int64_t>(sqlite3_column_int64(s, 3)),
+                                      sqlite3_column_int64(s, 4) / 1000.0);
+                   },
+                   &error);
     if (!ok) {
         *out += "  the battery tables could not be read: " + error + "\n";
     } else if (rounds == 0) {
@@ -168,9 +176,9 @@ void BatteryReport::describeAbnormalities(std::string* out) const {
         if (id == 903002053 && params["5"].isArray()) {
             for (const Json::Value& element : params["5"]) {
                 const Json::Value& p = element["params"];
-                *out += format("    wakelock %s tag %s held %" PRId64 " ms\n",
-                               nameOf(p["5"]).c_str(), nameOf(p["6"]).c_str(),
-                               p["3"].isIntegral() ? p["3"].asInt64() : 0);
+                *out +=
+                    format("    wakelock %s tag %s held %" PRId64 " ms\n", nameOf(p["5"]).c_str(),
+                           nameOf(p["6"]).c_str(), p["3"].isIntegral() ? p["3"].asInt64() : 0);
             }
         }
         if ((id == 903002051 || id == 903002052) && params["2"].isIntegral()) {

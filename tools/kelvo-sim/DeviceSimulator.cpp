@@ -256,7 +256,7 @@ bool DeviceSimulator::startDaemon(std::string* error) {
 bool DeviceSimulator::waitDaemonReady(std::string* error) {
     // Ready once the buffered log socket is there and the daemon's battery
     // listener has registered: the routines and handlers are initialised
-    // right after that step of the start-up, in a moment.
+    // before that step of the start-up, the dispatcher a moment after.
     std::string socket = RootPath::resolve("/dev/socket/") + BufferedLogClient::kSocketName;
     int64_t deadline = monotonicMs() + kReadyTimeoutMs;
     while (monotonicMs() < deadline) {

@@ -77,8 +77,8 @@ void BatteryModel::setLoad(int32_t pid, int32_t cluster, int32_t percent) {
 }
 
 void BatteryModel::setLevel(int32_t percent) {
-    mChargeMah = static_cast<double>(mConfig.capacityMah) * std::min(std::max(percent, 0), 100) /
-                 100.0;
+    mChargeMah =
+        static_cast<double>(mConfig.capacityMah) * std::min(std::max(percent, 0), 100) / 100.0;
 }
 
 double BatteryModel::currentMa() const {

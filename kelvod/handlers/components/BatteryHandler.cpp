@@ -60,25 +60,37 @@ const column_attribute kStateColumns[] = {
 };
 // The span columns: four buckets (discharging screen on, screen off,
 // charging screen on, screen off) of duration, gas gauge and level.
-#define SPAN_COLUMNS                                                             \
-    {COLUMN_LONG, "discharge_screen_on_duration"},                               \
-        {COLUMN_INT, "discharge_screen_on_gas_gauge"},                           \
-        {COLUMN_INT, "discharge_screen_on_level"},                               \
-        {COLUMN_LONG, "discharge_screen_off_duration"},                          \
-        {COLUMN_INT, "discharge_screen_off_gas_gauge"},                          \
-        {COLUMN_INT, "discharge_screen_off_level"},                              \
-        {COLUMN_LONG, "charge_screen_on_duration"},                              \
-        {COLUMN_INT, "charge_screen_on_gas_gauge"},                              \
-        {COLUMN_INT, "charge_screen_on_level"},                                  \
-        {COLUMN_LONG, "charge_screen_off_duration"},                             \
-        {COLUMN_INT, "charge_screen_off_gas_gauge"},                             \
-    {                                                                            \
-        COLUMN_INT, "charge_screen_off_level"                                    \
-    }
 const column_attribute kRawColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"}, SPAN_COLUMNS};
-const column_attribute kHourlyColumns[] = {{COLUMN_TIME, "timestamp"}, SPAN_COLUMNS};
-#undef SPAN_COLUMNS
+    {COLUMN_TIME, "start_time"},
+    {COLUMN_TIME, "end_time"},
+    {COLUMN_LONG, "discharge_screen_on_duration"},
+    {COLUMN_INT, "discharge_screen_on_gas_gauge"},
+    {COLUMN_INT, "discharge_screen_on_level"},
+    {COLUMN_LONG, "discharge_screen_off_duration"},
+    {COLUMN_INT, "discharge_screen_off_gas_gauge"},
+    {COLUMN_INT, "discharge_screen_off_level"},
+    {COLUMN_LONG, "charge_screen_on_duration"},
+    {COLUMN_INT, "charge_screen_on_gas_gauge"},
+    {COLUMN_INT, "charge_screen_on_level"},
+    {COLUMN_LONG, "charge_screen_off_duration"},
+    {COLUMN_INT, "charge_screen_off_gas_gauge"},
+    {COLUMN_INT, "charge_screen_off_level"},
+};
+const column_attribute kHourlyColumns[] = {
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_LONG, "discharge_screen_on_duration"},
+    {COLUMN_INT, "discharge_screen_on_gas_gauge"},
+    {COLUMN_INT, "discharge_screen_on_level"},
+    {COLUMN_LONG, "discharge_screen_off_duration"},
+    {COLUMN_INT, "discharge_screen_off_gas_gauge"},
+    {COLUMN_INT, "discharge_screen_off_level"},
+    {COLUMN_LONG, "charge_screen_on_duration"},
+    {COLUMN_INT, "charge_screen_on_gas_gauge"},
+    {COLUMN_INT, "charge_screen_on_level"},
+    {COLUMN_LONG, "charge_screen_off_duration"},
+    {COLUMN_INT, "charge_screen_off_gas_gauge"},
+    {COLUMN_INT, "charge_screen_off_level"},
+};
 constexpr int32_t kSpanValues = 12;
 
 const table_attribute kStateTable = {"1.0", 1, 7, kStateColumns, "raw_battery_state"};
@@ -174,13 +186,12 @@ int32_t BatteryHandler::checkEnable() {
 }
 
 void BatteryHandler::setupListeners(Parcel& out) {
-    for (int32_t type : {NOTIFICATION_CHARGER_ONLINE_CHANGED, NOTIFICATION_BATTERY_LEVEL_CHANGED,
-                         NOTIFICATION_SCREEN_STATE_CHANGED, NOTIFICATION_HOURLY_TICK,
-                         NOTIFICATION_HOURLY_UPLOADING, NOTIFICATION_COMPONENT_ACCOUNTING,
-                         NOTIFICATION_DAILY_TICK, NOTIFICATION_DAILY_UPLOADING,
-                         NOTIFICATION_DAWN_UPLOADING, NOTIFICATION_TIME_CHANGED,
-                         NOTIFICATION_ABNORMALITY_THERMAL, NOTIFICATION_FORCE_BALANCE,
-                         NOTIFICATION_SHUT_DOWN, NOTIFICATION_DIFF_DAY_REBOOT}) {
+    for (int32_t type :
+         {NOTIFICATION_CHARGER_ONLINE_CHANGED, NOTIFICATION_BATTERY_LEVEL_CHANGED,
+          NOTIFICATION_SCREEN_STATE_CHANGED, NOTIFICATION_HOURLY_TICK, NOTIFICATION_HOURLY_UPLOADING,
+          NOTIFICATION_COMPONENT_ACCOUNTING, NOTIFICATION_DAILY_TICK, NOTIFICATION_DAILY_UPLOADING,
+          NOTIFICATION_DAWN_UPLOADING, NOTIFICATION_TIME_CHANGED, NOTIFICATION_ABNORMALITY_THERMAL,
+          NOTIFICATION_FORCE_BALANCE, NOTIFICATION_SHUT_DOWN, NOTIFICATION_DIFF_DAY_REBOOT}) {
         addNotifierListener(type, out);
     }
 }
@@ -547,16 +558,15 @@ int32_t BatteryHandler::sendDailyMisc(int64_t time) {
     const struct {
         const char* name;
         int32_t value;
-    } kValues[] = {{"battery_full_capacity", mFullCapacity},
-                   {"battery_charge_count", mChargeCount}};
+    } kValues[] = {{"battery_full_capacity", mFullCapacity}, {"battery_charge_count", mChargeCount}};
     int32_t ret = 0;
     for (const auto& v : kValues) {
         Parcel misc;
         misc.writeInt64(time);
         misc.writeString8(String8(v.name));
         misc.writeString8(String8::format("%d", v.value));
-        if (KelvoAgent::getInstance()->sendToHandler(HANDLER_SYSTEM, kSystemMiscData, misc,
-                                                     nullptr, false) < 0) {
+        if (KelvoAgent::getInstance()->sendToHandler(HANDLER_SYSTEM, kSystemMiscData, misc, nullptr,
+                                                     false) < 0) {
             KLOGE("Failed to sent data to common table!");
             ret = -2;
         }
@@ -764,13 +774,11 @@ int32_t BatteryHandler::onHourlyUploading(const Parcel& data) {
 }
 
 int32_t BatteryHandler::onDailyUploading(const Parcel& data) {
-    return onPeriodUploading(data, EVENT_DAILY_COMPONENTS, kDayMs, CANDIDATE_DAILY_UPLOAD,
-                             "daily");
+    return onPeriodUploading(data, EVENT_DAILY_COMPONENTS, kDayMs, CANDIDATE_DAILY_UPLOAD, "daily");
 }
 
 int32_t BatteryHandler::onDawnUploading(const Parcel& data) {
-    return onPeriodUploading(data, EVENT_DAILY_COMPONENTS, kDawnMs, CANDIDATE_DAWN_UPLOAD,
-                             "dawn");
+    return onPeriodUploading(data, EVENT_DAILY_COMPONENTS, kDawnMs, CANDIDATE_DAWN_UPLOAD, "dawn");
 }
 
 }  // namespace kelvo

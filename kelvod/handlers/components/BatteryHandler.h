@@ -74,11 +74,11 @@ public:
     int32_t onDawnUploading(const android::Parcel& data) override;
     int32_t logComponentAccounting(int64_t time) override;
 
+private:
     // The gas gauge tolerance of a full capacity: a discharging span whose
     // charge rose by less than this much is noise.
     static int32_t toleranceOf(int32_t fullCapacity);
 
-private:
     // One power-supply value: 0, -2 (no number) or -14 (no file, no line).
     int32_t readValue(const char* file, int32_t* out) const;
     // Refreshes the full capacity and the tolerance; on failure both keep

@@ -8,8 +8,8 @@
 #include <mutex>
 
 #include "BatteryModel.h"
-#include "HealthCounters.h"
 #include "FakeBatteryRegistrar.h"
+#include "HealthCounters.h"
 #include "PlatformState.h"
 #include "binder/managers/BatteryListener.h"
 #include "core/KelvoAgent.h"
@@ -132,13 +132,18 @@ protected:
         bool longs = type == NOTIFICATION_HOURLY_TICK || type == NOTIFICATION_DAILY_TICK ||
                      type == NOTIFICATION_TIME_CHANGED;
         for (size_t i = 0; i < more.size(); ++i) {
-            if (flagFirst && i == 0) p.writeBool(more[i] != 0);
-            else if (longs) p.writeInt64(more[i]);
-            else p.writeInt32(static_cast<int32_t>(more[i]));
+            if (flagFirst && i == 0)
+                p.writeBool(more[i] != 0);
+            else if (longs)
+                p.writeInt64(more[i]);
+            else
+                p.writeInt32(static_cast<int32_t>(more[i]));
         }
         mBattery->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, p));
     }
-    void level(int64_t t, int32_t l) { notify(NOTIFICATION_BATTERY_LEVEL_CHANGED, t, {l, 3800, 250}); }
+    void level(int64_t t, int32_t l) {
+        notify(NOTIFICATION_BATTERY_LEVEL_CHANGED, t, {l, 3800, 250});
+    }
     // Overrides one power-supply file of the model's layout.
     void file(const char* name, const std::string& text) {
         mRoot->writeFile("/" + mModel->folder() + "/" + name, text + "\n");
@@ -161,7 +166,8 @@ protected:
     Json::Value lastEvent(uint32_t id) {
         DataUploader::getInstance()->uploadEvent();
         Json::Value found;
-        for (const Json::Value& e : events()) found = e["event"].asUInt() == id ? e["params"] : found;
+        for (const Json::Value& e : events())
+            found = e["event"].asUInt() == id ? e["params"] : found;
         return found;
     }
 
@@ -192,8 +198,8 @@ TEST_F(BatteryTest, SpansFromTheRegistrarThroughTheHour) {
     reg.writeStrongBinder(listener);
     ASSERT_EQ(android::NO_ERROR, registrar->transact(1, reg, &reply));
     // Both notifications of the first report reach the handler.
-    ASSERT_TRUE(waitFor([&] { return dump().find("voltage 3800 temperature 250 charge 1") !=
-                                     std::string::npos; }));
+    ASSERT_TRUE(waitFor(
+        [&] { return dump().find("voltage 3800 temperature 250 charge 1") != std::string::npos; }));
     auto at = [&](int64_t minutes) {
         mModel->advance(60000);
         ASSERT_TRUE(mModel->writeFiles());
@@ -220,7 +226,8 @@ TEST_F(BatteryTest, SpansFromTheRegistrarThroughTheHour) {
               spans());
     EXPECT_EQ(std::vector<std::string>{"1520|50|3800|1|0"},
               rows("SELECT gas_gauge, level, voltage, charge, screen FROM raw_battery_state WHERE "
-                   "timestamp = " + std::to_string(kH)));
+                   "timestamp = " +
+                   std::to_string(kH)));
     EXPECT_EQ(std::vector<std::string>{"0|0|0|60000|10|0|60000|10|0|120000|20|0"},
               rows("SELECT discharge_screen_on_duration, discharge_screen_on_gas_gauge, "
                    "discharge_screen_on_level, discharge_screen_off_duration, "
@@ -241,8 +248,8 @@ struct NoiseCase {
     bool micro;
     const char* chargeNow;  // the new charge_now text, or null to remove it
     int32_t level;
-    const char* span;       // discharging gas gauge and level
-    uint64_t kept;          // values that could not be read
+    const char* span;  // discharging gas gauge and level
+    uint64_t kept;     // values that could not be read
     // charge_now of a second span (screen off), and the hour's compensation
     // over both: the valid spans' discharge x 3600.
     const char* nextChargeNow;
@@ -309,10 +316,12 @@ TEST_F(BatteryTest, DailyStatisticsAndLevelDistribution) {
                  {day, 40, 9}};
     for (const auto& r : kRows) {
         std::string t = std::to_string(r.at);
-        sql += "INSERT INTO hourly_component_battery (timestamp, charge_screen_on_gas_gauge, "
-               "charge_screen_off_gas_gauge) VALUES (" + t + ", " + std::to_string(r.charged) +
-               ", 0); INSERT INTO raw_battery_state (timestamp, level) VALUES (" + t + ", " +
-               std::to_string(r.level) + ");";
+        sql +=
+            "INSERT INTO hourly_component_battery (timestamp, charge_screen_on_gas_gauge, "
+            "charge_screen_off_gas_gauge) VALUES (" +
+            t + ", " + std::to_string(r.charged) +
+            ", 0); INSERT INTO raw_battery_state (timestamp, level) VALUES (" + t + ", " +
+            std::to_string(r.level) + ");";
     }
     ASSERT_EQ(0, kelvo::test::DirectDb(dbPath()).exec(sql));
     notify(NOTIFICATION_DAILY_TICK, day - kHour, {day});
@@ -329,9 +338,10 @@ TEST_F(BatteryTest, DailyStatisticsAndLevelDistribution) {
         levels += std::to_string(e["params"]["0"].asInt64()) + "/" +
                   std::to_string(e["params"]["1"].asInt64()) + " ";
     }
-    EXPECT_EQ("0/0 0/0 80/5 0/0 0/0 0/0 0/0 0/0 0/0 58/7 0/0 0/0 0/0 0/0 0/0 0/0 0/0 0/0 0/0 "
-              "0/0 0/0 0/0 0/0 40/9 ",
-              levels);
+    EXPECT_EQ(
+        "0/0 0/0 80/5 0/0 0/0 0/0 0/0 0/0 0/0 58/7 0/0 0/0 0/0 0/0 0/0 0/0 0/0 0/0 0/0 "
+        "0/0 0/0 0/0 0/0 40/9 ",
+        levels);
     EXPECT_EQ("0:" + at + ":5 0:" + at + ":6", mHourly->got());
 }
 
@@ -348,8 +358,7 @@ TEST_F(BatteryTest, DropsReachTheAbnormalityRoutine) {
     level(kT + 4000, 100);  // still full: no second check
     mAbnormality->sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, -1));
     WallClock::setFixedTimeMs(kT + 60000);
-    mAbnormality->sendMessageSync(
-        ParcelMessage(MESSAGE_TIMER, AbnormalityRoutine::kCheckTimerId));
+    mAbnormality->sendMessageSync(ParcelMessage(MESSAGE_TIMER, AbnormalityRoutine::kCheckTimerId));
     EXPECT_EQ(3, lastEvent(903002051)["2"].asInt64());  // 100 of 3000 mAh
     EXPECT_EQ(10, lastEvent(903002052)["2"].asInt64());
     EXPECT_EQ(std::vector<std::string>{"2900|100|120|SimCell"},
