@@ -72,6 +72,10 @@ diff=$(( appEnergy - componentEnergy ))
         WHERE charge_screen_on_duration + charge_screen_off_duration > 0")" -ge 1 ] ||
     fail "no charging battery span"
 [ "$(q "SELECT COUNT(*) FROM hourly_component_battery")" -ge 1 ] || fail "no hourly battery row"
+# The registrar's first report, heard by the handler at the daemon's start,
+# opened a discharging span that the cable closed.
+[ "$(q "SELECT charge_screen_on_duration + charge_screen_off_duration FROM raw_component_battery
+        ORDER BY start_time LIMIT 1")" = 0 ] || fail "the battery's first report opened no span"
 read -r measured spans <<<"$(q "SELECT SUM(discharge_screen_on_gas_gauge +
                                   discharge_screen_off_gas_gauge), COUNT(*)
                                   FROM raw_component_battery" | tr '|' ' ')"
