@@ -1,7 +1,10 @@
 #include "handlers/components/BatteryHandler.h"
 
+#include <ctype.h>
 #include <errno.h>
+#include <stdint.h>
 #include <stdio.h>
+#include <stdlib.h>
 #include <string.h>
 
 #include <string>
@@ -233,15 +236,20 @@ int32_t BatteryHandler::readValue(const char* file, int32_t* out) const {
         KLOGE("Failed to read %s: (%s)", path.c_str(), error != 0 ? strerror(error) : "empty");
         return -14;
     }
-    int32_t value = 0;
-    char extra = 0;
-    int ret = sscanf(buffer, "%d %c", &value, &extra);
-    if (ret != 1) {
+    // One whole number of 32 bits and nothing but blanks after it.
+    char* end = nullptr;
+    errno = 0;
+    long long value = strtoll(buffer, &end, 10);
+    bool number = end != buffer && errno == 0 && value >= INT32_MIN && value <= INT32_MAX;
+    while (number && *end != '\0' && isspace(static_cast<unsigned char>(*end))) {
+        ++end;
+    }
+    if (!number || *end != '\0') {
         buffer[strcspn(buffer, "\n")] = '\0';
-        KLOGE("Error value(path=%s, buffer=%s), ret=%d", path.c_str(), buffer, ret);
+        KLOGE("Error value(path=%s, buffer=%s), ret=%d", path.c_str(), buffer, number ? 1 : 0);
         return -2;
     }
-    *out = value;
+    *out = static_cast<int32_t>(value);
     return 0;
 }
 

@@ -296,6 +296,7 @@ INSTANTIATE_TEST_SUITE_P(
         NoiseCase{"level_rise_kept", false, "1490", 55, "10|-5", 0, "1480", "36000"},
         NoiseCase{"charge_now_garbage", false, "x12", 49, "0|1", 1, "1490", "36000"},
         NoiseCase{"charge_now_missing", false, nullptr, 49, "0|1", 1, "1490", "36000"},
+        NoiseCase{"charge_now_too_large", false, "4294967296", 49, "0|1", 1, "1490", "36000"},
         NoiseCase{"micro_units_day_one", true, "0", 49, "30|1", 0, "0", "108000"}),
     [](const ::testing::TestParamInfo<NoiseCase>& i) { return std::string(i.param.name); });
 
