@@ -15,6 +15,7 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "handlers/components/BatteryHandler.h"
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
@@ -63,6 +64,10 @@ android::sp<KelvoOperator> makeWifiHandler() {
     return new WifiHandler();
 }
 
+android::sp<KelvoOperator> makeBatteryHandler() {
+    return new BatteryHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -85,6 +90,7 @@ struct Factories {
         handlers[HANDLER_GNSS] = &makeGnssHandler;
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
+        handlers[HANDLER_BATTERY] = &makeBatteryHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
         handlers[HANDLER_WIFI] = &makeWifiHandler;
     }
@@ -207,11 +213,14 @@ int32_t KelvoAgent::initiate() {
     startHidlService();
     startLibrary();
     publishService();
-    startBatteryListener();
     // Listening before any operator registers for its entries.
     BufferedLogServer::getInstance()->start();
     initRoutines();
     initHandlers();
+    // The registrar's first report opens the battery handler's first span
+    // (a phone booted on the charger counts as charging from then on): the
+    // handlers listen before it can come.
+    startBatteryListener();
     return startDispatcher();
 }
 

@@ -41,6 +41,7 @@ enum class Health : uint32_t {
     AbnormalityInputRefused, // abnormality reports, records or rows refused or over their cap
     SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
     TrafficReadingsRefused,  // traffic lines skipped or refused, keys or lists over their cap
+    BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     Count
 };
 

@@ -21,6 +21,7 @@ const char* const kHealthNames[] = {
         "cpu_reports_late",          "cpu_entries_capped",      "cpu_counter_lines_ignored",
         "service_requests_refused",  "abnormality_input_refused", "system_readings_refused",
         "traffic_readings_refused",
+        "battery_readings_kept",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

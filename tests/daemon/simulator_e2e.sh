@@ -109,6 +109,24 @@ others=$(q "SELECT (SELECT COUNT(*) FROM raw_applications_gnss WHERE name NOT IN
 [ "$others" = 0 ] || fail "$others display, GNSS or flashlight rows for names the scenario never used"
 ambient=$(q "SELECT SUM(duration) FROM raw_ambient_light WHERE type = 0")
 [ "$ambient" = 3500 ] || fail "ambient light: $ambient ms stored, 3500 written"
+# The battery: the cable at the start opens a charging span, the hour has its
+# row, and the discharge measured over the spans is the model's within the
+# gauge's whole mAh (at most one lost per span).
+[ "$(q "SELECT COUNT(*) FROM raw_component_battery
+        WHERE charge_screen_on_duration + charge_screen_off_duration > 0")" -ge 1 ] ||
+    fail "no charging battery span"
+[ "$(q "SELECT COUNT(*) FROM hourly_component_battery")" -ge 1 ] || fail "no hourly battery row"
+# The registrar's first report, heard by the handler at the daemon's start,
+# opened a discharging span that the cable closed.
+[ "$(q "SELECT charge_screen_on_duration + charge_screen_off_duration FROM raw_component_battery
+        ORDER BY start_time LIMIT 1")" = 0 ] || fail "the battery's first report opened no span"
+read -r measured spans <<<"$(q "SELECT SUM(discharge_screen_on_gas_gauge +
+                                  discharge_screen_off_gas_gauge), COUNT(*)
+                                  FROM raw_component_battery" | tr '|' ' ')"
+drawn=$(sed -n 's/.*the load drew \([0-9.]*\) mAh.*/\1/p' "$work/report.txt")
+python3 -c "import sys; m, s, d = int(sys.argv[1]), int(sys.argv[2]), float(sys.argv[3]);
+assert abs(m - d) <= s + 1, (m, s, d)" "${measured:-0}" "${spans:-0}" "${drawn:-0}" ||
+    fail "battery: measured $measured mAh over $spans spans, the model drew $drawn mAh"
 
 python3 - "$root/data/log/zendrel/events.jsonl" <<'PY' || fail "hourly event"
 import json, sys

@@ -46,11 +46,13 @@ rc=$?
 elapsed=$(( ($(date +%s%N) - start) / 1000000 ))
 echo "exit status $rc after ${elapsed} ms"
 [ $rc -eq 0 ] || { echo "FAIL: exit status $rc"; cat "$log"; exit 1; }
-# A first start on an empty root raises no error line, but for the CPU
-# handler, which stands down on a root without CPU counters or kernel device,
-# and the Wi-Fi traffic baseline, which finds no network counters there.
+# A first start on an empty root raises no error line, but for the CPU and
+# battery handlers, which stand down on a root without CPU counters or kernel
+# device, or without a battery, and the Wi-Fi traffic baseline, which finds no
+# network counters there.
 errors=$(grep '^kelvod E ' "$log" | grep -v 'batteryproperties\|registerListener' |
          grep -v '\[CpuHandler.cpp\]\|disable module: 3\|CpuHandler exit\|CpuHandler is pending to exit' |
+         grep -v '\[BatteryHandler.cpp\]\|disable module: -1\|BatteryHandler exit\|BatteryHandler is pending to exit' |
          grep -v '\[TrafficReader.cpp\] openView# Failed to open /proc/net/\|\[TrafficCollector.cpp\] takeBaseline#' || true)
 [ -z "$errors" ] || { echo "FAIL: error lines on a first start:"; echo "$errors"; exit 1; }
 echo "PASS"

@@ -50,6 +50,9 @@ const Refusal kRefusals[] = {
     {"ambient without six durations", "at 5 ambient auto 1 2 3", "six ambient levels"},
     {"gnss of an unknown package", "at 5 gnss start com.other", "no app has the package"},
     {"torch user of a shared uid", "at 5 torch 2101", "app with one package"},
+    {"battery model without level", "battery-model 3000", "battery-model <capacity mAh>"},
+    {"battery model bad current", "battery-model 3000 50% idle -5", "battery-model <capacity mAh>"},
+    {"wakelock of no app", "at 5 held-wakelock com.other Tag 20:00", "no app has the package"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -63,6 +63,7 @@ public:
     // step is one of this model's (foreground, screen, brightness, ambient,
     // gnss, flashlight, torch).
     bool apply(const Scenario::Step& step, Record* record);
+    bool screenOn() const { return mScreenOn; }
     // Brings the truth up to the time (the end of the run).
     void advanceTo(int64_t ms);
 

@@ -16,6 +16,8 @@
 #include <sstream>
 
 #include "ComponentReport.h"
+#include "BatteryModel.h"
+#include "BatteryReport.h"
 #include "CpuTree.h"
 #include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
@@ -208,6 +210,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot write the traffic counters below " + root + ": " + strerror(errno);
         return false;
     }
+    mBattery.reset(new BatteryModel(root, mScenario.battery()));
+    if (!mBattery->writeFiles()) {
+        *error = "cannot lay out the battery files below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -231,6 +238,9 @@ bool DeviceSimulator::startServices(std::string* error) {
         processes.push_back(entry);
     }
     state->setProcesses(processes);
+    PlatformState::Battery battery = state->battery();
+    battery.level = mBattery->level();
+    state->setBattery(battery);
     android::ProcessState::self()->startThreadPool();
     if (mServices->startAll() != android::NO_ERROR) {
         *error = "cannot register the platform services below " + mOptions.root;
@@ -274,7 +284,7 @@ bool DeviceSimulator::startDaemon(std::string* error) {
 bool DeviceSimulator::waitDaemonReady(std::string* error) {
     // Ready once the buffered log socket is there and the daemon's battery
     // listener has registered: the routines and handlers are initialised
-    // right after that step of the start-up, in a moment.
+    // before that step of the start-up, the dispatcher a moment after.
     std::string socket = RootPath::resolve("/dev/socket/") + BufferedLogClient::kSocketName;
     int64_t deadline = monotonicMs() + kReadyTimeoutMs;
     while (monotonicMs() < deadline) {
@@ -334,6 +344,7 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
         case Scenario::Action::Load: {
             std::lock_guard<std::mutex> lock(mLock);
             mModel.setLoad(step.pid, step.cluster, step.percent, step.frequency);
+            mBattery->setLoad(step.pid, step.cluster, step.percent);
             return;
         }
         case Scenario::Action::Charger: {
@@ -341,7 +352,8 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             battery.acOnline = step.text == "ac";
             battery.usbOnline = step.text == "usb";
             battery.wirelessOnline = step.text == "wireless";
-            mServices->state()->setBattery(battery);
+            mBattery->setCharger(step.text != "off");
+            pushBattery(battery);
             return;
         }
         case Scenario::Action::System:
@@ -365,11 +377,19 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             return;
         }
         case Scenario::Action::Battery: {
-            PlatformState::Battery battery = mServices->state()->battery();
-            battery.level = step.value;
-            mServices->state()->setBattery(battery);
+            mBattery->setLevel(step.value);
+            pushBattery(mServices->state()->battery());
             return;
         }
+        case Scenario::Action::HeldWakelock:
+            // What the power-management application writes when it finds
+            // a wakelock held too long.
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, "KELVO_TAG_PM_POWER_CONTROL",
+                                       ("type=21 package=" + step.text + " reason=" + step.tag +
+                                        "#held count=" + std::to_string(step.value))
+                                           .c_str(),
+                                       t);
+            break;
         default: {
             // Display, GNSS and flashlight: a log-device record each.
             ComponentTruth::Record record;
@@ -378,6 +398,7 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
                 if (!mComponents->apply(step, &record)) {
                     return;
                 }
+                mBattery->setScreen(mComponents->screenOn());
             }
             result = mLogWriter->write(LogWriter::PRIORITY_INFO, record.tag.c_str(),
                                        record.text.c_str(), t);
@@ -391,13 +412,32 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
     }
 }
 
-void DeviceSimulator::advanceTo(int64_t ms) {
-    std::lock_guard<std::mutex> lock(mLock);
-    mModel.advance(ms - mModelMs);
-    if (mSystem) {
-        mSystem->advance(ms - mModelMs);
+void DeviceSimulator::pushBattery(PlatformState::Battery battery) {
+    // The daemon reads the gauge when it hears of the change: the files
+    // hold the new state first.
+    if (!mBattery->writeFiles()) {
+        fprintf(stderr, "kelvo-sim: cannot rewrite the battery files: %s\n", strerror(errno));
     }
-    mModelMs = ms;
+    battery.level = mBattery->level();
+    mServices->state()->setBattery(battery);
+}
+
+void DeviceSimulator::advanceTo(int64_t ms) {
+    bool levelChanged = false;
+    {
+        std::lock_guard<std::mutex> lock(mLock);
+        mModel.advance(ms - mModelMs);
+        if (mSystem) {
+            mSystem->advance(ms - mModelMs);
+        }
+        levelChanged = mBattery->advance(ms - mModelMs);
+        mModelMs = ms;
+    }
+    if (levelChanged) {
+        pushBattery(mServices->state()->battery());
+    } else if (!mBattery->writeFiles()) {
+        fprintf(stderr, "kelvo-sim: cannot rewrite the battery files: %s\n", strerror(errno));
+    }
 }
 
 int32_t DeviceSimulator::hourlyRoundsFinished() const {
@@ -566,6 +606,15 @@ int DeviceSimulator::finish(bool completed) {
         componentTable = componentReport.table();
     }
     report.addSection(components);
+    BatteryReport::Model battery;
+    battery.capacityMah = mScenario.battery().capacityMah;
+    battery.startLevel = mScenario.battery().startLevel;
+    battery.endLevel = mBattery ? mBattery->level() : battery.startLevel;
+    battery.drawnMah = mBattery ? mBattery->drawnMah() : 0;
+    battery.chargedMah = mBattery ? mBattery->chargedMah() : 0;
+    report.addSection(BatteryReport(SimReport::databasePath(mOptions.root),
+                                    SimReport::eventsPath(mOptions.root), battery)
+                          .build());
     std::string text;
     bool readable = report.build(&text);
     fputs("\n", stdout);

@@ -11,12 +11,14 @@
 #include "ComponentTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
+#include "PlatformState.h"
 #include "Scenario.h"
 #include "SystemScene.h"
 #include "TrafficModel.h"
 
 namespace kelvo {
 
+class BatteryModel;
 class CpuTree;
 class LogWriter;
 class PlatformServices;
@@ -67,6 +69,8 @@ private:
     void apply(const Scenario::Step& step);
     void advanceTo(int64_t ms);
     void writeCounters();
+    // Writes the battery files, then has the registrar push the state.
+    void pushBattery(PlatformState::Battery battery);
     // The per-process report of one request (the bytes after the echoed
     // time and mode).
     std::string answerCpuRequest();
@@ -98,6 +102,7 @@ private:
     // driver thread reads the panel's advanced brightness).
     std::unique_ptr<ComponentTruth> mComponents;
     std::unique_ptr<TrafficModel> mTraffic;
+    std::unique_ptr<BatteryModel> mBattery;  // the play thread's
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -276,6 +276,9 @@ bool Scenario::parseLine(const std::vector<std::string>& words, std::string* rea
         mProcesses.push_back(process);
         return true;
     }
+    if (verb == "battery-model") {
+        return BatteryModel::parse(words, &mBattery, reason);
+    }
     *reason = "unknown verb \"" + verb + "\"";
     return false;
 }
@@ -328,6 +331,18 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
             *reason = "expected \"at <time> battery <level 0..100>%\"";
             return false;
         }
+    } else if (verb == "held-wakelock") {
+        step.action = Action::HeldWakelock;
+        int64_t heldMs = 0;
+        if (words.size() != 4 || !isName(words[1]) || !isName(words[2]) ||
+            !parseOffset(words[3], &heldMs) ||
+            heldMs < 1 || heldMs > 0x7FFFFFFF) {
+            *reason = "expected \"at <time> held-wakelock <package> <tag> <time held>\"";
+            return false;
+        }
+        step.text = words[1];
+        step.tag = words[2];
+        step.value = static_cast<int32_t>(heldMs);
     } else if (verb == "traffic" || verb == "systraffic") {
         if (!TrafficModel::parseStep(words, &step, reason)) {
             return false;
@@ -456,7 +471,8 @@ bool Scenario::check(std::string* reason, int32_t* line) {
                 return false;
             }
         }
-        if (step.action == Action::Foreground || step.action == Action::Gnss) {
+        if (step.action == Action::Foreground || step.action == Action::Gnss ||
+            step.action == Action::HeldWakelock) {
             bool known = step.action == Action::Foreground && step.text == "screen_off";
             for (const App& app : mApps) {
                 known = known || std::find(app.packages.begin(), app.packages.end(), step.text) !=

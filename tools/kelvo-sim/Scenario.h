@@ -6,6 +6,8 @@
 #include <string>
 #include <vector>
 
+#include "BatteryModel.h"
+
 namespace kelvo {
 namespace sim {
 
@@ -47,6 +49,7 @@ public:
         Traffic,        // pid: uid, text: interface, value: counter set, counters
         SystemTraffic,  // pid, text: interface, counters
         Wifi,           // value: record kind, pid: its number (WifiRecords)
+        HeldWakelock,   // text: package, tag: the wakelock, value: ms held
     };
 
     struct Step {
@@ -62,6 +65,7 @@ public:
         std::string text;
         std::vector<int32_t> values;
         int64_t counters[4] = {};  // traffic: rx bytes, tx bytes, rx packets, tx packets
+        std::string tag;
     };
 
     // Reads a scenario file; false with "<file>:<line>: <reason>" in error.
@@ -77,6 +81,8 @@ public:
     int32_t tickMs() const { return mTickMs; }
     const std::vector<App>& apps() const { return mApps; }
     const std::vector<Process>& processes() const { return mProcesses; }
+    // The battery (the defaults without a "battery-model" line).
+    const BatteryModel::Config& battery() const { return mBattery; }
     // In time order (lines of equal time keep their order).
     const std::vector<Step>& steps() const { return mSteps; }
 
@@ -103,6 +109,7 @@ private:
     std::vector<App> mApps;
     std::vector<Process> mProcesses;
     std::vector<Step> mSteps;
+    BatteryModel::Config mBattery;
 };
 
 }  // namespace sim
