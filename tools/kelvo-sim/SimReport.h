@@ -40,8 +40,6 @@ public:
     void addSection(const std::string& text) { mSections.push_back(text); }
     // name \t uid \t truth ms \t attributed ms, one line per application.
     std::string truthTable() const;
-    // A section of another part of the device, printed before the files.
-    void addSection(const std::string& text) { mSections.push_back(text); }
 
     static std::string databasePath(const std::string& root);
     static std::string eventsPath(const std::string& root);
