@@ -2,6 +2,7 @@
 
 #include <time.h>
 
+#include <atomic>
 #include <cinttypes>
 #include <cstdio>
 
@@ -32,7 +33,13 @@ inline int64_t floorModShifted(int64_t a, int64_t offset, int64_t b) {
     return floorMod(floorMod(a, b) + floorMod(offset, b), b);
 }
 
+std::atomic<TimeProvider::MonotonicSource> gMonotonicSource{nullptr};
+
 } // namespace
+
+void TimeProvider::setMonotonicSource(MonotonicSource source) {
+    gMonotonicSource.store(source, std::memory_order_release);
+}
 
 int64_t TimeProvider::getCurrentTime(int type) {
     struct timespec ts = {};
@@ -41,6 +48,9 @@ int64_t TimeProvider::getCurrentTime(int type) {
             WallClock::getTime(&ts);
             break;
         case TIME_TYPE_MONOTONIC:
+            if (MonotonicSource source = gMonotonicSource.load(std::memory_order_acquire)) {
+                return source();
+            }
             clock_gettime(CLOCK_MONOTONIC, &ts);
             break;
         default:

@@ -20,6 +20,11 @@ class TimeProvider {
 public:
     // Milliseconds of the chosen clock; -3 for an unknown type.
     static int64_t getCurrentTime(int type);
+    // Where TIME_TYPE_MONOTONIC reads its milliseconds; null for the clock.
+    using MonotonicSource = int64_t (*)();
+    // Replaces the monotonic clock so that spans measured on it can be
+    // driven by a test; null gives the clock back.
+    static void setMonotonicSource(MonotonicSource source);
     static int getHour(int64_t ms, bool local);
 
     TimeProvider();
