@@ -15,6 +15,7 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "handlers/components/AudioHandler.h"
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
@@ -58,6 +59,10 @@ android::sp<KelvoOperator> makeFlashlightHandler() {
     return new FlashlightHandler();
 }
 
+android::sp<KelvoOperator> makeAudioHandler() {
+    return new AudioHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -80,6 +85,7 @@ struct Factories {
         handlers[HANDLER_GNSS] = &makeGnssHandler;
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
+        handlers[HANDLER_AUDIO] = &makeAudioHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
     }
 
