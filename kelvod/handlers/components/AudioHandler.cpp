@@ -60,9 +60,9 @@ const column_attribute kDeviceColumns[] = {
     {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "stream"}, {COLUMN_INT, "device"}};
 const column_attribute kVolumeColumns[] = {
     {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "stream"}, {COLUMN_INT, "volume"}};
-const column_attribute kSessionColumns[] = {
-    {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "session"}, {COLUMN_TEXT, "name"},
-    {COLUMN_INT, "uid"},        {COLUMN_INT, "pid"},     {COLUMN_INT, "state"}};
+const column_attribute kSessionColumns[] = {{COLUMN_TIME, "timestamp"}, {COLUMN_INT, "session"},
+                                            {COLUMN_TEXT, "name"},      {COLUMN_INT, "uid"},
+                                            {COLUMN_INT, "pid"},        {COLUMN_INT, "state"}};
 const column_attribute kPlayColumns[] = {{COLUMN_TIME, "timestamp"},
                                          {COLUMN_INT, "session"},
                                          {COLUMN_INT, "stream"},
@@ -82,8 +82,8 @@ const table_attribute kSessionTable = {"1.0", 1, 6, kSessionColumns, "raw_audio_
 const table_attribute kPlayTable = {"1.0", 1, 4, kPlayColumns, "raw_audio_session_play"};
 const table_attribute kHeadsetTable = {"1.1", 1, 4, kHeadsetColumns, "raw_audio_headset"};
 const table_attribute kSmartPaTable = {"1.1", 1, 4, kSmartPaColumns, "raw_audio_smartpa_value"};
-const table_attribute* const kOwnTables[] = {&kDeviceTable,  &kVolumeTable,  &kSessionTable,
-                                             &kPlayTable,    &kHeadsetTable, &kSmartPaTable};
+const table_attribute* const kOwnTables[] = {&kDeviceTable, &kVolumeTable,  &kSessionTable,
+                                             &kPlayTable,   &kHeadsetTable, &kSmartPaTable};
 
 const component_family kFamily = {
     "audio",
@@ -193,13 +193,20 @@ void AudioHandler::cleanTables(int64_t time) {
 
 void AudioHandler::setupListeners(Parcel& out) {
     static const int32_t kNotifications[] = {
-        NOTIFICATION_DATA_POLLING,         NOTIFICATION_DAWN_UPLOADING,
-        NOTIFICATION_DAILY_UPLOADING,      NOTIFICATION_HOURLY_UPLOADING,
-        NOTIFICATION_APPLICATIONS_ACCOUNTING, NOTIFICATION_COMPONENT_ACCOUNTING,
-        NOTIFICATION_SCREEN_STATE_CHANGED, NOTIFICATION_FOREGROUND_CHANGED,
-        NOTIFICATION_CHARGER_ONLINE_CHANGED, NOTIFICATION_ABNORMALITY_THERMAL,
-        NOTIFICATION_FORCE_BALANCE,        NOTIFICATION_VM_DIED,
-        NOTIFICATION_DAILY_TICK,           NOTIFICATION_PHONE_STATE_CHANGED,
+        NOTIFICATION_DATA_POLLING,
+        NOTIFICATION_DAWN_UPLOADING,
+        NOTIFICATION_DAILY_UPLOADING,
+        NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING,
+        NOTIFICATION_SCREEN_STATE_CHANGED,
+        NOTIFICATION_FOREGROUND_CHANGED,
+        NOTIFICATION_CHARGER_ONLINE_CHANGED,
+        NOTIFICATION_ABNORMALITY_THERMAL,
+        NOTIFICATION_FORCE_BALANCE,
+        NOTIFICATION_VM_DIED,
+        NOTIFICATION_DAILY_TICK,
+        NOTIFICATION_PHONE_STATE_CHANGED,
     };
     for (int32_t type : kNotifications) {
         addNotifierListener(type, out);
@@ -285,8 +292,7 @@ int32_t AudioHandler::handleDevice(int64_t time, const char* text) {
     if (mStreams[stream].device == device) {
         return 0;
     }
-    KLOGD("timestamp: %lld, device: %u, stream: %d", static_cast<long long>(time), device,
-          stream);
+    KLOGD("timestamp: %lld, device: %u, stream: %d", static_cast<long long>(time), device, stream);
     mStreams[stream].device = device;
     Parcel row;
     row.writeInt64(time);
@@ -348,7 +354,7 @@ int32_t AudioHandler::handleAcquire(int64_t time, const char* text) {
     }
     String8 name;
     if (PackageProperty::getInstance()->queryPackageByUidAndPid(uid, pid, name) < 0 ||
-        name.empty()) {
+        name.isEmpty()) {
         KLOGE("Failed to get package name by uid and pid: %d, %d", uid, pid);
         return refuse(-2);
     }
@@ -367,8 +373,7 @@ int32_t AudioHandler::handleAcquire(int64_t time, const char* text) {
         if (session.reference >= 1) {
             // The framework reuses ids: a playing session stays with whoever
             // started it.
-            KLOGI("Session %d playing for %s kept from %s", id, session.name.c_str(),
-                  name.c_str());
+            KLOGI("Session %d playing for %s kept from %s", id, session.name.c_str(), name.c_str());
             return 0;
         }
         session.uid = uid;
@@ -477,8 +482,8 @@ int32_t AudioHandler::startSession(int64_t time, int32_t id, int32_t stream) {
     session_data& session = it->second;
     if (session.reference >= 1) {
         ++session.reference;
-        KLOGD("session already started reference: %d, session: %d, stream: %d",
-              session.reference, id, stream);
+        KLOGD("session already started reference: %d, session: %d, stream: %d", session.reference,
+              id, stream);
         return 0;
     }
     // The time before the start is booked with the sessions playing then.
@@ -544,13 +549,14 @@ bool AudioHandler::checkReferences(int64_t time, uint32_t from) {
     if (consistent) {
         return true;
     }
-    KLOGE("Timestamp: %lld, Device: %u, Component: %d, %lld, %lld, Speaker: %d, %lld, %lld, "
-          "Receiver: %d, %lld, %lld",
-          static_cast<long long>(time), from, mComponent.count,
-          static_cast<long long>(mComponent.start), static_cast<long long>(mComponentEnd),
-          mSpeaker.count, static_cast<long long>(mSpeaker.start),
-          static_cast<long long>(mSpeaker.usage), mReceiver.count,
-          static_cast<long long>(mReceiver.start), static_cast<long long>(mReceiver.usage));
+    KLOGE(
+        "Timestamp: %lld, Device: %u, Component: %d, %lld, %lld, Speaker: %d, %lld, %lld, "
+        "Receiver: %d, %lld, %lld",
+        static_cast<long long>(time), from, mComponent.count,
+        static_cast<long long>(mComponent.start), static_cast<long long>(mComponentEnd),
+        mSpeaker.count, static_cast<long long>(mSpeaker.start),
+        static_cast<long long>(mSpeaker.usage), mReceiver.count,
+        static_cast<long long>(mReceiver.start), static_cast<long long>(mReceiver.usage));
     // What was counted so far is kept up to now; the counts start over.
     updateComponentUsage(time);
     if (mComponent.count > 0) {
@@ -614,7 +620,7 @@ bool AudioHandler::isForeground() const {
     }
     for (const auto& entry : mSessions) {
         const session_data& s = entry.second;
-        if (s.reference < 1 || s.name.empty()) {
+        if (s.reference < 1 || s.name.isEmpty()) {
             continue;
         }
         const std::string name(s.name.c_str());
@@ -641,12 +647,12 @@ void AudioHandler::updateComponentUsage(int64_t time) {
         mComponentDurations[mScreenOn ? 2 : 3] += usage;
         mComponentDurations[foreground ? 0 : 1] += usage;
     }
-    KLOGD("Timestamp: %lld, Usage: %lld, Charge: fore(%d), back(%d), Discharge: scron(%d) "
-          "scroff(%d) fore(%d) back(%d)",
-          static_cast<long long>(time), static_cast<long long>(usage),
-          mChargerOnline && foreground, mChargerOnline && !foreground,
-          !mChargerOnline && mScreenOn, !mChargerOnline && !mScreenOn,
-          !mChargerOnline && foreground, !mChargerOnline && !foreground);
+    KLOGD(
+        "Timestamp: %lld, Usage: %lld, Charge: fore(%d), back(%d), Discharge: scron(%d) "
+        "scroff(%d) fore(%d) back(%d)",
+        static_cast<long long>(time), static_cast<long long>(usage), mChargerOnline && foreground,
+        mChargerOnline && !foreground, !mChargerOnline && mScreenOn, !mChargerOnline && !mScreenOn,
+        !mChargerOnline && foreground, !mChargerOnline && !foreground);
 }
 
 void AudioHandler::changeOutput(int64_t time, int32_t id, const String8& name, int32_t stream,
@@ -684,14 +690,13 @@ void AudioHandler::updateActiveStreams(int64_t time, int32_t stream) {
     if (mPhoneState != 0 && stream == mInCallStream) {
         KLOGD("phonestate: %d, stream: %d, device: %u, needpower: %d", mPhoneState, stream,
               data.device, needsPower(data.device));
-        changeOutput(time, kCallSession, String8(kCallPackage), stream, mPhoneDevice,
-                     data.device, BLUETOOTH_PHONE);
+        changeOutput(time, kCallSession, String8(kCallPackage), stream, mPhoneDevice, data.device,
+                     BLUETOOTH_PHONE);
         mPhoneDevice = data.device;
     }
 }
 
-int32_t AudioHandler::sendSessionValue(int64_t time, int32_t id, uint32_t device,
-                                       int32_t volume) {
+int32_t AudioHandler::sendSessionValue(int64_t time, int32_t id, uint32_t device, int32_t volume) {
     Parcel action;
     action.writeInt32(mAccounterType);
     action.writeInt32(ACTION_SET_VALUE);
@@ -719,8 +724,8 @@ void AudioHandler::notifyBluetooth(int32_t notice, int64_t time, const String8& 
     body.writeInt64(time);
     body.writeString8(name);
     body.writeBool(on);
-    int32_t ret = KelvoAgent::getInstance()->sendToHandler(HANDLER_BLUETOOTH, notice, body,
-                                                           nullptr, false);
+    int32_t ret =
+        KelvoAgent::getInstance()->sendToHandler(HANDLER_BLUETOOTH, notice, body, nullptr, false);
     if (ret < 0) {
         KLOGI("Bluetooth handler not told (%d): %s %d", ret, name.c_str(), on ? 1 : 0);
     }
@@ -804,7 +809,7 @@ int32_t AudioHandler::readSmartPa(int64_t time, int32_t stream) {
         std::min(std::max<int64_t>(mLastPaRead >= 0 ? now - mLastPaRead : now, 1), kMaxPaSpanMs);
     mLastPaRead = now;
     String8 answer = android::AudioSystem::getParameters(String8(kSmartPaKey));
-    if (answer.empty()) {
+    if (answer.isEmpty()) {
         KLOGI("Empty string got from smartpa");
         return -2;
     }
@@ -823,8 +828,8 @@ int32_t AudioHandler::readSmartPa(int64_t time, int32_t stream) {
     KLOGD("PA raw data: %s, speaker: %lld, receiver: %lld", answer.c_str(), speaker, receiver);
     if (speaker / span > kMaxSpeakerPerMs || receiver / span > kMaxReceiverPerMs) {
         HealthCounters::add(Health::DeviceAnswersRefused);
-        KLOGE("Invalid PA value: speaker(%lld), receiver(%lld), deltaTime(%lld)", speaker,
-              receiver, static_cast<long long>(span));
+        KLOGE("Invalid PA value: speaker(%lld), receiver(%lld), deltaTime(%lld)", speaker, receiver,
+              static_cast<long long>(span));
         return -9;
     }
     const int32_t volume = validStream(stream) ? mStreams[stream].volume : 1;
@@ -924,8 +929,8 @@ void AudioHandler::flushCachedAccounts(int64_t time) {
             closeSpan(mReceiver, time);
         }
         readSmartPa(time, 3);
-        const int64_t measured = addSaturated(
-            addSaturated(mBaseEnergy, mSpeakerEnergy), mReceiverEnergy);
+        const int64_t measured =
+            addSaturated(addSaturated(mBaseEnergy, mSpeakerEnergy), mReceiverEnergy);
         if (measured >= 1) {
             scale = rescale(measured, 1024 * 1024) / mCachedTotal;
             KLOGD("scale: %lld", static_cast<long long>(scale));
@@ -1113,12 +1118,10 @@ void AudioHandler::dump(String8& out) {
                      static_cast<long long>(mComponentDurations[5]));
     out.appendFormat("mSpeakerValue=%lld mReceiverValue=%lld mBaseEnergy=%lld\n",
                      static_cast<long long>(mSpeakerEnergy),
-                     static_cast<long long>(mReceiverEnergy),
-                     static_cast<long long>(mBaseEnergy));
+                     static_cast<long long>(mReceiverEnergy), static_cast<long long>(mBaseEnergy));
     out.appendFormat("mSpeaker={%d, %lld, %lld} mReceiver={%d, %lld, %lld}\n", mSpeaker.count,
-                     static_cast<long long>(mSpeaker.start),
-                     static_cast<long long>(mSpeaker.usage), mReceiver.count,
-                     static_cast<long long>(mReceiver.start),
+                     static_cast<long long>(mSpeaker.start), static_cast<long long>(mSpeaker.usage),
+                     mReceiver.count, static_cast<long long>(mReceiver.start),
                      static_cast<long long>(mReceiver.usage));
     out.appendFormat("mSessionData.size()=%zu\n", mSessions.size());
     out.appendFormat("mCachedAccounts.size()=%zu\n", mCachedAccounts.size());
