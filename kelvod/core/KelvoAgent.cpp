@@ -15,10 +15,12 @@
 #include "core/BufferedLogServer.h"
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
+#include "handlers/components/BluetoothHandler.h"
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/components/SensorHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -58,6 +60,14 @@ android::sp<KelvoOperator> makeFlashlightHandler() {
     return new FlashlightHandler();
 }
 
+android::sp<KelvoOperator> makeBluetoothHandler() {
+    return new BluetoothHandler();
+}
+
+android::sp<KelvoOperator> makeSensorHandler() {
+    return new SensorHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -81,6 +91,8 @@ struct Factories {
         handlers[HANDLER_FLASHLIGHT] = &makeFlashlightHandler;
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
+        handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
+        handlers[HANDLER_SENSOR] = &makeSensorHandler;
     }
 
     std::mutex lock;

@@ -20,6 +20,7 @@ const char* const kHealthNames[] = {
         "accounter_state_capped",    "routine_requests_refused", "cpu_reports_refused",
         "cpu_reports_late",          "cpu_entries_capped",      "cpu_counter_lines_ignored",
         "service_requests_refused",  "abnormality_input_refused", "system_readings_refused",
+        "handler_state_capped",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

@@ -3,6 +3,8 @@
 #include <stdint.h>
 #include <utils/String8.h>
 
+#include <map>
+
 #include "handlers/components/TypedComponentHandler.h"
 
 namespace kelvo {
