@@ -16,10 +16,12 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/AudioHandler.h"
+#include "handlers/components/BluetoothHandler.h"
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/components/SensorHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -63,6 +65,14 @@ android::sp<KelvoOperator> makeAudioHandler() {
     return new AudioHandler();
 }
 
+android::sp<KelvoOperator> makeBluetoothHandler() {
+    return new BluetoothHandler();
+}
+
+android::sp<KelvoOperator> makeSensorHandler() {
+    return new SensorHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -87,6 +97,8 @@ struct Factories {
         handlers[HANDLER_DISPLAY] = &makeDisplayHandler;
         handlers[HANDLER_AUDIO] = &makeAudioHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
+        handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
+        handlers[HANDLER_SENSOR] = &makeSensorHandler;
     }
 
     std::mutex lock;

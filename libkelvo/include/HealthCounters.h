@@ -40,7 +40,7 @@ enum class Health : uint32_t {
     ServiceRequestsRefused,  // binder requests refused or cut (caller, path, push message, query, reply size)
     AbnormalityInputRefused, // abnormality reports, records or rows refused or over their cap
     SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
-    HandlerStateCapped,      // component handler state grown from log text cut at its cap
+    HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
     Count
 };
 

@@ -8,7 +8,6 @@
 
 #include <atomic>
 #include <memory>
-#include <mutex>
 #include <string>
 #include <vector>
 
@@ -21,6 +20,7 @@
 #include "core/Notifier.h"
 #include "handlers/SystemHandler.h"
 #include "handlers/components/AudioHandler.h"
+#include "handlers/components/BluetoothHandler.h"
 #include "kelvo/WallClock.h"
 #include "kelvod/storage/StorageTestUtil.h"
 #include "routines/HourlyRoutine.h"
@@ -52,9 +52,8 @@ const column_attribute kMiscColumns[] = {
     {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, {COLUMN_TEXT, "value"}};
 const table_attribute kMiscTable = {"1.0", 1, 3, kMiscColumns, "daily_misc_data"};
 
-// Stands for the Bluetooth handler (records the notices), the system
-// handler (stores daily records) and the polling routine (turns the hourly
-// tick into the hour's data poll).
+// Stands for the system handler (stores daily records) and the polling
+// routine (turns the hourly tick into the hour's data poll).
 class Peer : public KelvoOperator {
 public:
     Peer() : KelvoOperator("AudioPeer", -1, 0) {}
@@ -71,27 +70,9 @@ public:
         return sendNotification(NOTIFICATION_DATA_POLLING, body);
     }
     int32_t handleCustomized(int32_t code, const Parcel& data, Parcel*) override {
-        if (code == SystemHandler::MESSAGE_MISC_DATA) {
-            return insertEntries(kMiscTable, data, 1, false);
-        }
-        if (code != AudioHandler::BLUETOOTH_MEDIA && code != AudioHandler::BLUETOOTH_PHONE) {
-            return 0;  // the system handler's error rows
-        }
-        int64_t time = data.readInt64();
-        String8 name = data.readString8();
-        std::lock_guard<std::mutex> guard(mLock);
-        mNotices.push_back(std::to_string(code) + "|" + std::to_string(time - kT) + "|" +
-                           name.c_str() + "|" + (data.readBool() ? "on" : "off"));
-        return 0;
+        return code == SystemHandler::MESSAGE_MISC_DATA ? insertEntries(kMiscTable, data, 1, false)
+                                                        : 0;
     }
-    std::vector<std::string> notices() {
-        std::lock_guard<std::mutex> guard(mLock);
-        return mNotices;
-    }
-
-private:
-    std::mutex mLock;
-    std::vector<std::string> mNotices;
 };
 
 class AudioHandlerTest : public test::AgentStorageTest {
@@ -121,8 +102,10 @@ protected:
         mRoutine = new HourlyRoutine();
         mPeer = new Peer();
         mAudio = new AudioHandler();
+        mBluetooth = new BluetoothHandler();
         for (StorageOperator* op : {static_cast<StorageOperator*>(mRoutine.get()),
                                     static_cast<StorageOperator*>(mAudio.get()),
+                                    static_cast<StorageOperator*>(mBluetooth.get()),
                                     static_cast<StorageOperator*>(AppsAccounting::getInstance()),
                                     static_cast<StorageOperator*>(DataUploader::getInstance())}) {
             op->addSchemaTable();
@@ -134,11 +117,11 @@ protected:
         mRoutine->earlyInitialize();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
         mRoutine->initialize();
-        for (int32_t id : {HANDLER_BLUETOOTH, HANDLER_SYSTEM}) {
-            KelvoAgent::getInstance()->setHandlerForTest(id, mPeer);
-        }
-        for (KelvoOperator* op : {static_cast<KelvoOperator*>(mPeer.get()),
-                                  static_cast<KelvoOperator*>(mAudio.get())}) {
+        KelvoAgent::getInstance()->setHandlerForTest(HANDLER_SYSTEM, mPeer);
+        KelvoAgent::getInstance()->setHandlerForTest(HANDLER_BLUETOOTH, mBluetooth);
+        for (KelvoOperator* op :
+             {static_cast<KelvoOperator*>(mPeer.get()), static_cast<KelvoOperator*>(mAudio.get()),
+              static_cast<KelvoOperator*>(mBluetooth.get())}) {
             ASSERT_EQ(0, op->earlyInitialize());
             op->initialize();
         }
@@ -147,8 +130,8 @@ protected:
         for (int32_t id : {HANDLER_BLUETOOTH, HANDLER_SYSTEM}) {
             KelvoAgent::getInstance()->setHandlerForTest(id, nullptr);
         }
-        for (const sp<KelvoOperator>& op :
-             std::vector<sp<KelvoOperator>>{mRoutine.get(), mPeer.get(), mAudio.get()}) {
+        for (const sp<KelvoOperator>& op : std::vector<sp<KelvoOperator>>{
+                 mRoutine.get(), mPeer.get(), mAudio.get(), mBluetooth.get()}) {
             op->readyToDestroy();
             op->requestThreadExit();
             op->join();
@@ -202,6 +185,14 @@ protected:
         std::string text(out.c_str());
         return text.substr(0, text.find("======AudioHandler END"));
     }
+    // The Bluetooth handler's rows of the notices: time from kT, name,
+    // activity, state; once n of them are there.
+    std::vector<std::string> bluetooth(size_t n) {
+        const std::string sql = "SELECT timestamp - " + std::to_string(kT) +
+                                ", name, type, state FROM raw_bluetooth_state ORDER BY rowid";
+        waitFor([&] { return rows(sql).size() >= n; });
+        return rows(sql);
+    }
     Json::Value upload(uint32_t event) {
         Json::Value params;
         for (const Json::Value& e : events()) {
@@ -213,6 +204,7 @@ protected:
     sp<HourlyRoutine> mRoutine;
     sp<Peer> mPeer;
     sp<AudioHandler> mAudio;
+    sp<BluetoothHandler> mBluetooth;
     std::unique_ptr<PlatformServices> mServices;
 };
 
@@ -244,10 +236,10 @@ TEST_F(AudioHandlerTest, PlayTimeThroughTheHourAndBluetoothNotices) {
     for (int32_t state : {1, 2, 0}) ASSERT_EQ(0, phone(700000, state));
     ASSERT_EQ(0, log(T::TAG_AUDIO_DEVICE, 800000, "stream=0 device=32"));
     for (int32_t state : {2, 0}) ASSERT_EQ(0, phone(900000, state));
-    EXPECT_EQ((std::vector<std::string>{"0|300000|com.b|on", "0|400000|com.b|off",
-                                        "1|900000|com.android.incallui|on",
-                                        "1|900000|com.android.incallui|off"}),
-              mPeer->notices());
+    EXPECT_EQ((std::vector<std::string>{"300000|com.b|3|1", "400000|com.b|3|0",
+                                        "900000|com.android.incallui|4|1",
+                                        "900000|com.android.incallui|4|0"}),
+              bluetooth(4));
     tick(kH);
 
     const std::string t = std::to_string(kT);
@@ -375,7 +367,7 @@ TEST_F(AudioHandlerTest, SessionCapStopsEveryPlayingSession) {
     ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_START, 0, "session=102 stream=1"));
     ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_ACQUIRE, 60000, "session=9 pid=502 uid=10020"));
     EXPECT_EQ(capped + 1, HealthCounters::get(Health::HandlerStateCapped));
-    EXPECT_EQ((std::vector<std::string>{"0|0|com.a|on", "0|60000|com.a|off"}), mPeer->notices());
+    EXPECT_EQ((std::vector<std::string>{"0|com.a|3|1", "60000|com.a|3|0"}), bluetooth(2));
     const std::string state = dump();
     EXPECT_NE(std::string::npos, state.find("mComponentData.reference=0\n")) << state;
     EXPECT_NE(std::string::npos, state.find("mSessionData.size()=1\n")) << state;
