@@ -254,8 +254,9 @@ TEST_F(AudioHandlerTest, PlayTimeThroughTheHourAndBluetoothNotices) {
     EXPECT_EQ(std::vector<std::string>{t + "|" + std::to_string(kT + 700000) + "|600000|54900"},
               rows("SELECT start_time, end_time, screen_on_duration, background_energy "
                    "FROM raw_component_audio"));
+    // com.b's 100 s on the headset are the Bluetooth handler's (code 2).
     EXPECT_EQ(
-        (std::vector<std::string>{"com.a|0|36600", "com.b|0|18300"}),
+        (std::vector<std::string>{"com.a|0|36600", "com.b|0|18300", "com.b|2|800"}),
         rows("SELECT name, component, background_energy FROM "
              "hourly_applications_accounting WHERE name IN ('com.a', 'com.b') ORDER BY name"));
     EXPECT_EQ(std::vector<std::string>{"54900"},
