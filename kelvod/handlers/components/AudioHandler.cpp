@@ -392,6 +392,8 @@ int32_t AudioHandler::handleAcquire(int64_t time, const char* text) {
             }
         }
         flushCachedAccounts(time);
+        // The next rows start where these end.
+        mLastPollingTime = time;
         mSessions.clear();
     }
     mSessions[id] = {uid, pid, kIdleStream, 0, 0, name};
