@@ -80,8 +80,8 @@ void BM_AudioSessionMessage(benchmark::State& state) {
                               " uid=" + std::to_string(10100 + s % 16)) < 0;
         if (s % 2 == 1) {
             failed |= message(handler, AudioHandler::TAG_AUDIO_SESSION_START, time,
-                              "session=" + std::to_string(1000 + s) + " stream=" +
-                                  std::to_string(s % 12)) < 0;
+                              "session=" + std::to_string(1000 + s) +
+                                  " stream=" + std::to_string(s % 12)) < 0;
         }
     }
 

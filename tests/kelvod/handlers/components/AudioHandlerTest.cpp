@@ -243,6 +243,9 @@ TEST_F(AudioHandlerTest, PlayTimeThroughTheHourAndBluetoothNotices) {
     tick(kH);
 
     const std::string t = std::to_string(kT);
+    EXPECT_EQ((std::vector<std::string>{"0|10|com.a|10010|501|1", "600000|10|NULL|-1|501|0"}),
+              rows("SELECT timestamp - " + t +
+                   ", session, name, uid, pid, state FROM raw_audio_session WHERE session = 10"));
     EXPECT_EQ((std::vector<std::string>{t + "|3|1", t + "|3|3"}),
               rows("SELECT timestamp, stream, device FROM raw_audio_device WHERE stream = 3"));
     EXPECT_EQ((std::vector<std::string>{"com.a|600000|36600|600000|36600",
@@ -325,10 +328,16 @@ TEST_F(AudioSmartPaTest, MeasuredEnergyRescalesTheCachedResults) {
         {"", 61000, "300|100", 2},
         {"pa1=abc", 61000, "300|100", 2},
         {"pa1=99999999999999 pa2=0", 61000, "300|100", 2},
+        {nullptr, 61000, "300|100", 2},  // no audio framework
     };
     int64_t dt = 0;
     for (const auto& c : cases) {
-        mServices->state()->setAudioParameter("getSmartPAPOWER", c.answer);
+        if (c.answer != nullptr) {
+            mServices->state()->setAudioParameter("getSmartPAPOWER", c.answer);
+        } else {
+            mServices->state()->setAudioParameter("getSmartPAPOWER", "pa2=200000");
+            mServices->stop("media.audio_flinger");
+        }
         gMonotonic += c.advance;
         dt += 60000;
         for (const auto& app : {std::make_pair("com.a", 300), std::make_pair("com.b", 100)}) {
@@ -348,7 +357,7 @@ TEST_F(AudioSmartPaTest, MeasuredEnergyRescalesTheCachedResults) {
                   rows("SELECT GROUP_CONCAT(background_energy, '|') FROM (SELECT "
                        "background_energy FROM raw_applications_audio WHERE end_time = " +
                        std::to_string(kT + dt) + " ORDER BY name)"))
-            << c.answer;
+            << (c.answer != nullptr ? c.answer : "no service");
         EXPECT_EQ(c.readings, rows("SELECT speaker FROM raw_audio_smartpa_value").size());
     }
 }
