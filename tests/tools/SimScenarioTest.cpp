@@ -48,6 +48,8 @@ const Refusal kRefusals[] = {
     {"ambient without six durations", "at 5 ambient auto 1 2 3", "six ambient levels"},
     {"gnss of an unknown package", "at 5 gnss start com.other", "no app has the package"},
     {"torch user of a shared uid", "at 5 torch 2101", "app with one package"},
+    {"audio start on stream 13", "at 5 audio start 21 13", "stream 0..12"},
+    {"call in an unknown state", "at 5 call dialing", "call idle|ringing|offhook"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

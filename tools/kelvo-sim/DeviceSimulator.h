@@ -8,6 +8,7 @@
 #include <mutex>
 #include <string>
 
+#include "AudioModel.h"
 #include "ComponentTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
@@ -95,6 +96,8 @@ private:
     // The display, GNSS and flashlight with their truth (under mLock: the
     // driver thread reads the panel's advanced brightness).
     std::unique_ptr<ComponentTruth> mComponents;
+    // The audio framework with its truth (under mLock).
+    std::unique_ptr<AudioModel> mAudio;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -1,5 +1,7 @@
 #include "Scenario.h"
 
+#include "AudioModel.h"
+
 #include <errno.h>
 #include <stdlib.h>
 
@@ -323,6 +325,10 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
         if (words.size() != 2 || words[1].empty() || words[1].back() != '%' ||
             !parseInt32(words[1].substr(0, words[1].size() - 1), 0, 100, &step.value)) {
             *reason = "expected \"at <time> battery <level 0..100>%\"";
+            return false;
+        }
+    } else if (AudioModel::isVerb(words[0])) {
+        if (!AudioModel::parseStep(words, &step, reason)) {
             return false;
         }
     } else if (!parseComponentStep(words, &step, reason)) {

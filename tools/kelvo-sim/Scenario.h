@@ -43,6 +43,7 @@ public:
         Gnss,        // flag: start, text: the package
         Flashlight,  // flag: on
         Torch,       // pid: the torch user's process
+        Audio,       // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
     };
 
     struct Step {
