@@ -1043,6 +1043,25 @@ int32_t AudioHandler::onDataPolling(const Parcel& data) {
     }
 }
 
+int32_t AudioHandler::onVmDied(const Parcel& data) {
+    data.setDataPosition(0);
+    const int64_t time = data.readInt64();
+    int32_t ret = ComponentHandler::onVmDied(data);
+    for (const auto& entry : mSessions) {
+        const session_data& session = entry.second;
+        if (session.reference >= 1 && needsPower(session.device)) {
+            sendSessionValue(time, entry.first, session.device,
+                             validStream(session.stream) ? mStreams[session.stream].volume : 1);
+            sendSessionAction(ACTION_ACTIVATE, time, entry.first, session.name);
+        }
+    }
+    if (mPhoneState != 0 && needsPower(mPhoneDevice)) {
+        sendSessionValue(time, kCallSession, mPhoneDevice, mStreams[mInCallStream].volume);
+        sendSessionAction(ACTION_ACTIVATE, time, kCallSession, String8(kCallPackage));
+    }
+    return ret;
+}
+
 int32_t AudioHandler::onDailyTick(const Parcel& data) {
     data.setDataPosition(0);
     data.readInt64();

@@ -77,6 +77,9 @@ public:
     int32_t onForegroundChanged(const android::Parcel& data) override;
     int32_t onChargerOnlineChanged(const android::Parcel& data) override;
     int32_t onDailyTick(const android::Parcel& data) override;
+    // The accounter drops every element; what still plays is activated
+    // again at once, so its charge goes on.
+    int32_t onVmDied(const android::Parcel& data) override;
     int32_t onDailyUploading(const android::Parcel& data) override;
     int32_t handleApplicationResult(const android::Parcel& data) override;
     int32_t handleComponentResult(const android::Parcel& data) override;

@@ -270,6 +270,22 @@ TEST_F(AudioHandlerTest, PlayTimeThroughTheHourAndBluetoothNotices) {
     EXPECT_EQ("com.a", hourly["21"][0]["params"]["3"]["params"]["0"].asString());
 }
 
+// A framework death ends every accounter element; a session still playing
+// is charged on (200 s, not the 100 s before the death).
+TEST_F(AudioHandlerTest, PlayingSessionOutlivesFrameworkDeath) {
+    ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_ACQUIRE, 0, "session=10 pid=501 uid=10010"));
+    ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_START, 0, "session=10 stream=3"));
+    Parcel body;
+    body.writeInt64(kT + 100000);
+    ASSERT_EQ(
+        0, mAudio->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_VM_DIED, body)));
+    ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_STOP, 200000, "session=10 stream=3"));
+    ASSERT_EQ(0, poll(300000));
+    EXPECT_EQ(std::vector<std::string>{"com.a|200000|12200"},
+              rows("SELECT name, SUM(background_duration), SUM(background_energy) FROM "
+                   "raw_applications_audio GROUP BY name"));
+}
+
 // Refused messages change nothing: stream ids are 0..12, numbers are
 // numbers, every key is there, stops and releases need a known session.
 // A stop of a session not playing and a new owner of a playing session
