@@ -16,11 +16,14 @@
 #include "core/Dispatcher.h"
 #include "core/AppsAccounting.h"
 #include "handlers/components/BatteryHandler.h"
+#include "handlers/components/AudioHandler.h"
+#include "handlers/components/BluetoothHandler.h"
 #include "handlers/components/CpuHandler.h"
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
 #include "handlers/components/WifiHandler.h"
+#include "handlers/components/SensorHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -68,6 +71,18 @@ android::sp<KelvoOperator> makeBatteryHandler() {
     return new BatteryHandler();
 }
 
+android::sp<KelvoOperator> makeAudioHandler() {
+    return new AudioHandler();
+}
+
+android::sp<KelvoOperator> makeBluetoothHandler() {
+    return new BluetoothHandler();
+}
+
+android::sp<KelvoOperator> makeSensorHandler() {
+    return new SensorHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -93,6 +108,10 @@ struct Factories {
         handlers[HANDLER_BATTERY] = &makeBatteryHandler;
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
         handlers[HANDLER_WIFI] = &makeWifiHandler;
+        handlers[HANDLER_AUDIO] = &makeAudioHandler;
+        routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
+        handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
+        handlers[HANDLER_SENSOR] = &makeSensorHandler;
     }
 
     std::mutex lock;

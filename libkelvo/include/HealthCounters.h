@@ -42,6 +42,7 @@ enum class Health : uint32_t {
     SystemReadingsRefused,   // wakeup-source or memory lines skipped, system state over its cap
     TrafficReadingsRefused,  // traffic lines skipped or refused, keys or lists over their cap
     BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
+    HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
     Count
 };
 

@@ -22,6 +22,7 @@ const char* const kHealthNames[] = {
         "service_requests_refused",  "abnormality_input_refused", "system_readings_refused",
         "traffic_readings_refused",
         "battery_readings_kept",
+        "handler_state_capped",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

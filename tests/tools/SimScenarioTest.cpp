@@ -53,6 +53,8 @@ const Refusal kRefusals[] = {
     {"battery model without level", "battery-model 3000", "battery-model <capacity mAh>"},
     {"battery model bad current", "battery-model 3000 50% idle -5", "battery-model <capacity mAh>"},
     {"wakelock of no app", "at 5 held-wakelock com.other Tag 20:00", "no app has the package"},
+    {"audio start on stream 13", "at 5 audio start 21 13", "stream 0..12"},
+    {"call in an unknown state", "at 5 call dialing", "call idle|ringing|offhook"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -215,6 +215,9 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         *error = "cannot lay out the battery files below " + root + ": " + strerror(errno);
         return false;
     }
+    AudioModel::Profile audioProfile;
+    AudioModel::readProfile(config, &audioProfile);
+    mAudio.reset(new AudioModel(mScenario, audioProfile));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -390,6 +393,23 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
                                            .c_str(),
                                        t);
             break;
+        case Scenario::Action::Audio: {
+            std::string tag;
+            std::string text;
+            bool record = false;
+            {
+                std::lock_guard<std::mutex> lock(mLock);
+                mAudio->advanceTo(mModelMs);
+                record = mAudio->apply(step, &tag, &text);
+            }
+            if (!record) {
+                // The amplifiers' next answer to the audio handler.
+                mServices->state()->setAudioParameter("getSmartPAPOWER", text);
+                return;
+            }
+            result = mLogWriter->write(LogWriter::PRIORITY_INFO, tag.c_str(), text.c_str(), t);
+            break;
+        }
         default: {
             // Display, GNSS and flashlight: a log-device record each.
             ComponentTruth::Record record;
@@ -604,6 +624,8 @@ int DeviceSimulator::finish(bool completed) {
                                         SimReport::eventsPath(mOptions.root));
         componentReport.build(&components);
         componentTable = componentReport.table();
+        mAudio->advanceTo(mModelMs);
+        components += mAudio->summary();
     }
     report.addSection(components);
     BatteryReport::Model battery;

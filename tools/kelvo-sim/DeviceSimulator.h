@@ -8,6 +8,7 @@
 #include <mutex>
 #include <string>
 
+#include "AudioModel.h"
 #include "ComponentTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
@@ -103,6 +104,8 @@ private:
     std::unique_ptr<ComponentTruth> mComponents;
     std::unique_ptr<TrafficModel> mTraffic;
     std::unique_ptr<BatteryModel> mBattery;  // the play thread's
+    // The audio framework with its truth (under mLock).
+    std::unique_ptr<AudioModel> mAudio;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

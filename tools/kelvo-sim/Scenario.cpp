@@ -1,5 +1,7 @@
 #include "Scenario.h"
 
+#include "AudioModel.h"
+
 #include <errno.h>
 #include <stdlib.h>
 
@@ -356,6 +358,10 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
             return false;
         }
         step.action = Action::System;
+    } else if (AudioModel::isVerb(words[0])) {
+        if (!AudioModel::parseStep(words, &step, reason)) {
+            return false;
+        }
     } else if (!parseComponentStep(words, &step, reason)) {
         return false;
     }

@@ -50,6 +50,7 @@ public:
         SystemTraffic,  // pid, text: interface, counters
         Wifi,           // value: record kind, pid: its number (WifiRecords)
         HeldWakelock,   // text: package, tag: the wakelock, value: ms held
+        Audio,       // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
     };
 
     struct Step {

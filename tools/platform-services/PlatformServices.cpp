@@ -4,6 +4,7 @@
 #include <binder/ServiceControl.h>
 
 #include "FakeActivityService.h"
+#include "FakeAudioService.h"
 #include "FakePackageService.h"
 #include "FakePermissionService.h"
 #include "FakePmService.h"
@@ -20,7 +21,8 @@ PlatformServices::~PlatformServices() {
 
 std::vector<std::string> PlatformServices::names() {
     return {"activity",       "package",   "batteryproperties",
-            "SysinfoService", "pmservice", "permission"};
+            "SysinfoService", "pmservice", "permission",
+            "media.audio_flinger"};
 }
 
 android::status_t PlatformServices::start(const std::string& name) {
@@ -45,6 +47,8 @@ android::status_t PlatformServices::start(const std::string& name) {
         service = new FakePmService(mState);
     } else if (name == "permission") {
         service = new FakePermissionService(mState);
+    } else if (name == "media.audio_flinger") {
+        service = new FakeAudioService(mState);
     } else {
         return android::BAD_VALUE;
     }

@@ -24,7 +24,7 @@ public:
     ~PlatformServices();
 
     // "activity", "package", "batteryproperties", "SysinfoService",
-    // "pmservice", "permission".
+    // "pmservice", "permission", "media.audio_flinger".
     static std::vector<std::string> names();
 
     const std::shared_ptr<PlatformState>& state() const { return mState; }

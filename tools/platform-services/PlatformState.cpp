@@ -98,6 +98,17 @@ bool PlatformState::granted(const std::string& permission, int32_t uid) {
     return it != mGrants.end() && it->second;
 }
 
+void PlatformState::setAudioParameter(const std::string& key, const std::string& value) {
+    std::lock_guard<std::mutex> guard(mLock);
+    mAudioParameters[key] = value;
+}
+
+std::string PlatformState::audioParameter(const std::string& key) {
+    std::lock_guard<std::mutex> guard(mLock);
+    auto it = mAudioParameters.find(key);
+    return it == mAudioParameters.end() ? std::string() : it->second;
+}
+
 void PlatformState::setDelayMs(const std::string& service, int32_t ms) {
     std::lock_guard<std::mutex> guard(mLock);
     mDelays[service] = ms;

@@ -59,6 +59,10 @@ public:
     void grant(const std::string& permission, int32_t uid, bool granted);
     bool granted(const std::string& permission, int32_t uid);
 
+    // "media.audio_flinger": the answer to a parameter key, empty when unset.
+    void setAudioParameter(const std::string& key, const std::string& value);
+    std::string audioParameter(const std::string& key);
+
     // A service answers only after this many milliseconds (a hanging
     // framework).
     void setDelayMs(const std::string& service, int32_t ms);
@@ -81,6 +85,7 @@ private:
     int32_t mResets = 0;
     std::vector<std::string> mTraces;
     std::map<std::pair<std::string, int32_t>, bool> mGrants;
+    std::map<std::string, std::string> mAudioParameters;
     std::map<std::string, int32_t> mDelays;
     std::map<std::pair<std::string, uint32_t>, int32_t> mCalls;
     std::function<void()> mBatteryObserver;

@@ -93,6 +93,20 @@ String8 ComponentHandler::sumList(const component_family& family) {
     return list;
 }
 
+String8 ComponentHandler::valueList(const component_family& family) {
+    if (!family.longestDurations) {
+        return sumList(family);
+    }
+    const table_attribute& table = *family.hourlyComponent;
+    String8 list;
+    for (int32_t c = 1; c < table.count; ++c) {
+        const bool duration = table.columns[c].type == COLUMN_INT;
+        list.appendFormat(duration ? "%s%s" : "%sSUM(%s)", c > 1 ? ", " : "",
+                          table.columns[c].name);
+    }
+    return list;
+}
+
 int32_t ComponentHandler::valueCount(const component_family& family) {
     return family.hourlyComponent->count - 1;
 }
@@ -423,18 +437,22 @@ int32_t ComponentHandler::logApplicationsAccounting(const component_family& fami
 
 String8 ComponentHandler::componentSumsQuery(const component_family& family, int64_t from,
                                              int64_t to) {
+    // Durations of overlapping rows come from the longest one.
+    const char* longest = family.longestDurations
+                              ? " ORDER BY MAX(foreground_duration + background_duration) DESC"
+                              : "";
     if (family.rawComponent != nullptr) {
         return String8::format(
             "SELECT COUNT(*), %s FROM %s WHERE end_time > %lld AND "
-            "end_time <= %lld",
-            sumList(family).string(), family.rawComponent->name, static_cast<long long>(from),
-            static_cast<long long>(to));
+            "end_time <= %lld%s",
+            valueList(family).string(), family.rawComponent->name, static_cast<long long>(from),
+            static_cast<long long>(to), longest);
     }
     return String8::format(
         "SELECT COUNT(*), %s FROM %s WHERE timestamp > %lld AND "
-        "timestamp <= %lld%s",
-        sumList(family).string(), family.hourlyApplications->name, static_cast<long long>(from),
-        static_cast<long long>(to), filterClause(family).string());
+        "timestamp <= %lld%s%s",
+        valueList(family).string(), family.hourlyApplications->name, static_cast<long long>(from),
+        static_cast<long long>(to), filterClause(family).string(), longest);
 }
 
 int32_t ComponentHandler::logComponentAccounting(int64_t time) {
@@ -508,7 +526,7 @@ int32_t ComponentHandler::uploadTopApplications(const component_family& family, 
     String8 sql = String8::format(
         "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld%s "
         "GROUP BY name ORDER BY %s DESC LIMIT %d",
-        sumList(family).string(), family.hourlyApplications->name,
+        valueList(family).string(), family.hourlyApplications->name,
         static_cast<long long>(end - window), static_cast<long long>(end),
         filterClause(family).string(),
         family.rankBy != nullptr ? family.rankBy

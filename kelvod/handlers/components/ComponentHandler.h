@@ -135,6 +135,12 @@ struct component_family {
     // foreground and background time ("MAX(foreground_duration +
     // background_duration)" for members whose hourly rows overlap).
     const char* rankBy = nullptr;
+    // Whether one application has several rows of one hour (one per
+    // activity or type, overlapping in time): the hour's component sums and
+    // the top applications then take the durations of the row with the
+    // longest foreground plus background time instead of adding overlapping
+    // periods up; energies are still summed.
+    bool longestDurations = false;
 };
 
 // Whether and how a member's component is governed by the data-source policy
@@ -249,6 +255,9 @@ private:
                                                int64_t to);
     // "SUM(a), SUM(b), ..." over the family's values, and their count.
     static android::String8 sumList(const component_family& family);
+    // The same with the durations taken from the longest row when the
+    // family's rows overlap.
+    static android::String8 valueList(const component_family& family);
     static int32_t valueCount(const component_family& family);
     // " AND (filter)" or nothing.
     static android::String8 filterClause(const component_family& family);
