@@ -321,7 +321,12 @@ TEST_F(RadioSensorTest, HourlyRowsAndUploads) {
     ZendrelHost::failCall(ZendrelHost::CALL_CREATE, EVENT_HOURLY_COMPONENTS);
     log("KELVO_TAG_BT_DISCOVERY_START", "uid=10010 pid=4", kH + 1000);
     log("KELVO_TAG_BT_DISCOVERY_STOP", "", kH + 2000);
-    ASSERT_TRUE(waitFor([&] { return rows("SELECT 1 FROM raw_bluetooth_state").size() == 6; }));
+    log("KELVO_TAG_SENSOR_ENABLE", "uid=10010 name=com.a type=1 connection=c1", kH + 1000);
+    log("KELVO_TAG_SENSOR_DISABLE", "uid=10010 name=com.a type=1 connection=c1", kH + 2000);
+    ASSERT_TRUE(waitFor([&] {
+        return rows("SELECT 1 FROM raw_bluetooth_state").size() == 6 &&
+               rows("SELECT 1 FROM raw_sensor_state").size() == 5;
+    }));
     tick(kH + kHour);
     EXPECT_TRUE(capture.contains("Failed to set bluetooth upload data"));
     EXPECT_TRUE(capture.contains("Failed to set sensor upload data"));
