@@ -48,6 +48,9 @@ const Refusal kRefusals[] = {
     {"ambient without six durations", "at 5 ambient auto 1 2 3", "six ambient levels"},
     {"gnss of an unknown package", "at 5 gnss start com.other", "no app has the package"},
     {"torch user of a shared uid", "at 5 torch 2101", "app with one package"},
+    {"discovery without its requester", "at 5 bluetooth discovery start", "bluetooth discovery"},
+    {"sensor of an undeclared pid", "at 5 sensor enable 999 1 c1", "pid 999 is not declared"},
+    {"sensor enabled for every type", "at 5 sensor enable 2001 -1 c1", "sensor enable|disable"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -197,6 +197,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         return false;
     }
     mComponents.reset(new ComponentTruth(mScenario, profile));
+    mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -342,7 +343,8 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             ComponentTruth::Record record;
             {
                 std::lock_guard<std::mutex> lock(mLock);
-                if (!mComponents->apply(step, &record)) {
+                if (!mRadioSensors->apply(step, step.atMs, &record.tag, &record.text) &&
+                    !mComponents->apply(step, &record)) {
                     return;
                 }
             }
@@ -525,6 +527,8 @@ int DeviceSimulator::finish(bool completed) {
                                         SimReport::eventsPath(mOptions.root));
         componentReport.build(&components);
         componentTable = componentReport.table();
+        mRadioSensors->advanceTo(mModelMs);
+        components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
     }
     report.addSection(components);
     std::string text;

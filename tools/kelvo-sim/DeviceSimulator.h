@@ -9,6 +9,7 @@
 #include <string>
 
 #include "ComponentTruth.h"
+#include "RadioSensorTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "Scenario.h"
@@ -95,6 +96,7 @@ private:
     // The display, GNSS and flashlight with their truth (under mLock: the
     // driver thread reads the panel's advanced brightness).
     std::unique_ptr<ComponentTruth> mComponents;
+    std::unique_ptr<RadioSensorTruth> mRadioSensors;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

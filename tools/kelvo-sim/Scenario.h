@@ -43,6 +43,8 @@ public:
         Gnss,        // flag: start, text: the package
         Flashlight,  // flag: on
         Torch,       // pid: the torch user's process
+        Bluetooth,   // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
+        Sensor,      // flag: enable, pid, value: sensor type (-1 every type), text: connection
     };
 
     struct Step {
