@@ -73,9 +73,9 @@ void BM_SensorRevise(benchmark::State& state) {
             sleep.writeInt64(time + 61000);
             time += 62000;
             Clock::time_point start = Clock::now();
-            failed |= handler->sendMessageSync(kelvo::ParcelMessage(
-                          kelvo::MESSAGE_CUSTOMIZED, kelvo::SensorHandler::kSystemResume, sleep)) <
-                      0;
+            failed |=
+                handler->sendMessageSync(kelvo::ParcelMessage(
+                    kelvo::MESSAGE_CUSTOMIZED, kelvo::SensorHandler::kSystemResume, sleep)) < 0;
             ms.push_back(std::chrono::duration<double, std::milli>(Clock::now() - start).count());
         }
     }

@@ -186,8 +186,8 @@ std::string RadioSensorTruth::report(const std::string& databasePath) const {
     out << "\nBluetooth by activity (0 discovery, 1 sending, 2 receiving) and sensors by type:\n"
            "truth = what the scenario gave, attributed = the daemon's raw rows. Times in ms.\n";
     char line[256];
-    snprintf(line, sizeof(line), "%-10s %-28s %5s %9s %10s %8s %10s\n", "component",
-             "application", "kind", "truth", "attributed", "truth en", "attributed");
+    snprintf(line, sizeof(line), "%-10s %-28s %5s %9s %10s %8s %10s\n", "component", "application",
+             "kind", "truth", "attributed", "truth en", "attributed");
     out << line;
     sqlite3* db = nullptr;
     if (sqlite3_open_v2(databasePath.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
@@ -198,11 +198,12 @@ std::string RadioSensorTruth::report(const std::string& databasePath) const {
         {"bluetooth", &mBluetooth}, {"sensor", &mSensors}};
     for (const auto& [word, truth] : parts) {
         std::map<Key, Figures> attributed;
-        std::string sql = std::string("SELECT name, type, SUM(foreground_duration + "
-                                      "background_duration + charge_foreground_duration + "
-                                      "charge_background_duration), SUM(foreground_energy + "
-                                      "background_energy + charge_foreground_energy + "
-                                      "charge_background_energy) FROM raw_applications_") +
+        std::string sql = std::string(
+                              "SELECT name, type, SUM(foreground_duration + "
+                              "background_duration + charge_foreground_duration + "
+                              "charge_background_duration), SUM(foreground_energy + "
+                              "background_energy + charge_foreground_energy + "
+                              "charge_background_energy) FROM raw_applications_") +
                           word + " GROUP BY name, type";
         sqlite3_stmt* stmt = nullptr;
         if (db != nullptr && sqlite3_prepare_v2(db, sql.c_str(), -1, &stmt, nullptr) == SQLITE_OK) {

@@ -87,8 +87,7 @@ String8 ComponentHandler::valueList(const component_family& family) {
     String8 list;
     for (int32_t c = 1; c < table.count; ++c) {
         const bool duration = table.columns[c].type == COLUMN_INT;
-        list.appendFormat(duration ? "%s%s" : "%sSUM(%s)", c > 1 ? ", " : "",
-                          table.columns[c].name);
+        list.appendFormat(duration ? "%s%s" : "%sSUM(%s)", c > 1 ? ", " : "", table.columns[c].name);
     }
     return list;
 }

@@ -79,8 +79,8 @@ protected:
         mRoutine->earlyInitialize();
         KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
         mRoutine->initialize();
-        for (KelvoOperator* op : {static_cast<KelvoOperator*>(mBt.get()),
-                                  static_cast<KelvoOperator*>(mSensor.get())}) {
+        for (KelvoOperator* op :
+             {static_cast<KelvoOperator*>(mBt.get()), static_cast<KelvoOperator*>(mSensor.get())}) {
             ASSERT_EQ(0, op->earlyInitialize());
             op->initialize();
         }
@@ -151,7 +151,8 @@ protected:
             } else {
                 std::string text;
                 std::getline(in >> std::ws, text);
-                EXPECT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, word.c_str(), text.c_str(), t));
+                EXPECT_EQ(0,
+                          mWriter->write(LogWriter::PRIORITY_INFO, word.c_str(), text.c_str(), t));
             }
             if (writes) ++expected;
             // Log records arrive on their own thread: let them in before
