@@ -331,6 +331,18 @@ TEST_F(RadioSensorTest, HourlyRowsAndUploads) {
     tick(kH + kHour);
     EXPECT_TRUE(capture.contains("Failed to set bluetooth upload data"));
     EXPECT_TRUE(capture.contains("Failed to set sensor upload data"));
+
+    // The day adds up each hour's longest row: 30 s, then 1 s.
+    ZendrelHost::clearFailures();
+    Parcel day;
+    day.writeFloat(1.0f);
+    day.writeInt64(kH + kHour);
+    mSensor->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_DAILY_UPLOADING, day));
+    DataUploader::getInstance()->uploadEvent();
+    for (const Json::Value& e : events()) {
+        if (e["event"].asUInt() == EVENT_DAILY_COMPONENTS) p = e["params"];
+    }
+    EXPECT_EQ(31000, p["11"][0]["params"]["1"]["params"]["7"].asInt64());
 }
 
 }  // namespace
