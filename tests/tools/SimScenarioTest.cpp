@@ -55,6 +55,9 @@ const Refusal kRefusals[] = {
     {"wakelock of no app", "at 5 held-wakelock com.other Tag 20:00", "no app has the package"},
     {"audio start on stream 13", "at 5 audio start 21 13", "stream 0..12"},
     {"call in an unknown state", "at 5 call dialing", "call idle|ringing|offhook"},
+    {"discovery without its requester", "at 5 bluetooth discovery start", "bluetooth discovery"},
+    {"sensor of an undeclared pid", "at 5 sensor enable 999 1 c1", "pid 999 is not declared"},
+    {"sensor enabled for every type", "at 5 sensor enable 2001 -1 c1", "sensor enable|disable"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

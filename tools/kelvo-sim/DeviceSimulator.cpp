@@ -218,6 +218,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     AudioModel::Profile audioProfile;
     AudioModel::readProfile(config, &audioProfile);
     mAudio.reset(new AudioModel(mScenario, audioProfile));
+    mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -415,7 +416,8 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             ComponentTruth::Record record;
             {
                 std::lock_guard<std::mutex> lock(mLock);
-                if (!mComponents->apply(step, &record)) {
+                if (!mRadioSensors->apply(step, step.atMs, &record.tag, &record.text) &&
+                    !mComponents->apply(step, &record)) {
                     return;
                 }
                 mBattery->setScreen(mComponents->screenOn());
@@ -626,6 +628,8 @@ int DeviceSimulator::finish(bool completed) {
         componentTable = componentReport.table();
         mAudio->advanceTo(mModelMs);
         components += mAudio->summary();
+        mRadioSensors->advanceTo(mModelMs);
+        components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
     }
     report.addSection(components);
     BatteryReport::Model battery;

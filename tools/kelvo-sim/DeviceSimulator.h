@@ -10,6 +10,7 @@
 
 #include "AudioModel.h"
 #include "ComponentTruth.h"
+#include "RadioSensorTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "PlatformState.h"
@@ -106,6 +107,7 @@ private:
     std::unique_ptr<BatteryModel> mBattery;  // the play thread's
     // The audio framework with its truth (under mLock).
     std::unique_ptr<AudioModel> mAudio;
+    std::unique_ptr<RadioSensorTruth> mRadioSensors;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

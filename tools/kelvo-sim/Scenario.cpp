@@ -14,6 +14,7 @@
 #include "SystemScene.h"
 #include "TrafficModel.h"
 #include "WifiRecords.h"
+#include "RadioSensorTruth.h"
 
 namespace kelvo {
 namespace sim {
@@ -419,8 +420,10 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
             *reason = "expected \"at <time> torch <pid>\"";
             return false;
         }
-    } else {
-        *reason = "unknown verb \"" + verb + "\"";
+    } else if (int32_t parsed = RadioSensorTruth::parseStep(words, step, reason); parsed <= 0) {
+        if (parsed == 0) {
+            *reason = "unknown verb \"" + verb + "\"";
+        }
         return false;
     }
     return true;
@@ -467,6 +470,12 @@ bool Scenario::check(std::string* reason, int32_t* line) {
                           std::to_string(step.frequency) + " kHz";
                 return false;
             }
+        }
+        const bool requester = step.action == Action::Sensor ||
+                               (step.action == Action::Bluetooth && step.text == "discovery-start");
+        if (requester && findProcess(step.pid) == nullptr) {
+            *reason = "pid " + std::to_string(step.pid) + " is not declared";
+            return false;
         }
         if (step.action == Action::Torch) {
             const Process* process = findProcess(step.pid);

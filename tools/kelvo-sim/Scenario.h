@@ -51,6 +51,8 @@ public:
         Wifi,           // value: record kind, pid: its number (WifiRecords)
         HeldWakelock,   // text: package, tag: the wakelock, value: ms held
         Audio,       // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
+        Bluetooth,   // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
+        Sensor,      // flag: enable, pid, value: sensor type (-1 every type), text: connection
     };
 
     struct Step {

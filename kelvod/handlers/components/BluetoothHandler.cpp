@@ -18,11 +18,16 @@ namespace kelvo {
 namespace {
 
 const column_attribute kHourlyApplicationsColumns[] = {
-    {COLUMN_TIME, "timestamp"},          {COLUMN_TEXT, "name"},
-    {COLUMN_INT, "type"},                {COLUMN_INT, "foreground_duration"},
-    {COLUMN_LONG, "foreground_energy"},  {COLUMN_INT, "background_duration"},
-    {COLUMN_LONG, "background_energy"},  {COLUMN_INT, "screen_on_duration"},
-    {COLUMN_LONG, "screen_on_energy"},   {COLUMN_INT, "screen_off_duration"},
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "type"},
+    {COLUMN_INT, "foreground_duration"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_duration"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_duration"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_duration"},
     {COLUMN_LONG, "screen_off_energy"},
 };
 const column_attribute kStateColumns[] = {
@@ -189,8 +194,7 @@ int32_t BluetoothHandler::handleCustomized(int32_t code, const Parcel& data, Par
     String8 package;
     bool on = false;
     if (data.readInt64(&time) != android::NO_ERROR ||
-        data.readString8(&package) != android::NO_ERROR ||
-        data.readBool(&on) != android::NO_ERROR) {
+        data.readString8(&package) != android::NO_ERROR || data.readBool(&on) != android::NO_ERROR) {
         HealthCounters::add(Health::MessagesRefused);
         KLOGE("Invalid bluetooth notice: %d", code);
         return -2;

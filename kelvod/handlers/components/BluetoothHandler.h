@@ -79,8 +79,8 @@ private:
     int32_t handleMedia(int64_t time, const android::String8& package, bool on);
     int32_t handlePhone(int64_t time, const android::String8& package, bool on);
     // Sets the activity, sends its action and writes its state row.
-    void applyChange(activity& a, int64_t time, bool on, int32_t type,
-                     const android::String8& name, bool sendAction);
+    void applyChange(activity& a, int64_t time, bool on, int32_t type, const android::String8& name,
+                     bool sendAction);
     // The package of a discovery request, or kUnknownPackage.
     android::String8 discoveryPackage(const char* text);
 

@@ -101,8 +101,7 @@ String8 ComponentHandler::valueList(const component_family& family) {
     String8 list;
     for (int32_t c = 1; c < table.count; ++c) {
         const bool duration = table.columns[c].type == COLUMN_INT;
-        list.appendFormat(duration ? "%s%s" : "%sSUM(%s)", c > 1 ? ", " : "",
-                          table.columns[c].name);
+        list.appendFormat(duration ? "%s%s" : "%sSUM(%s)", c > 1 ? ", " : "", table.columns[c].name);
     }
     return list;
 }
@@ -523,15 +522,37 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
 
 int32_t ComponentHandler::uploadTopApplications(const component_family& family, int64_t end,
                                                 int64_t window, float ratio, Parcel& out) {
+    const long long from = static_cast<long long>(end - window);
+    String8 source(family.hourlyApplications->name);
+    const char* rank = family.rankBy != nullptr
+                           ? family.rankBy
+                           : "SUM(foreground_duration) + SUM(background_duration)";
+    if (family.longestDurations) {
+        // Overlapping rows: per application and hour the longest row's
+        // durations and the summed energies, then the window's hours added
+        // up (a day is not the longest single hour).
+        const table_attribute& table = *family.hourlyComponent;
+        String8 columns;
+        for (int32_t c = 1; c < table.count; ++c) {
+            const char* name = table.columns[c].name;
+            if (table.columns[c].type == COLUMN_INT) {
+                columns.appendFormat("%s, ", name);
+            } else {
+                columns.appendFormat("SUM(%s) AS %s, ", name, name);
+            }
+        }
+        source = String8::format(
+            "(SELECT name, timestamp, %sMAX(foreground_duration + background_duration) FROM %s "
+            "WHERE timestamp > %lld AND timestamp <= %lld%s GROUP BY name, timestamp)",
+            columns.string(), family.hourlyApplications->name, from,
+            static_cast<long long>(end), filterClause(family).string());
+        rank = "SUM(foreground_duration) + SUM(background_duration)";
+    }
     String8 sql = String8::format(
         "SELECT COUNT(*), name, %s FROM %s WHERE timestamp > %lld AND timestamp <= %lld%s "
         "GROUP BY name ORDER BY %s DESC LIMIT %d",
-        valueList(family).string(), family.hourlyApplications->name,
-        static_cast<long long>(end - window), static_cast<long long>(end),
-        filterClause(family).string(),
-        family.rankBy != nullptr ? family.rankBy
-                                 : "SUM(foreground_duration) + SUM(background_duration)",
-        kTopApplications);
+        sumList(family).string(), source.string(), from, static_cast<long long>(end),
+        filterClause(family).string(), rank, kTopApplications);
     std::vector<sum_row> rows;
     int32_t ret = querySumRows(sql, true, valueCount(family), &rows);
     if (ret < 0) {

@@ -137,9 +137,10 @@ struct component_family {
     const char* rankBy = nullptr;
     // Whether one application has several rows of one hour (one per
     // activity or type, overlapping in time): the hour's component sums and
-    // the top applications then take the durations of the row with the
-    // longest foreground plus background time instead of adding overlapping
-    // periods up; energies are still summed.
+    // the top applications then take, per hour, the durations of the row
+    // with the longest foreground plus background time instead of adding
+    // overlapping periods up (a day adds its hours up); energies are still
+    // summed.
     bool longestDurations = false;
 };
 

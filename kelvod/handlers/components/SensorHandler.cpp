@@ -24,18 +24,23 @@ const column_attribute kStateColumns[] = {
     {COLUMN_INT, "uid"},        {COLUMN_TEXT, "name"}, {COLUMN_TEXT, "connection"},
 };
 const column_attribute kHourlyApplicationsColumns[] = {
-    {COLUMN_INT, "type"},                {COLUMN_TIME, "timestamp"},
-    {COLUMN_TEXT, "name"},               {COLUMN_INT, "foreground_duration"},
-    {COLUMN_LONG, "foreground_energy"},  {COLUMN_INT, "background_duration"},
-    {COLUMN_LONG, "background_energy"},  {COLUMN_INT, "screen_on_duration"},
-    {COLUMN_LONG, "screen_on_energy"},   {COLUMN_INT, "screen_off_duration"},
+    {COLUMN_INT, "type"},
+    {COLUMN_TIME, "timestamp"},
+    {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "foreground_duration"},
+    {COLUMN_LONG, "foreground_energy"},
+    {COLUMN_INT, "background_duration"},
+    {COLUMN_LONG, "background_energy"},
+    {COLUMN_INT, "screen_on_duration"},
+    {COLUMN_LONG, "screen_on_energy"},
+    {COLUMN_INT, "screen_off_duration"},
     {COLUMN_LONG, "screen_off_energy"},
 };
 
 const table_attribute kRawApplications = {"1.1", 1, kTypedRawApplicationsCount,
                                           kTypedRawApplicationsColumns, "raw_applications_sensor"};
-const table_attribute kRawComponent = {"1.1", 1, kTypedRawComponentCount,
-                                       kTypedRawComponentColumns, "raw_component_sensor"};
+const table_attribute kRawComponent = {"1.1", 1, kTypedRawComponentCount, kTypedRawComponentColumns,
+                                       "raw_component_sensor"};
 const table_attribute kHourlyApplications = {
     "1.0", 1, static_cast<int32_t>(sizeof(kHourlyApplicationsColumns) / sizeof(column_attribute)),
     kHourlyApplicationsColumns, "hourly_applications_sensor"};
@@ -45,8 +50,14 @@ const table_attribute kStateTable = {"1.0", 1, 6, kStateColumns, "raw_sensor_sta
 
 component_family makeFamily() {
     component_family f = {
-        "sensor",          &kRawApplications, &kRawComponent, &kHourlyApplications,
-        &kHourlyComponent, APPS_SENSOR,       10,             11,
+        "sensor",
+        &kRawApplications,
+        &kRawComponent,
+        &kHourlyApplications,
+        &kHourlyComponent,
+        APPS_SENSOR,
+        10,
+        11,
     };
     f.rankBy = "MAX(foreground_duration + background_duration)";
     f.longestDurations = true;
@@ -171,8 +182,8 @@ int32_t SensorHandler::enable(int64_t time, const sensor_state& s) {
     }
     if (mEnabled.count(s) > 0) {
         // The accounter already charges it: one Activate per sensor.
-        KLOGD("Already enabled type=%d uid=%d name=%s connection=%s", s.type, s.uid,
-              s.name.c_str(), s.connection.c_str());
+        KLOGD("Already enabled type=%d uid=%d name=%s connection=%s", s.type, s.uid, s.name.c_str(),
+              s.connection.c_str());
         return 0;
     }
     if (mEnabled.size() >= kMaxEnabled) {

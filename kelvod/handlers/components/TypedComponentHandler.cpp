@@ -44,10 +44,9 @@ int32_t TypedComponentHandler::handleApplicationResult(const Parcel& data) {
     String8 name;
     int32_t durations[6] = {};
     int64_t energies[6] = {};
-    bool ok = data.readInt32(&type) == android::NO_ERROR &&
-              data.readInt64(&start) == android::NO_ERROR &&
-              data.readInt64(&end) == android::NO_ERROR &&
-              data.readString8(&name) == android::NO_ERROR;
+    bool ok =
+        data.readInt32(&type) == android::NO_ERROR && data.readInt64(&start) == android::NO_ERROR &&
+        data.readInt64(&end) == android::NO_ERROR && data.readString8(&name) == android::NO_ERROR;
     for (int i = 0; ok && i < 6; ++i) {
         ok = data.readInt32(&durations[i]) == android::NO_ERROR &&
              data.readInt64(&energies[i]) == android::NO_ERROR;
