@@ -211,13 +211,25 @@ bool AudioModel::apply(const Scenario::Step& step, std::string* tag, std::string
     return true;
 }
 
-std::string AudioModel::summary() const {
-    std::string out;
-    for (const auto& package : mTruth) {
-        for (const auto& output : package.second) {
-            out += "audio " + package.first + " " + output.first + " " +
-                   std::to_string(output.second.ms) + " ms " +
-                   std::to_string(output.second.energyNumerator / 1000) + "\n";
+std::map<std::string, AudioModel::Figures> AudioModel::poweredTruth() const {
+    std::map<std::string, Figures> out;
+    for (const auto& [package, outputs] : mTruth) {
+        for (const auto& [output, figures] : outputs) {
+            if (output != "bluetooth") {
+                out[package].ms += figures.ms;
+                out[package].energyNumerator += figures.energyNumerator;
+            }
+        }
+    }
+    return out;
+}
+
+std::map<std::string, int64_t> AudioModel::bluetoothMs() const {
+    std::map<std::string, int64_t> out;
+    for (const auto& [package, outputs] : mTruth) {
+        auto it = outputs.find("bluetooth");
+        if (it != outputs.end()) {
+            out[package] += it->second.ms;
         }
     }
     return out;

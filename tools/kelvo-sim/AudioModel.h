@@ -43,8 +43,10 @@ public:
     // framework's answer, text, instead).
     bool apply(const Scenario::Step& step, std::string* tag, std::string* text);
     void advanceTo(int64_t ms);
-    // "audio <package> <output> <ms> <energy>" lines, by package and output.
-    std::string summary() const;
+    // The play time on a Bluetooth output per package.
+    std::map<std::string, int64_t> bluetoothMs() const;
+    // The time and energy on the powered outputs per package.
+    std::map<std::string, Figures> poweredTruth() const;
 
 private:
     struct Session {

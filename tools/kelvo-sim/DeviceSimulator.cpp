@@ -15,9 +15,9 @@
 #include <fstream>
 #include <sstream>
 
-#include "ComponentReport.h"
 #include "BatteryModel.h"
 #include "BatteryReport.h"
+#include "ComponentReport.h"
 #include "CpuTree.h"
 #include "FakeDriverReporter.h"
 #include "FakeKernelDriver.h"
@@ -360,7 +360,18 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             pushBattery(battery);
             return;
         }
-        case Scenario::Action::System:
+        case Scenario::Action::System: {
+            // The sensors' truth follows the sleep the records tell.
+            std::lock_guard<std::mutex> lock(mLock);
+            const std::string& record = step.text;
+            if (record.rfind("KELVO_TAG_KERNEL_SUSPEND\n", 0) == 0) {
+                mRadioSensors->suspend(step.atMs);
+            } else if (record.rfind("KELVO_TAG_KERNEL_WAKEUP\n", 0) == 0) {
+                mRadioSensors->wakeup(step.atMs);
+            } else if (record.rfind("KELVO_TAG_KERNEL_RESUME\n", 0) == 0) {
+                mRadioSensors->resume(step.atMs);
+            }
+        }
             result = mSystem->write(*mLogWriter, step.text, t);
             break;
         case Scenario::Action::Wifi: {
@@ -627,8 +638,13 @@ int DeviceSimulator::finish(bool completed) {
         componentReport.build(&components);
         componentTable = componentReport.table();
         mAudio->advanceTo(mModelMs);
-        components += mAudio->summary();
         mRadioSensors->advanceTo(mModelMs);
+        for (const auto& [package, ms] : mAudio->bluetoothMs()) {
+            mRadioSensors->setMedia(package, ms);
+        }
+        for (const auto& [package, figures] : mAudio->poweredTruth()) {
+            mRadioSensors->setAudio(package, figures.ms, figures.energyNumerator / 1000.0);
+        }
         components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
     }
     report.addSection(components);

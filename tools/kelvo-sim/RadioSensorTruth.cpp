@@ -127,8 +127,45 @@ void RadioSensorTruth::advanceTo(int64_t ms) {
     for (const auto& e : mEnabled) {
         const int32_t type = std::get<0>(e);
         // Sensor powers are in 0.1 mA.
-        charge(mSensors, {std::get<1>(e), type}, mSensorPower[type] / 10.0 / holders[type]);
+        const bool wakeUpType = type == 17 || type == 19 || type == 65545;
+        charge(mAsleep && !wakeUpType ? mSleeping : mSensors, {std::get<1>(e), type},
+               mSensorPower[type] / 10.0 / holders[type]);
     }
+}
+
+void RadioSensorTruth::suspend(int64_t ms) {
+    advanceTo(ms);
+    mAsleep = true;
+    mWoken = false;
+}
+
+void RadioSensorTruth::wakeup(int64_t ms) {
+    advanceTo(ms);
+    mWoken = mAsleep;
+}
+
+void RadioSensorTruth::resume(int64_t ms) {
+    advanceTo(ms);
+    if (!mWoken) {
+        // A sleep the daemon does not count: the sensors ran through it.
+        for (const auto& [key, figures] : mSleeping) {
+            mSensors[key].ms += figures.ms;
+            mSensors[key].energy += figures.energy;
+        }
+    }
+    mSleeping.clear();
+    mAsleep = false;
+    mWoken = false;
+}
+
+void RadioSensorTruth::setAudio(const std::string& package, int64_t ms, double energy) {
+    mAudio[{package, 0}] = Figures{ms, energy};
+}
+
+void RadioSensorTruth::setMedia(const std::string& package, int64_t ms) {
+    Figures& media = mBluetooth[{package, 3}];
+    media.ms = ms;
+    media.energy = mBluetoothPower[3] * static_cast<double>(ms) / 1000.0;
 }
 
 bool RadioSensorTruth::apply(const Scenario::Step& step, int64_t ms, std::string* tag,
@@ -195,16 +232,18 @@ std::string RadioSensorTruth::report(const std::string& databasePath) const {
         db = nullptr;
     }
     const std::pair<const char*, const std::map<Key, Figures>*> parts[] = {
-        {"bluetooth", &mBluetooth}, {"sensor", &mSensors}};
+        {"audio", &mAudio}, {"bluetooth", &mBluetooth}, {"sensor", &mSensors}};
     for (const auto& [word, truth] : parts) {
         std::map<Key, Figures> attributed;
-        std::string sql = std::string(
-                              "SELECT name, type, SUM(foreground_duration + "
-                              "background_duration + charge_foreground_duration + "
-                              "charge_background_duration), SUM(foreground_energy + "
-                              "background_energy + charge_foreground_energy + "
-                              "charge_background_energy) FROM raw_applications_") +
-                          word + " GROUP BY name, type";
+        // Audio rows carry no type: the powered outputs are one line.
+        const bool audio = std::string(word) == "audio";
+        std::string sql = std::string("SELECT name, ") + (audio ? "0" : "type") +
+                          ", SUM(foreground_duration + background_duration + "
+                          "charge_foreground_duration + charge_background_duration), "
+                          "SUM(foreground_energy + background_energy + "
+                          "charge_foreground_energy + charge_background_energy) "
+                          "FROM raw_applications_" +
+                          word + " GROUP BY 1, 2";
         sqlite3_stmt* stmt = nullptr;
         if (db != nullptr && sqlite3_prepare_v2(db, sql.c_str(), -1, &stmt, nullptr) == SQLITE_OK) {
             while (sqlite3_step(stmt) == SQLITE_ROW) {

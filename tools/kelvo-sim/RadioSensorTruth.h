@@ -44,6 +44,17 @@ public:
     // this model's.
     bool apply(const Scenario::Step& step, int64_t ms, std::string* tag, std::string* text);
     void advanceTo(int64_t ms);
+    // The system's sleep: sensors other than the wake-up types (17, 19,
+    // 65545) are cut out of a sleep the daemon counts, one that a wake-up
+    // ends before the resume.
+    void suspend(int64_t ms);
+    void wakeup(int64_t ms);
+    void resume(int64_t ms);
+    // Media played on Bluetooth (activity 3): the audio model's truth.
+    void setMedia(const std::string& package, int64_t ms);
+    // Audio on the powered outputs (earpiece, loudspeaker): the audio
+    // model's truth, shown beside raw_applications_audio.
+    void setAudio(const std::string& package, int64_t ms, double energy);
     // The report's section: per application and activity or sensor type the
     // truth beside what the daemon attributed (raw_applications_bluetooth
     // and _sensor of the database, foreground plus background, charging
@@ -69,6 +80,12 @@ private:
     std::set<std::tuple<int32_t, std::string, std::string>> mEnabled;
     std::map<Key, Figures> mBluetooth;
     std::map<Key, Figures> mSensors;
+    std::map<Key, Figures> mAudio;
+    // While asleep, the non-wake-up sensors' figures wait here until the
+    // resume tells whether the sleep counts.
+    bool mAsleep = false;
+    bool mWoken = false;
+    std::map<Key, Figures> mSleeping;
 };
 
 }  // namespace sim
