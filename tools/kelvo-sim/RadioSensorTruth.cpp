@@ -220,8 +220,9 @@ bool RadioSensorTruth::apply(const Scenario::Step& step, int64_t ms, std::string
 
 std::string RadioSensorTruth::report(const std::string& databasePath) const {
     std::ostringstream out;
-    out << "\nBluetooth by activity (0 discovery, 1 sending, 2 receiving) and sensors by type:\n"
-           "truth = what the scenario gave, attributed = the daemon's raw rows. Times in ms.\n";
+    out << "\nAudio on the powered outputs, Bluetooth by activity (0 discovery, 1 sending,\n"
+           "2 receiving, 3 media) and sensors by type: truth = what the scenario gave,\n"
+           "attributed = the daemon's raw rows. Times in ms.\n";
     char line[256];
     snprintf(line, sizeof(line), "%-10s %-28s %5s %9s %10s %8s %10s\n", "component", "application",
              "kind", "truth", "attributed", "truth en", "attributed");
