@@ -86,8 +86,7 @@ int64_t GpuLoadTruth::powerAt(int64_t megahertz) const {
 }
 
 void GpuLoadTruth::apply(const Scenario::Step& step, fake::FakeKernelDriver& driver) {
-    driver.addGpuResidency(static_cast<int64_t>(step.frequency) * 1000000, step.value * 1000LL,
-                           0);
+    driver.addGpuResidency(static_cast<int64_t>(step.frequency) * 1000000, step.value * 1000LL, 0);
     Figures& f = mTruth[step.text];
     f.busyMs += step.value;
     f.energy += step.value * powerAt(step.frequency) / 1000;
@@ -134,8 +133,8 @@ std::string GpuLoadTruth::report(const std::string& databasePath) const {
         if (tf.busyMs == 0 && af.busyMs == 0 && af.energy == 0) {
             continue;
         }
-        snprintf(line, sizeof(line), "%-10s %-28s %9lld %10lld %8lld %10lld\n", "gpu",
-                 name.c_str(), static_cast<long long>(tf.busyMs), static_cast<long long>(af.busyMs),
+        snprintf(line, sizeof(line), "%-10s %-28s %9lld %10lld %8lld %10lld\n", "gpu", name.c_str(),
+                 static_cast<long long>(tf.busyMs), static_cast<long long>(af.busyMs),
                  static_cast<long long>(tf.energy), static_cast<long long>(af.energy));
         out << line;
     }

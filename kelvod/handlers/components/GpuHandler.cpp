@@ -28,14 +28,12 @@ constexpr uint32_t kClassFrequency = 903009030;
 constexpr int32_t kResultGroups = 5;
 
 const column_attribute kRawApplicationsColumns[] = {
-    {COLUMN_TIME, "start_time"},      {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "name"},            {COLUMN_INT, "duration"},
-    {COLUMN_LONG, "usage"},           {COLUMN_LONG, "energy"},
-    {COLUMN_INT, "charge_duration"},  {COLUMN_LONG, "charge_usage"},
-    {COLUMN_LONG, "charge_energy"},
+    {COLUMN_TIME, "start_time"},     {COLUMN_TIME, "end_time"},     {COLUMN_TEXT, "name"},
+    {COLUMN_INT, "duration"},        {COLUMN_LONG, "usage"},        {COLUMN_LONG, "energy"},
+    {COLUMN_INT, "charge_duration"}, {COLUMN_LONG, "charge_usage"}, {COLUMN_LONG, "charge_energy"},
 };
 const column_attribute kHourlyApplicationsColumns[] = {
-    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},    {COLUMN_INT, "duration"},
+    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},   {COLUMN_INT, "duration"},
     {COLUMN_LONG, "usage"},     {COLUMN_LONG, "energy"},
 };
 const column_attribute kHourlyComponentColumns[] = {
@@ -105,10 +103,10 @@ void GpuHandler::cleanTables(int64_t time) {
 void GpuHandler::setupListeners(Parcel& out) {
     // Charger, clock, thermal, balance and shut-down all arrive as polls.
     static const int32_t kNotifications[] = {
-        NOTIFICATION_FOREGROUND_CHANGED,      NOTIFICATION_SCREEN_STATE_CHANGED,
-        NOTIFICATION_DATA_POLLING,            NOTIFICATION_APPLICATIONS_ACCOUNTING,
-        NOTIFICATION_COMPONENT_ACCOUNTING,    NOTIFICATION_HOURLY_UPLOADING,
-        NOTIFICATION_DAILY_UPLOADING,         NOTIFICATION_DAWN_UPLOADING,
+        NOTIFICATION_FOREGROUND_CHANGED,   NOTIFICATION_SCREEN_STATE_CHANGED,
+        NOTIFICATION_DATA_POLLING,         NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING, NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_DAILY_UPLOADING,      NOTIFICATION_DAWN_UPLOADING,
     };
     for (int32_t type : kNotifications) {
         addNotifierListener(type, out);
@@ -133,14 +131,9 @@ int32_t GpuHandler::readFrequency(int64_t time) {
     gpu_info_t info;
     int ret = KelvoDevice::getGpuInfo(&info);
     if (ret < 0) {
-        // The device refused a count outside 0..20 itself.
+        // A count outside 0..20 is refused by the device wrapper (-2).
         KLOGE("Failed to get gpu data: %d", ret);
         return -18;
-    }
-    if (info.count > KelvoDevice::kMaxGpuSteps) {
-        HealthCounters::add(Health::DeviceAnswersRefused);
-        KLOGE("Invalid gpu frequency count: %d", static_cast<int>(info.count));
-        return -2;
     }
     std::vector<gpu_freq_entry_t> steps;
     for (int32_t i = 0; i < info.count; ++i) {

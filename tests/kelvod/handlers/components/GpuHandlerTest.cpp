@@ -40,7 +40,9 @@ constexpr int64_t kLow = 260000000, kHigh = 480000000;
 class Poller : public KelvoOperator {
 public:
     Poller() : KelvoOperator("GpuPoller", -1, 0) {}
-    void setupListeners(Parcel& out) override { addNotifierListener(NOTIFICATION_HOURLY_TICK, out); }
+    void setupListeners(Parcel& out) override {
+        addNotifierListener(NOTIFICATION_HOURLY_TICK, out);
+    }
     int32_t onHourlyTick(const Parcel& data) override {
         PollingPayload poll;
         poll.reason = POLLING_HOURLY_TICK;
@@ -133,8 +135,9 @@ protected:
             waitFor([&] { return rows(ticks).size() > before; }, std::chrono::milliseconds(15000)));
     }
     std::vector<std::string> charged() {
-        return rows("SELECT name, SUM(usage), SUM(energy) FROM raw_applications_gpu WHERE "
-                    "energy > 0 GROUP BY name");
+        return rows(
+            "SELECT name, SUM(usage), SUM(energy) FROM raw_applications_gpu WHERE "
+            "energy > 0 GROUP BY name");
     }
 
     Driver mDriver;
@@ -231,26 +234,34 @@ TEST_P(GpuReadingTest, ForegroundChangeSurvivesTheReading) {
 
 INSTANTIATE_TEST_SUITE_P(
     Readings, GpuReadingTest,
-    ::testing::Values(
-        ReadingCase{"count_21", [](Driver& d) { d.update([](auto& s) { s.gpuCount = 21; }); },
-                    {"com.b|1000|210"}, 1},
-        ReadingCase{"count_minus_1", [](Driver& d) { d.update([](auto& s) { s.gpuCount = -1; }); },
-                    {"com.b|1000|210"}, 1},
-        ReadingCase{"count_0", [](Driver& d) { d.update([](auto& s) { s.gpuCount = 0; }); },
-                    {"com.b|1000|210"}, 0},
-        ReadingCase{"device_fails",
-                    [](Driver& d) {
-                        d.failRequest(Driver::Device::Kelvo, KelvoDevice::kGetGpuInfo, EIO);
-                    },
-                    {"com.b|1000|210"}, 0},
-        ReadingCase{"bad_steps",
-                    [](Driver& d) {
-                        d.addGpuResidency(0, 1000000, 0);
-                        d.addGpuResidency(kHigh, -1, 0);
-                        d.addGpuResidency(kLow, 1000000, -1);
-                        d.addGpuResidency(360000000, 1000000, 0);
-                    },
-                    {"com.a|1000|160", "com.b|1000|210"}, 3}),
+    ::testing::Values(ReadingCase{"count_21",
+                                  [](Driver& d) { d.update([](auto& s) { s.gpuCount = 21; }); },
+                                  {"com.b|1000|210"},
+                                  1},
+                      ReadingCase{"count_minus_1",
+                                  [](Driver& d) { d.update([](auto& s) { s.gpuCount = -1; }); },
+                                  {"com.b|1000|210"},
+                                  1},
+                      ReadingCase{"count_0",
+                                  [](Driver& d) { d.update([](auto& s) { s.gpuCount = 0; }); },
+                                  {"com.b|1000|210"},
+                                  0},
+                      ReadingCase{"device_fails",
+                                  [](Driver& d) {
+                                      d.failRequest(Driver::Device::Kelvo, KelvoDevice::kGetGpuInfo,
+                                                    EIO);
+                                  },
+                                  {"com.b|1000|210"},
+                                  0},
+                      ReadingCase{"bad_steps",
+                                  [](Driver& d) {
+                                      d.addGpuResidency(0, 1000000, 0);
+                                      d.addGpuResidency(kHigh, -1, 0);
+                                      d.addGpuResidency(kLow, 1000000, -1);
+                                      d.addGpuResidency(360000000, 1000000, 0);
+                                  },
+                                  {"com.a|1000|160", "com.b|1000|210"},
+                                  3}),
     [](const ::testing::TestParamInfo<ReadingCase>& i) { return i.param.name; });
 
 }  // namespace
