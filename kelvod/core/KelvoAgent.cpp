@@ -22,6 +22,7 @@
 #include "handlers/components/DisplayHandler.h"
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
+#include "handlers/components/GpuHandler.h"
 #include "handlers/components/WifiHandler.h"
 #include "handlers/components/SensorHandler.h"
 #include "handlers/SystemHandler.h"
@@ -83,6 +84,10 @@ android::sp<KelvoOperator> makeSensorHandler() {
     return new SensorHandler();
 }
 
+android::sp<KelvoOperator> makeGpuHandler() {
+    return new GpuHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -112,6 +117,7 @@ struct Factories {
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
         handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
         handlers[HANDLER_SENSOR] = &makeSensorHandler;
+        handlers[HANDLER_GPU] = &makeGpuHandler;
     }
 
     std::mutex lock;

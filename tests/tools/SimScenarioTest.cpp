@@ -58,6 +58,7 @@ const Refusal kRefusals[] = {
     {"discovery without its requester", "at 5 bluetooth discovery start", "bluetooth discovery"},
     {"sensor of an undeclared pid", "at 5 sensor enable 999 1 c1", "pid 999 is not declared"},
     {"sensor enabled for every type", "at 5 sensor enable 2001 -1 c1", "sensor enable|disable"},
+    {"gpu busy time below 0", "at 5 gpu com.example.mail 480 -1", "gpu <package> <MHz> <busy ms>"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

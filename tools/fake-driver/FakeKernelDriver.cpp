@@ -271,6 +271,18 @@ void FakeKernelDriver::serveConnection(int fd, Device device) {
     }
 }
 
+void FakeKernelDriver::addGpuResidency(int64_t frequency, int64_t busyUs, int64_t idleUs) {
+    std::lock_guard<std::mutex> guard(mLock);
+    for (GpuStep& step : mState.gpuSteps) {
+        if (step.frequency == frequency) {
+            step.busyUs += busyUs;
+            step.idleUs += idleUs;
+            return;
+        }
+    }
+    mState.gpuSteps.push_back({frequency, busyUs, idleUs});
+}
+
 FakeKernelDriver::Answer FakeKernelDriver::answer(Device device, uint32_t request,
                                                   std::vector<uint8_t>* argument) {
     return device == Device::Kelvo ? answerKelvo(request, argument)
@@ -295,6 +307,7 @@ FakeKernelDriver::Answer FakeKernelDriver::answerKelvo(uint32_t request,
                 int64_t fields[3] = {s.frequency, s.busyUs, s.idleUs};
                 putBytes(argument, 4 + i * sizeof(fields), fields, sizeof(fields));
             }
+            mState.gpuSteps.clear();
             return Answer();
         }
         case KelvoDevice::kGetProcessName: {

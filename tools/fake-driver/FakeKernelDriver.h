@@ -60,6 +60,9 @@ public:
     struct State {
         // "/dev/kelvo"
         std::map<uint32_t, bool> flags;  // the switch requests, by number
+        // The GPU residency gathered since the previous read, per frequency
+        // step: a read reports it and clears it (the kernel's counters are
+        // read-and-clear), so each read gives the increments since the last.
         std::vector<GpuStep> gpuSteps;
         std::optional<int32_t> gpuCount;  // reported instead of the steps' number
         // The advanced brightness of the span since the previous read: each
@@ -119,6 +122,10 @@ public:
     // lock; it must not call back into the driver.
     using BrightnessSource = std::function<uint32_t()>;
     void setBrightnessSource(BrightnessSource source);
+
+    // Adds busy and idle time at one frequency to the residency the next
+    // read reports (a new step is appended).
+    void addGpuResidency(int64_t frequency, int64_t busyUs, int64_t idleUs);
 
 private:
     struct Answer {

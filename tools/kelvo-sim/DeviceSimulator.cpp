@@ -219,6 +219,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     AudioModel::readProfile(config, &audioProfile);
     mAudio.reset(new AudioModel(mScenario, audioProfile));
     mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
+    mGpu.reset(new GpuLoadTruth(config));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -388,6 +389,14 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             if (!mTraffic->write()) {
                 fprintf(stderr, "kelvo-sim: cannot rewrite the traffic files: %s\n",
                         strerror(errno));
+            }
+            return;
+        }
+        case Scenario::Action::Gpu: {
+            // Residency the daemon reads from the kernel driver: no record.
+            std::lock_guard<std::mutex> lock(mLock);
+            if (mDriver) {
+                mGpu->apply(step, *mDriver);
             }
             return;
         }
@@ -646,6 +655,7 @@ int DeviceSimulator::finish(bool completed) {
             mRadioSensors->setAudio(package, figures.ms, figures.energyNumerator / 1000.0);
         }
         components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
+        components += mGpu->report(SimReport::databasePath(mOptions.root));
     }
     report.addSection(components);
     BatteryReport::Model battery;

@@ -14,6 +14,7 @@
 #include "SystemScene.h"
 #include "TrafficModel.h"
 #include "WifiRecords.h"
+#include "GpuLoadTruth.h"
 #include "RadioSensorTruth.h"
 
 namespace kelvo {
@@ -421,6 +422,12 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
             return false;
         }
     } else if (int32_t parsed = RadioSensorTruth::parseStep(words, step, reason); parsed <= 0) {
+        if (parsed == 0) {
+            parsed = GpuLoadTruth::parseStep(words, step, reason);
+        }
+        if (parsed == 1) {
+            return true;
+        }
         if (parsed == 0) {
             *reason = "unknown verb \"" + verb + "\"";
         }
