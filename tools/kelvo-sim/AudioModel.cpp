@@ -10,6 +10,8 @@ namespace {
 
 constexpr int32_t kStreams = 13;
 constexpr const char* kCallPackage = "com.android.incallui";
+constexpr uint32_t kSpeaker = 0x2;
+constexpr uint32_t kBuiltIn = 0x3;
 
 bool toInt(const std::string& word, int64_t low, int64_t high, int32_t* out) {
     char* end = nullptr;
@@ -132,6 +134,19 @@ int32_t AudioModel::power(uint32_t device, int32_t volume) const {
     return static_cast<int32_t>(p);
 }
 
+int32_t AudioModel::callStream() const {
+    return mCallState == 1 ? 2 : 0;
+}
+
+bool AudioModel::builtInInUse() const {
+    for (const auto& entry : mSessions) {
+        if (entry.second.reference > 0 && (mDevice[entry.second.stream] & kBuiltIn) != 0) {
+            return true;
+        }
+    }
+    return mCallState != 0 && (mDevice[callStream()] & kBuiltIn) != 0;
+}
+
 void AudioModel::advanceTo(int64_t ms) {
     const int64_t dt = ms - mNowMs;
     if (dt <= 0) {
@@ -151,7 +166,7 @@ void AudioModel::advanceTo(int64_t ms) {
         }
     }
     if (mCallState != 0) {
-        book(kCallPackage, mCallState == 1 ? 2 : 0);
+        book(kCallPackage, callStream());
     }
 }
 
@@ -200,7 +215,14 @@ bool AudioModel::apply(const Scenario::Step& step, std::string* tag, std::string
                                      : "KELVO_TAG_AUDIO_SESSION_STOP";
         *text = session + " stream=" + std::to_string(b);
     } else if (what == "audio device") {
-        mDevice[a] = static_cast<uint32_t>(b);
+        // The phone records the loudspeaker alone as the whole built-in
+        // output while nothing plays on it: what starts there later is
+        // charged both outputs' power.
+        uint32_t device = static_cast<uint32_t>(b);
+        if (device == kSpeaker && !builtInInUse()) {
+            device = kBuiltIn;
+        }
+        mDevice[a] = device;
         *tag = "KELVO_TAG_AUDIO_DEVICE";
         *text = "stream=" + std::to_string(a) + " device=" + std::to_string(b);
     } else {

@@ -56,6 +56,10 @@ private:
     };
 
     int32_t power(uint32_t device, int32_t volume) const;
+    // The stream the call plays on while ringing or off-hook.
+    int32_t callStream() const;
+    // Whether a playing session or the call uses the earpiece or loudspeaker.
+    bool builtInInUse() const;
 
     const Scenario& mScenario;
     Profile mProfile;
