@@ -24,6 +24,7 @@
 #include "handlers/components/GnssHandler.h"
 #include "handlers/components/WifiHandler.h"
 #include "handlers/components/SensorHandler.h"
+#include "handlers/components/CameraHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -83,6 +84,10 @@ android::sp<KelvoOperator> makeSensorHandler() {
     return new SensorHandler();
 }
 
+android::sp<KelvoOperator> makeCameraHandler() {
+    return new CameraHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -112,6 +117,7 @@ struct Factories {
         routines[ROUTINE_ABNORMALITY] = &makeAbnormalityRoutine;
         handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
         handlers[HANDLER_SENSOR] = &makeSensorHandler;
+        handlers[HANDLER_CAMERA] = &makeCameraHandler;
     }
 
     std::mutex lock;
