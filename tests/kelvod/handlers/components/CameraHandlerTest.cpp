@@ -1,0 +1,250 @@
+// The camera handler end to end: connection records (through the log device
+// or straight to the handler), the flashlight handler learning the camera's
+// user, the accounting library with the sample profile, rows and uploads.
+
+#include <binder/ServiceControl.h>
+#include <gtest/gtest.h>
+#include <json/json.h>
+
+#include <map>
+#include <memory>
+#include <sstream>
+#include <string>
+#include <vector>
+
+#include "PlatformServices.h"
+#include "binder/managers/PackageManager.h"
+#include "core/AppsAccounting.h"
+#include "core/Dispatcher.h"
+#include "core/KelvoAgent.h"
+#include "core/KelvoLibAgent.h"
+#include "core/Notifier.h"
+#include "handlers/components/CameraHandler.h"
+#include "handlers/components/FlashlightHandler.h"
+#include "kelvo/LogWriter.h"
+#include "kelvo/RootPath.h"
+#include "kelvo/WallClock.h"
+#include "kelvod/storage/StorageTestUtil.h"
+#include "routines/HourlyRoutine.h"
+#include "storage/DataUploader.h"
+#include "utils/XmlParser.h"
+
+using android::Parcel;
+using android::sp;
+using namespace kelvo;
+using kelvo::test::waitFor;
+
+namespace {
+
+constexpr int64_t kHour = 3600000;
+constexpr int64_t kH = 1796515200000LL + 10 * kHour;  // 2026-12-06 10:00 UTC
+constexpr int64_t kT = kH - 20 * 60000;
+
+struct CameraCase {
+    const char* name;
+    bool viaDevice;
+    // "TAG[:code] text" (TAG one of C F U I D, the expected return code
+    // when not 0), "vmdied", "on" or "off" (the flashlight); a second apart.
+    std::vector<std::string> steps;
+    // "second|name|state|type|width|height" state rows, then "second|intent".
+    std::vector<std::string> states;
+    std::vector<std::string> intents;
+    // "f|name|ms" or "r|name|ms" charged per camera; then the flashlight rows.
+    std::vector<std::string> charged;
+    std::vector<std::string> flashlight;
+    friend void PrintTo(const CameraCase& c, std::ostream* os) { *os << c.name; }
+};
+
+class CameraTest : public kelvo::test::AgentStorageTest,
+                   public ::testing::WithParamInterface<CameraCase> {
+protected:
+    void addTables() override {
+        WallClock::setFixedTimeMs(kT);
+        mRoot->writeFile("/data/misc/kelvo/tv_kelvo_config.xml",
+                         kelvo::test::readHostFile(KELVO_SAMPLE_CONFIG));
+        XmlParser::resetInstance();
+        KelvoLibAgent::getInstance()->resetAccountersForTest();
+        KelvoLibAgent::getInstance()->start(0);
+        Dispatcher::resetForTest();
+        HourlyRoutine::setVoteTimeoutMs(0);
+        ServiceControl::setServiceWaitMs(300);
+        mServices.reset(new PlatformServices());
+        ASSERT_EQ(android::NO_ERROR, mServices->startAll());
+        mRoutine = new HourlyRoutine();
+        mCamera = new CameraHandler();
+        mFlash = new FlashlightHandler();
+        for (StorageOperator* op : {static_cast<StorageOperator*>(mRoutine.get()),
+                                    static_cast<StorageOperator*>(mCamera.get()),
+                                    static_cast<StorageOperator*>(mFlash.get()),
+                                    static_cast<StorageOperator*>(AppsAccounting::getInstance()),
+                                    static_cast<StorageOperator*>(DataUploader::getInstance())}) {
+            op->addSchemaTable();
+        }
+    }
+    void SetUp() override {
+        kelvo::test::AgentStorageTest::SetUp();
+        mRoutine->earlyInitialize();
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, mRoutine);
+        KelvoAgent::getInstance()->setHandlerForTest(HANDLER_FLASHLIGHT, mFlash);
+        mRoutine->initialize();
+        for (KelvoOperator* op : {static_cast<KelvoOperator*>(mCamera.get()),
+                                  static_cast<KelvoOperator*>(mFlash.get())}) {
+            ASSERT_EQ(0, op->earlyInitialize());
+            op->initialize();
+        }
+        ASSERT_EQ(0, Dispatcher::getInstance()->startDispatchMessage());
+        mWriter.reset(new LogWriter(RootPath::resolve(KELVO_LOG_DEVICE)));
+    }
+    void TearDown() override {
+        mWriter.reset();
+        Dispatcher::resetForTest();
+        for (const sp<KelvoOperator>& op :
+             std::vector<sp<KelvoOperator>>{mRoutine.get(), mCamera.get(), mFlash.get()}) {
+            op->readyToDestroy();
+            op->requestThreadExit();
+            op->join();
+        }
+        KelvoAgent::getInstance()->setRoutineForTest(ROUTINE_HOURLY, nullptr);
+        KelvoAgent::getInstance()->setHandlerForTest(HANDLER_FLASHLIGHT, nullptr);
+        AppsAccounting::getInstance()->balanceAccount();
+        KelvoLibAgent::getInstance()->resetAccountersForTest();
+        XmlParser::resetInstance();
+        WallClock::setFixedTimeMs(-1);
+        mServices.reset();
+        EXPECT_TRUE(waitFor([] { return !PackageManager::getInstance()->isConnected(); }));
+        ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
+        kelvo::test::AgentStorageTest::TearDown();
+    }
+    void notify(KelvoOperator* op, int32_t type, int64_t time) {
+        Parcel p;
+        p.writeInt64(time);
+        op->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, p));
+    }
+    size_t cameraRows() {
+        return rows("SELECT 1 FROM raw_camera_state UNION ALL SELECT 1 FROM "
+                    "raw_camera_capture_intent")
+            .size();
+    }
+    void play(const CameraCase& c) {
+        static const std::map<char, std::pair<const char*, int32_t>> kTags = {
+            {'C', {"KELVO_TAG_CAMERA_CONNECT", CameraHandler::TAG_CONNECT}},
+            {'F', {"KELVO_TAG_CAMERA_CONFIG", CameraHandler::TAG_CONFIG}},
+            {'U', {"KELVO_TAG_CAMERA_UNCONFIG", CameraHandler::TAG_UNCONFIG}},
+            {'I', {"KELVO_TAG_CAMERA_CAPTURE_INTENT", CameraHandler::TAG_CAPTURE_INTENT}},
+            {'D', {"KELVO_TAG_CAMERA_DISCONNECT", CameraHandler::TAG_DISCONNECT}},
+        };
+        int64_t t = kT;
+        for (const std::string& step : c.steps) {
+            t += 1000;
+            std::istringstream in(step);
+            std::string word, text;
+            in >> word;
+            std::getline(in >> std::ws, text);
+            if (word == "vmdied") {
+                notify(mCamera.get(), NOTIFICATION_VM_DIED, t);
+            } else if (word == "on" || word == "off") {
+                Parcel body;
+                body.writeInt64(t);
+                body.writeCString("");
+                mFlash->sendMessageSync(
+                    ParcelMessage(MESSAGE_LOGGER, word == "on" ? 1 : 0, body));
+            } else if (c.viaDevice) {
+                // Every step of a device case writes a row: wait for it.
+                const size_t before = cameraRows();
+                ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, kTags.at(word[0]).first,
+                                            text.c_str(), t));
+                ASSERT_TRUE(waitFor([&] { return cameraRows() > before; })) << step;
+            } else {
+                Parcel body;
+                body.writeInt64(t);
+                body.writeCString(text.c_str());
+                const int32_t code = word.size() > 2 ? std::stoi(word.substr(2)) : 0;
+                EXPECT_EQ(code, mCamera->sendMessageSync(ParcelMessage(
+                                    MESSAGE_LOGGER, kTags.at(word[0]).second, body)))
+                    << step;
+            }
+        }
+        notify(mCamera.get(), NOTIFICATION_FORCE_BALANCE, t + 60000);
+    }
+    std::vector<std::string> since(const char* columns, const char* table) {
+        return rows("SELECT (timestamp - " + std::to_string(kT) + ") / 1000, " + columns +
+                    " FROM " + table + " ORDER BY rowid");
+    }
+
+    sp<HourlyRoutine> mRoutine;
+    sp<CameraHandler> mCamera;
+    sp<FlashlightHandler> mFlash;
+    std::unique_ptr<LogWriter> mWriter;
+    std::unique_ptr<PlatformServices> mServices;
+};
+
+const char* kChargedSql =
+    "SELECT 'f', name, SUM(background_duration) FROM raw_applications_front_camera GROUP BY name "
+    "UNION ALL SELECT 'r', name, SUM(background_duration) FROM raw_applications_rear_camera "
+    "GROUP BY name";
+
+TEST_P(CameraTest, ConnectionsAreRecordedAndCharged) {
+    const CameraCase& c = GetParam();
+    play(c);
+    EXPECT_TRUE(waitFor([&] { return rows(kChargedSql) == c.charged; }));
+    EXPECT_EQ(c.charged, rows(kChargedSql));
+    EXPECT_EQ(c.states, since("name, state, type, width, height", "raw_camera_state"));
+    EXPECT_EQ(c.intents, since("intent", "raw_camera_capture_intent"));
+    EXPECT_EQ(c.flashlight, since("name, state", "raw_flashlight_state"));
+}
+
+#define CAM "C id=0 name=com.cam"
+#define HD "width=1920 height=1080"
+INSTANTIATE_TEST_SUITE_P(
+    Steps, CameraTest,
+    ::testing::Values(
+        CameraCase{"rear_single",
+                   true,
+                   {CAM, "F dual=0 type=0 " HD, "on", "I intent=16", "I intent=17", "off", "D"},
+                   {"2|com.cam|1|0|1920|1080", "7|com.cam|0|0|1920|1080"},
+                   {"1|11", "4|16", "5|17", "7|10"},
+                   {"r|com.cam|5000"},
+                   {"3|com.cam|1", "6|com.cam|0"}},
+        // Dropping the second stream falls back to the first alone; dropping
+        // the first ends the charge until it comes back. The accounter
+        // reports under the camera of the last stream it was given.
+        CameraCase{"dual_and_both_unconfigures",
+                   false,
+                   {"C id=1 name=com.d", "F dual=1 type=1 " HD, "F dual=1 type=2 width=640 height=480",
+                    "U type=2", "U type=1", "F dual=1 type=1 " HD, "D"},
+                   {"3|com.d|1|1|1920|1080", "3|com.d|1|2|640|480", "4|com.d|1|1|1920|1080",
+                    "5|com.d|2|-1|0|0", "7|com.d|0|1|1920|1080", "7|com.d|0|2|0|0"},
+                   {"1|11"},
+                   {"f|com.d|2000"},
+                   {}},
+        // A lost disconnect: the next connect ends the old charge.
+        CameraCase{"connect_while_connected",
+                   false,
+                   {CAM, "F dual=0 type=0 " HD, "C id=1 name=com.b", "F dual=0 type=1 " HD, "D"},
+                   {"2|com.cam|1|0|1920|1080", "3|com.cam|0|0|1920|1080", "4|com.b|1|1|1920|1080",
+                    "5|com.b|0|1|1920|1080"},
+                   {"1|11", "3|10", "3|11", "5|10"},
+                   {"f|com.b|1000", "r|com.cam|1000"},
+                   {}},
+        // Refused configurations change nothing.
+        CameraCase{"refused_configurations",
+                   false,
+                   {"F:-3 dual=0 type=0 " HD, "C:-19 id=x name=com.x", CAM,
+                    "F:-19 dual=0 type=0 width=1920", "F:-19 dual=0 type=0 width=-1 height=5",
+                    "F:-3 dual=1 type=-1 " HD, "F:-3 dual=1 type=4 " HD, "F:-3 dual=0 type=2 " HD,
+                    "F:-3 dual=2 type=0 " HD, "I:-19 intent=abc", "D"},
+                   {"11|com.cam|0|-1|0|0"},
+                   {"3|11"},
+                   {},
+                   {}},
+        // After the framework's death the open camera is charged again.
+        CameraCase{"vm_death_then_again",
+                   false,
+                   {CAM, "F dual=0 type=0 " HD, "vmdied", "D"},
+                   {"2|com.cam|1|0|1920|1080", "4|com.cam|0|0|1920|1080"},
+                   {"1|11", "4|10"},
+                   {"r|com.cam|2000"},
+                   {}}),
+    [](const ::testing::TestParamInfo<CameraCase>& info) { return info.param.name; });
+
+}  // namespace
