@@ -41,8 +41,8 @@ const table_attribute kRearHourlyComponent = {"1.0", 1, kFamilyHourlyComponentCo
                                               "hourly_component_rear_camera"};
 
 const column_attribute kStateColumns[] = {
-    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},  {COLUMN_INT, "state"},
-    {COLUMN_INT, "type"},       {COLUMN_INT, "width"},  {COLUMN_INT, "height"},
+    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"}, {COLUMN_INT, "state"},
+    {COLUMN_INT, "type"},       {COLUMN_INT, "width"}, {COLUMN_INT, "height"},
 };
 const column_attribute kIntentColumns[] = {
     {COLUMN_TIME, "timestamp"},
@@ -211,8 +211,8 @@ int32_t CameraHandler::handleIntent(int64_t time, const char* text) {
 
 int32_t CameraHandler::handleConfig(int64_t time, int32_t tag, const char* text) {
     connection next = mConnection;
-    int32_t ret = tag == TAG_CONFIG ? parseConfig(time, text, &next)
-                                    : parseUnconfig(time, text, &next);
+    int32_t ret =
+        tag == TAG_CONFIG ? parseConfig(time, text, &next) : parseUnconfig(time, text, &next);
     if (ret < 0) {
         HealthCounters::add(Health::LoggerMessageRefused);
         KLOGE("Failed to save %s message parameter: %d", tag == TAG_CONFIG ? "config" : "unconfig",
@@ -370,11 +370,12 @@ int32_t CameraHandler::sendAction(int32_t action, int64_t time) {
         KLOGE("Invalid action: %d", action);
         return -3;
     }
-    KLOGD("timestamp(%lld) Action(%d) mode(%d) name(%s) width_1(%d) height_1(%d) width_2(%d) "
-          "height_2(%d)",
-          static_cast<long long>(time), action, mConnection.mode, mConnection.name.c_str(),
-          mConnection.first.width, mConnection.first.height, mConnection.second.width,
-          mConnection.second.height);
+    KLOGD(
+        "timestamp(%lld) Action(%d) mode(%d) name(%s) width_1(%d) height_1(%d) width_2(%d) "
+        "height_2(%d)",
+        static_cast<long long>(time), action, mConnection.mode, mConnection.name.c_str(),
+        mConnection.first.width, mConnection.first.height, mConnection.second.width,
+        mConnection.second.height);
     return ret;
 }
 

@@ -55,8 +55,7 @@ struct CameraCase {
     friend void PrintTo(const CameraCase& c, std::ostream* os) { *os << c.name; }
 };
 
-class CameraTest : public kelvo::test::AgentStorageTest,
-                   public ::testing::WithParamInterface<CameraCase> {
+class CameraFixture : public kelvo::test::AgentStorageTest {
 protected:
     void addTables() override {
         WallClock::setFixedTimeMs(kT);
@@ -121,9 +120,18 @@ protected:
         op->sendMessageSync(ParcelMessage(MESSAGE_NOTIFICATION, type, p));
     }
     size_t cameraRows() {
-        return rows("SELECT 1 FROM raw_camera_state UNION ALL SELECT 1 FROM "
-                    "raw_camera_capture_intent")
+        return rows(
+                   "SELECT 1 FROM raw_camera_state UNION ALL SELECT 1 FROM "
+                   "raw_camera_capture_intent")
             .size();
+    }
+    void tick(int64_t hour) {
+        const std::string ticks = "SELECT id FROM debug_hourly_tick";
+        const size_t before = rows(ticks).size();
+        WallClock::setFixedTimeMs(hour + 500);
+        mRoutine->sendMessage(ParcelMessage(MESSAGE_TIMER, HourlyRoutine::kHourlyTimerId));
+        ASSERT_TRUE(
+            waitFor([&] { return rows(ticks).size() > before; }, std::chrono::milliseconds(15000)));
     }
     void play(const CameraCase& c) {
         static const std::map<char, std::pair<const char*, int32_t>> kTags = {
@@ -146,8 +154,7 @@ protected:
                 Parcel body;
                 body.writeInt64(t);
                 body.writeCString("");
-                mFlash->sendMessageSync(
-                    ParcelMessage(MESSAGE_LOGGER, word == "on" ? 1 : 0, body));
+                mFlash->sendMessageSync(ParcelMessage(MESSAGE_LOGGER, word == "on" ? 1 : 0, body));
             } else if (c.viaDevice) {
                 // Every step of a device case writes a row: wait for it.
                 const size_t before = cameraRows();
@@ -159,8 +166,8 @@ protected:
                 body.writeInt64(t);
                 body.writeCString(text.c_str());
                 const int32_t code = word.size() > 2 ? std::stoi(word.substr(2)) : 0;
-                EXPECT_EQ(code, mCamera->sendMessageSync(ParcelMessage(
-                                    MESSAGE_LOGGER, kTags.at(word[0]).second, body)))
+                EXPECT_EQ(code, mCamera->sendMessageSync(
+                                    ParcelMessage(MESSAGE_LOGGER, kTags.at(word[0]).second, body)))
                     << step;
             }
         }
@@ -177,6 +184,8 @@ protected:
     std::unique_ptr<LogWriter> mWriter;
     std::unique_ptr<PlatformServices> mServices;
 };
+
+class CameraTest : public CameraFixture, public ::testing::WithParamInterface<CameraCase> {};
 
 const char* kChargedSql =
     "SELECT 'f', name, SUM(background_duration) FROM raw_applications_front_camera GROUP BY name "
@@ -197,54 +206,92 @@ TEST_P(CameraTest, ConnectionsAreRecordedAndCharged) {
 #define HD "width=1920 height=1080"
 INSTANTIATE_TEST_SUITE_P(
     Steps, CameraTest,
-    ::testing::Values(
-        CameraCase{"rear_single",
-                   true,
-                   {CAM, "F dual=0 type=0 " HD, "on", "I intent=16", "I intent=17", "off", "D"},
-                   {"2|com.cam|1|0|1920|1080", "7|com.cam|0|0|1920|1080"},
-                   {"1|11", "4|16", "5|17", "7|10"},
-                   {"r|com.cam|5000"},
-                   {"3|com.cam|1", "6|com.cam|0"}},
-        // Dropping the second stream falls back to the first alone; dropping
-        // the first ends the charge until it comes back. The accounter
-        // reports under the camera of the last stream it was given.
-        CameraCase{"dual_and_both_unconfigures",
-                   false,
-                   {"C id=1 name=com.d", "F dual=1 type=1 " HD, "F dual=1 type=2 width=640 height=480",
-                    "U type=2", "U type=1", "F dual=1 type=1 " HD, "D"},
-                   {"3|com.d|1|1|1920|1080", "3|com.d|1|2|640|480", "4|com.d|1|1|1920|1080",
-                    "5|com.d|2|-1|0|0", "7|com.d|0|1|1920|1080", "7|com.d|0|2|0|0"},
-                   {"1|11"},
-                   {"f|com.d|2000"},
-                   {}},
-        // A lost disconnect: the next connect ends the old charge.
-        CameraCase{"connect_while_connected",
-                   false,
-                   {CAM, "F dual=0 type=0 " HD, "C id=1 name=com.b", "F dual=0 type=1 " HD, "D"},
-                   {"2|com.cam|1|0|1920|1080", "3|com.cam|0|0|1920|1080", "4|com.b|1|1|1920|1080",
-                    "5|com.b|0|1|1920|1080"},
-                   {"1|11", "3|10", "3|11", "5|10"},
-                   {"f|com.b|1000", "r|com.cam|1000"},
-                   {}},
-        // Refused configurations change nothing.
-        CameraCase{"refused_configurations",
-                   false,
-                   {"F:-3 dual=0 type=0 " HD, "C:-19 id=x name=com.x", CAM,
-                    "F:-19 dual=0 type=0 width=1920", "F:-19 dual=0 type=0 width=-1 height=5",
-                    "F:-3 dual=1 type=-1 " HD, "F:-3 dual=1 type=4 " HD, "F:-3 dual=0 type=2 " HD,
-                    "F:-3 dual=2 type=0 " HD, "I:-19 intent=abc", "D"},
-                   {"11|com.cam|0|-1|0|0"},
-                   {"3|11"},
-                   {},
-                   {}},
-        // After the framework's death the open camera is charged again.
-        CameraCase{"vm_death_then_again",
-                   false,
-                   {CAM, "F dual=0 type=0 " HD, "vmdied", "D"},
-                   {"2|com.cam|1|0|1920|1080", "4|com.cam|0|0|1920|1080"},
-                   {"1|11", "4|10"},
-                   {"r|com.cam|2000"},
-                   {}}),
+    ::testing::Values(CameraCase{"rear_single",
+                                 true,
+                                 {CAM, "F dual=0 type=0 " HD, "on", "I intent=16", "I intent=17",
+                                  "off", "D"},
+                                 {"2|com.cam|1|0|1920|1080", "7|com.cam|0|0|1920|1080"},
+                                 {"1|11", "4|16", "5|17", "7|10"},
+                                 {"r|com.cam|5000"},
+                                 {"3|com.cam|1", "6|com.cam|0"}},
+                      // An unknown stream changes nothing; dropping the second stream falls back to
+                      // the first alone; dropping the first ends the charge until it comes back.
+                      // The accounter reports under the camera of the last stream it was given.
+                      CameraCase{
+                          "dual_and_both_unconfigures",
+                          false,
+                          {"C id=1 name=com.d", "F dual=1 type=1 " HD,
+                           "F dual=1 type=2 width=640 height=480", "U type=3", "U type=2",
+                           "U type=1", "F dual=1 type=1 " HD, "D"},
+                          {"3|com.d|1|1|1920|1080", "3|com.d|1|2|640|480", "4|com.d|1|1|1920|1080",
+                           "4|com.d|1|2|640|480", "5|com.d|1|1|1920|1080", "6|com.d|2|-1|0|0",
+                           "8|com.d|0|1|1920|1080", "8|com.d|0|2|0|0"},
+                          {"1|11"},
+                          {"f|com.d|3000"},
+                          {}},
+                      // A lost disconnect: the next connect ends the old charge.
+                      CameraCase{"connect_while_connected",
+                                 false,
+                                 {CAM, "F dual=0 type=0 " HD, "C id=1 name=com.b",
+                                  "F dual=0 type=1 " HD, "D"},
+                                 {"2|com.cam|1|0|1920|1080", "3|com.cam|0|0|1920|1080",
+                                  "4|com.b|1|1|1920|1080", "5|com.b|0|1|1920|1080"},
+                                 {"1|11", "3|10", "3|11", "5|10"},
+                                 {"f|com.b|1000", "r|com.cam|1000"},
+                                 {}},
+                      // Refused configurations change nothing.
+                      CameraCase{"refused_configurations",
+                                 false,
+                                 {"F:-3 dual=0 type=0 " HD, "C:-19 id=x name=com.x", CAM,
+                                  "F:-19 dual=0 type=0 width=1920",
+                                  "F:-19 dual=0 type=0 width=-1 height=5", "F:-3 dual=1 type=-1 " HD,
+                                  "F:-3 dual=1 type=4 " HD, "F:-3 dual=0 type=2 " HD,
+                                  "F:-3 dual=2 type=0 " HD, "I:-19 intent=abc", "D"},
+                                 {"11|com.cam|0|-1|0|0"},
+                                 {"3|11"},
+                                 {},
+                                 {}},
+                      // After the framework's death the open camera is charged again.
+                      CameraCase{"vm_death_then_again",
+                                 false,
+                                 {CAM, "F dual=0 type=0 " HD, "vmdied", "D"},
+                                 {"2|com.cam|1|0|1920|1080", "4|com.cam|0|0|1920|1080"},
+                                 {"1|11", "4|10"},
+                                 {"r|com.cam|2000"},
+                                 {}}),
     [](const ::testing::TestParamInfo<CameraCase>& info) { return info.param.name; });
+
+// Results by stream type: the front camera's rows and the rear's (second
+// streams included) go their own way through the hour and the upload.
+TEST_F(CameraFixture, ResultsAreStoredAndUploadedPerCamera) {
+    for (int32_t type : {1, 2, -1, 4}) {
+        Parcel result;
+        result.writeInt32(type);
+        result.writeInt64(kT);
+        result.writeInt64(kT + 60000);
+        result.writeString8(android::String8(type == 1 ? "com.f" : "com.r"));
+        for (int i = 0; i < 6; ++i) {
+            result.writeInt32(i == 1 ? 60000 / type : 0);
+            result.writeInt64(i == 1 ? 100 * type : 0);
+        }
+        EXPECT_EQ(type >= 0 && type <= 3 ? 0 : -3,
+                  mCamera->handleLibraryEvent(LIBRARY_EVENT_APPLICATION, result))
+            << type;
+    }
+    tick(kH);
+    const char* sql = "SELECT name, background_duration, background_energy FROM ";
+    EXPECT_EQ(std::vector<std::string>{"com.f|60000|100"},
+              rows(std::string(sql) + "hourly_applications_front_camera"));
+    EXPECT_EQ(std::vector<std::string>{"com.r|30000|200"},
+              rows(std::string(sql) + "hourly_applications_rear_camera"));
+    Json::Value p;
+    for (const Json::Value& e : events()) {
+        if (e["event"].asUInt() == EVENT_HOURLY_COMPONENTS) p = e["params"];
+    }
+    EXPECT_EQ(60000, p["14"]["params"]["7"].asInt64());
+    EXPECT_EQ("com.f", p["15"][0]["params"]["3"]["params"]["0"].asString());
+    EXPECT_EQ(30000, p["16"]["params"]["7"].asInt64());
+    EXPECT_EQ("com.r", p["17"][0]["params"]["3"]["params"]["0"].asString());
+}
 
 }  // namespace
