@@ -2,7 +2,6 @@
 // or straight to the handler), the flashlight handler learning the camera's
 // user, the accounting library with the sample profile, rows and uploads.
 
-#include <binder/ServiceControl.h>
 #include <gtest/gtest.h>
 #include <json/json.h>
 
@@ -12,8 +11,6 @@
 #include <string>
 #include <vector>
 
-#include "PlatformServices.h"
-#include "binder/managers/PackageManager.h"
 #include "core/AppsAccounting.h"
 #include "core/Dispatcher.h"
 #include "core/KelvoAgent.h"
@@ -46,12 +43,11 @@ struct CameraCase {
     // "TAG[:code] text" (TAG one of C F U I D, the expected return code
     // when not 0), "vmdied", "on" or "off" (the flashlight); a second apart.
     std::vector<std::string> steps;
-    // "second|name|state|type|width|height" state rows, then "second|intent".
-    std::vector<std::string> states;
-    std::vector<std::string> intents;
-    // "f|name|ms" or "r|name|ms" charged per camera; then the flashlight rows.
+    // Rows by second: "s|second|name|state|type|width|height" of the state,
+    // then "i|second|intent", then the flashlight's "l|second|name|state".
+    std::vector<std::string> rows;
+    // "f|name|ms" or "r|name|ms" charged per camera.
     std::vector<std::string> charged;
-    std::vector<std::string> flashlight;
     friend void PrintTo(const CameraCase& c, std::ostream* os) { *os << c.name; }
 };
 
@@ -66,9 +62,6 @@ protected:
         KelvoLibAgent::getInstance()->start(0);
         Dispatcher::resetForTest();
         HourlyRoutine::setVoteTimeoutMs(0);
-        ServiceControl::setServiceWaitMs(300);
-        mServices.reset(new PlatformServices());
-        ASSERT_EQ(android::NO_ERROR, mServices->startAll());
         mRoutine = new HourlyRoutine();
         mCamera = new CameraHandler();
         mFlash = new FlashlightHandler();
@@ -109,9 +102,6 @@ protected:
         KelvoLibAgent::getInstance()->resetAccountersForTest();
         XmlParser::resetInstance();
         WallClock::setFixedTimeMs(-1);
-        mServices.reset();
-        EXPECT_TRUE(waitFor([] { return !PackageManager::getInstance()->isConnected(); }));
-        ServiceControl::setServiceWaitMs(ServiceControl::kDefaultServiceWaitMs);
         kelvo::test::AgentStorageTest::TearDown();
     }
     void notify(KelvoOperator* op, int32_t type, int64_t time) {
@@ -134,13 +124,9 @@ protected:
             waitFor([&] { return rows(ticks).size() > before; }, std::chrono::milliseconds(15000)));
     }
     void play(const CameraCase& c) {
-        static const std::map<char, std::pair<const char*, int32_t>> kTags = {
-            {'C', {"KELVO_TAG_CAMERA_CONNECT", CameraHandler::TAG_CONNECT}},
-            {'F', {"KELVO_TAG_CAMERA_CONFIG", CameraHandler::TAG_CONFIG}},
-            {'U', {"KELVO_TAG_CAMERA_UNCONFIG", CameraHandler::TAG_UNCONFIG}},
-            {'I', {"KELVO_TAG_CAMERA_CAPTURE_INTENT", CameraHandler::TAG_CAPTURE_INTENT}},
-            {'D', {"KELVO_TAG_CAMERA_DISCONNECT", CameraHandler::TAG_DISCONNECT}},
-        };
+        // Tag indexes in the order of the letters.
+        static const char* kTags[] = {"CONNECT", "CONFIG", "UNCONFIG", "CAPTURE_INTENT",
+                                      "DISCONNECT"};
         int64_t t = kT;
         for (const std::string& step : c.steps) {
             t += 1000;
@@ -148,6 +134,7 @@ protected:
             std::string word, text;
             in >> word;
             std::getline(in >> std::ws, text);
+            const int32_t tag = static_cast<int32_t>(std::string("CFUID").find(word[0]));
             if (word == "vmdied") {
                 notify(mCamera.get(), NOTIFICATION_VM_DIED, t);
             } else if (word == "on" || word == "off") {
@@ -158,7 +145,8 @@ protected:
             } else if (c.viaDevice) {
                 // Every step of a device case writes a row: wait for it.
                 const size_t before = cameraRows();
-                ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO, kTags.at(word[0]).first,
+                ASSERT_EQ(0, mWriter->write(LogWriter::PRIORITY_INFO,
+                                            ("KELVO_TAG_CAMERA_" + std::string(kTags[tag])).c_str(),
                                             text.c_str(), t));
                 ASSERT_TRUE(waitFor([&] { return cameraRows() > before; })) << step;
             } else {
@@ -166,23 +154,30 @@ protected:
                 body.writeInt64(t);
                 body.writeCString(text.c_str());
                 const int32_t code = word.size() > 2 ? std::stoi(word.substr(2)) : 0;
-                EXPECT_EQ(code, mCamera->sendMessageSync(
-                                    ParcelMessage(MESSAGE_LOGGER, kTags.at(word[0]).second, body)))
+                EXPECT_EQ(code, mCamera->sendMessageSync(ParcelMessage(MESSAGE_LOGGER, tag, body)))
                     << step;
             }
         }
         notify(mCamera.get(), NOTIFICATION_FORCE_BALANCE, t + 60000);
     }
-    std::vector<std::string> since(const char* columns, const char* table) {
-        return rows("SELECT (timestamp - " + std::to_string(kT) + ") / 1000, " + columns +
-                    " FROM " + table + " ORDER BY rowid");
+    std::vector<std::string> stateRows() {
+        const std::string t = "', (timestamp - " + std::to_string(kT) + ") / 1000, ";
+        std::vector<std::string> out;
+        for (const std::string& q :
+             {"'s" + t + "name, state, type, width, height FROM raw_camera_state",
+              "'i" + t + "intent FROM raw_camera_capture_intent",
+              "'l" + t + "name, state FROM raw_flashlight_state"}) {
+            for (const std::string& row : rows("SELECT " + q + " ORDER BY rowid")) {
+                out.push_back(row);
+            }
+        }
+        return out;
     }
 
     sp<HourlyRoutine> mRoutine;
     sp<CameraHandler> mCamera;
     sp<FlashlightHandler> mFlash;
     std::unique_ptr<LogWriter> mWriter;
-    std::unique_ptr<PlatformServices> mServices;
 };
 
 class CameraTest : public CameraFixture, public ::testing::WithParamInterface<CameraCase> {};
@@ -197,68 +192,55 @@ TEST_P(CameraTest, ConnectionsAreRecordedAndCharged) {
     play(c);
     EXPECT_TRUE(waitFor([&] { return rows(kChargedSql) == c.charged; }));
     EXPECT_EQ(c.charged, rows(kChargedSql));
-    EXPECT_EQ(c.states, since("name, state, type, width, height", "raw_camera_state"));
-    EXPECT_EQ(c.intents, since("intent", "raw_camera_capture_intent"));
-    EXPECT_EQ(c.flashlight, since("name, state", "raw_flashlight_state"));
+    EXPECT_EQ(c.rows, stateRows());
 }
 
 #define CAM "C id=0 name=com.cam"
 #define HD "width=1920 height=1080"
 INSTANTIATE_TEST_SUITE_P(
     Steps, CameraTest,
-    ::testing::Values(CameraCase{"rear_single",
-                                 true,
-                                 {CAM, "F dual=0 type=0 " HD, "on", "I intent=16", "I intent=17",
-                                  "off", "D"},
-                                 {"2|com.cam|1|0|1920|1080", "7|com.cam|0|0|1920|1080"},
-                                 {"1|11", "4|16", "5|17", "7|10"},
-                                 {"r|com.cam|5000"},
-                                 {"3|com.cam|1", "6|com.cam|0"}},
-                      // An unknown stream changes nothing; dropping the second stream falls back to
-                      // the first alone; dropping the first ends the charge until it comes back.
-                      // The accounter reports under the camera of the last stream it was given.
-                      CameraCase{
-                          "dual_and_both_unconfigures",
-                          false,
-                          {"C id=1 name=com.d", "F dual=1 type=1 " HD,
-                           "F dual=1 type=2 width=640 height=480", "U type=3", "U type=2",
-                           "U type=1", "F dual=1 type=1 " HD, "D"},
-                          {"3|com.d|1|1|1920|1080", "3|com.d|1|2|640|480", "4|com.d|1|1|1920|1080",
-                           "4|com.d|1|2|640|480", "5|com.d|1|1|1920|1080", "6|com.d|2|-1|0|0",
-                           "8|com.d|0|1|1920|1080", "8|com.d|0|2|0|0"},
-                          {"1|11"},
-                          {"f|com.d|3000"},
-                          {}},
-                      // A lost disconnect: the next connect ends the old charge.
-                      CameraCase{"connect_while_connected",
-                                 false,
-                                 {CAM, "F dual=0 type=0 " HD, "C id=1 name=com.b",
-                                  "F dual=0 type=1 " HD, "D"},
-                                 {"2|com.cam|1|0|1920|1080", "3|com.cam|0|0|1920|1080",
-                                  "4|com.b|1|1|1920|1080", "5|com.b|0|1|1920|1080"},
-                                 {"1|11", "3|10", "3|11", "5|10"},
-                                 {"f|com.b|1000", "r|com.cam|1000"},
-                                 {}},
-                      // Refused configurations change nothing.
-                      CameraCase{"refused_configurations",
-                                 false,
-                                 {"F:-3 dual=0 type=0 " HD, "C:-19 id=x name=com.x", CAM,
-                                  "F:-19 dual=0 type=0 width=1920",
-                                  "F:-19 dual=0 type=0 width=-1 height=5", "F:-3 dual=1 type=-1 " HD,
-                                  "F:-3 dual=1 type=4 " HD, "F:-3 dual=0 type=2 " HD,
-                                  "F:-3 dual=2 type=0 " HD, "I:-19 intent=abc", "D"},
-                                 {"11|com.cam|0|-1|0|0"},
-                                 {"3|11"},
-                                 {},
-                                 {}},
-                      // After the framework's death the open camera is charged again.
-                      CameraCase{"vm_death_then_again",
-                                 false,
-                                 {CAM, "F dual=0 type=0 " HD, "vmdied", "D"},
-                                 {"2|com.cam|1|0|1920|1080", "4|com.cam|0|0|1920|1080"},
-                                 {"1|11", "4|10"},
-                                 {"r|com.cam|2000"},
-                                 {}}),
+    ::testing::Values(
+        CameraCase{"rear_single",
+                   true,
+                   {CAM, "F dual=0 type=0 " HD, "on", "I intent=16", "I intent=17", "off", "D"},
+                   {"s|2|com.cam|1|0|1920|1080", "s|7|com.cam|0|0|1920|1080", "i|1|11", "i|4|16",
+                    "i|5|17", "i|7|10", "l|3|com.cam|1", "l|6|com.cam|0"},
+                   {"r|com.cam|5000"}},
+        // An unknown stream changes nothing; dropping the second falls back to
+        // the first alone; dropping the first ends the charge. The accounter
+        // reports under the camera of the last stream it was given.
+        CameraCase{
+            "dual_and_both_unconfigures",
+            false,
+            {"C id=1 name=com.d", "F dual=1 type=1 " HD, "F dual=1 type=2 width=640 height=480",
+             "U type=3", "U type=2", "U type=1", "F dual=1 type=1 " HD, "D"},
+            {"s|3|com.d|1|1|1920|1080", "s|3|com.d|1|2|640|480", "s|4|com.d|1|1|1920|1080",
+             "s|4|com.d|1|2|640|480", "s|5|com.d|1|1|1920|1080", "s|6|com.d|2|-1|0|0",
+             "s|8|com.d|0|1|1920|1080", "s|8|com.d|0|2|0|0", "i|1|11"},
+            {"f|com.d|3000"}},
+        // A lost disconnect: the next connect ends the old charge.
+        CameraCase{
+            "connect_while_connected",
+            false,
+            {CAM, "F dual=0 type=0 " HD, "C id=1 name=com.b", "F dual=0 type=1 " HD, "D"},
+            {"s|2|com.cam|1|0|1920|1080", "s|3|com.cam|0|0|1920|1080", "s|4|com.b|1|1|1920|1080",
+             "s|5|com.b|0|1|1920|1080", "i|1|11", "i|3|10", "i|3|11", "i|5|10"},
+            {"f|com.b|1000", "r|com.cam|1000"}},
+        // Refused messages change nothing.
+        CameraCase{"refused_messages",
+                   false,
+                   {"F:-3 dual=0 type=0 " HD, "C:-19 id=x name=com.x", CAM,
+                    "F:-19 dual=0 type=0 width=1920", "F:-19 dual=0 type=0 width=-1 height=5",
+                    "F:-3 dual=1 type=-1 " HD, "F:-3 dual=1 type=4 " HD, "F:-3 dual=0 type=2 " HD,
+                    "F:-3 dual=2 type=0 " HD, "I:-19 intent=abc", "D"},
+                   {"s|11|com.cam|0|-1|0|0", "i|3|11"},
+                   {}},
+        // After the framework's death the open camera is charged again.
+        CameraCase{"vm_death_then_again",
+                   false,
+                   {CAM, "F dual=0 type=0 " HD, "vmdied", "D"},
+                   {"s|2|com.cam|1|0|1920|1080", "s|4|com.cam|0|0|1920|1080", "i|1|11", "i|4|10"},
+                   {"r|com.cam|2000"}}),
     [](const ::testing::TestParamInfo<CameraCase>& info) { return info.param.name; });
 
 // Results by stream type: the front camera's rows and the rear's (second
