@@ -11,6 +11,7 @@
 #include "AudioModel.h"
 #include "ComponentTruth.h"
 #include "RadioSensorTruth.h"
+#include "CameraTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "PlatformState.h"
@@ -108,6 +109,7 @@ private:
     // The audio framework with its truth (under mLock).
     std::unique_ptr<AudioModel> mAudio;
     std::unique_ptr<RadioSensorTruth> mRadioSensors;
+    std::unique_ptr<CameraTruth> mCameras;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

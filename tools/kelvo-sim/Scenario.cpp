@@ -15,6 +15,7 @@
 #include "TrafficModel.h"
 #include "WifiRecords.h"
 #include "RadioSensorTruth.h"
+#include "CameraTruth.h"
 
 namespace kelvo {
 namespace sim {
@@ -421,6 +422,9 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
             return false;
         }
     } else if (int32_t parsed = RadioSensorTruth::parseStep(words, step, reason); parsed <= 0) {
+        if (parsed == 0 && (parsed = CameraTruth::parseStep(words, step, reason)) > 0) {
+            return true;
+        }
         if (parsed == 0) {
             *reason = "unknown verb \"" + verb + "\"";
         }
@@ -472,6 +476,7 @@ bool Scenario::check(std::string* reason, int32_t* line) {
             }
         }
         const bool requester = step.action == Action::Sensor ||
+                               (step.action == Action::Camera && step.text == "connect") ||
                                (step.action == Action::Bluetooth && step.text == "discovery-start");
         if (requester && findProcess(step.pid) == nullptr) {
             *reason = "pid " + std::to_string(step.pid) + " is not declared";

@@ -53,6 +53,7 @@ public:
         Audio,       // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
         Bluetooth,   // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
         Sensor,      // flag: enable, pid, value: sensor type (-1 every type), text: connection
+        Camera,      // text: connect (pid, values: id), configure (values: dual, type, width, height), unconfigure (values: type), disconnect
     };
 
     struct Step {
