@@ -25,6 +25,7 @@
 #include "handlers/components/GpuHandler.h"
 #include "handlers/components/WifiHandler.h"
 #include "handlers/components/SensorHandler.h"
+#include "handlers/components/CameraHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -88,6 +89,10 @@ android::sp<KelvoOperator> makeGpuHandler() {
     return new GpuHandler();
 }
 
+android::sp<KelvoOperator> makeCameraHandler() {
+    return new CameraHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -118,6 +123,7 @@ struct Factories {
         handlers[HANDLER_BLUETOOTH] = &makeBluetoothHandler;
         handlers[HANDLER_SENSOR] = &makeSensorHandler;
         handlers[HANDLER_GPU] = &makeGpuHandler;
+        handlers[HANDLER_CAMERA] = &makeCameraHandler;
     }
 
     std::mutex lock;

@@ -59,6 +59,8 @@ const Refusal kRefusals[] = {
     {"sensor of an undeclared pid", "at 5 sensor enable 999 1 c1", "pid 999 is not declared"},
     {"sensor enabled for every type", "at 5 sensor enable 2001 -1 c1", "sensor enable|disable"},
     {"gpu busy time below 0", "at 5 gpu com.example.mail 480 -1", "gpu <package> <MHz> <busy ms>"},
+    {"single camera of a second stream", "at 5 camera configure 0 2 640 480", "camera connect"},
+    {"camera of an undeclared pid", "at 5 camera connect 999 0", "pid 999 is not declared"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -221,5 +221,10 @@ bool ComponentTruth::apply(const Scenario::Step& step, Record* record) {
     }
 }
 
+void ComponentTruth::learnTorchUser(int64_t ms, const std::string& package) {
+    advanceTo(ms);
+    (mFlashOn ? mPendingUser : mTorchUser) = package;
+}
+
 }  // namespace sim
 }  // namespace kelvo

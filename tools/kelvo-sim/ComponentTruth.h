@@ -64,6 +64,9 @@ public:
     // gnss, flashlight, torch).
     bool apply(const Scenario::Step& step, Record* record);
     bool screenOn() const { return mScreenOn; }
+    // A user of the flashlight learnt elsewhere (the camera's): from now on,
+    // or from the next switch while the light is on.
+    void learnTorchUser(int64_t ms, const std::string& package);
     // Brings the truth up to the time (the end of the run).
     void advanceTo(int64_t ms);
 

@@ -220,6 +220,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     mAudio.reset(new AudioModel(mScenario, audioProfile));
     mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
     mGpu.reset(new GpuLoadTruth(config));
+    mCameras.reset(new CameraTruth(mScenario, config));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -436,9 +437,14 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             ComponentTruth::Record record;
             {
                 std::lock_guard<std::mutex> lock(mLock);
+                bool camera = false;
                 if (!mRadioSensors->apply(step, step.atMs, &record.tag, &record.text) &&
+                    !(camera = mCameras->apply(step, step.atMs, &record.tag, &record.text)) &&
                     !mComponents->apply(step, &record)) {
                     return;
+                }
+                if (camera && !mCameras->flashlightUser().empty()) {
+                    mComponents->learnTorchUser(step.atMs, mCameras->flashlightUser());
                 }
                 mBattery->setScreen(mComponents->screenOn());
             }
@@ -656,6 +662,8 @@ int DeviceSimulator::finish(bool completed) {
         }
         components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
         components += mGpu->report(SimReport::databasePath(mOptions.root));
+        mCameras->advanceTo(mModelMs);
+        components += mCameras->report(SimReport::databasePath(mOptions.root));
     }
     report.addSection(components);
     BatteryReport::Model battery;

@@ -12,6 +12,7 @@
 #include "ComponentTruth.h"
 #include "GpuLoadTruth.h"
 #include "RadioSensorTruth.h"
+#include "CameraTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "PlatformState.h"
@@ -110,6 +111,7 @@ private:
     std::unique_ptr<AudioModel> mAudio;
     std::unique_ptr<RadioSensorTruth> mRadioSensors;
     std::unique_ptr<GpuLoadTruth> mGpu;  // under mLock
+    std::unique_ptr<CameraTruth> mCameras;
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -16,6 +16,7 @@
 #include "WifiRecords.h"
 #include "GpuLoadTruth.h"
 #include "RadioSensorTruth.h"
+#include "CameraTruth.h"
 
 namespace kelvo {
 namespace sim {
@@ -422,6 +423,9 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
             return false;
         }
     } else if (int32_t parsed = RadioSensorTruth::parseStep(words, step, reason); parsed <= 0) {
+        if (parsed == 0 && (parsed = CameraTruth::parseStep(words, step, reason)) > 0) {
+            return true;
+        }
         if (parsed == 0) {
             parsed = GpuLoadTruth::parseStep(words, step, reason);
         }
@@ -479,6 +483,7 @@ bool Scenario::check(std::string* reason, int32_t* line) {
             }
         }
         const bool requester = step.action == Action::Sensor ||
+                               (step.action == Action::Camera && step.text == "connect") ||
                                (step.action == Action::Bluetooth && step.text == "discovery-start");
         if (requester && findProcess(step.pid) == nullptr) {
             *reason = "pid " + std::to_string(step.pid) + " is not declared";

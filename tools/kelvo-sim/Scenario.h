@@ -54,6 +54,7 @@ public:
         Bluetooth,   // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
         Sensor,      // flag: enable, pid, value: sensor type (-1 every type), text: connection
         Gpu,         // text: package, frequency: MHz, value: busy ms (GpuLoadTruth)
+        Camera,      // text: connect (pid, values: id), configure (values: dual, type, width, height), unconfigure (values: type), disconnect
     };
 
     struct Step {
