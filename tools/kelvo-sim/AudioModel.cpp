@@ -257,5 +257,17 @@ std::map<std::string, int64_t> AudioModel::bluetoothMs() const {
     return out;
 }
 
+std::string AudioModel::summary() const {
+    std::string out =
+        "\nAudio play time by output (truth; the powered outputs are compared below):\n";
+    for (const auto& [package, outputs] : mTruth) {
+        for (const auto& [output, figures] : outputs) {
+            out += "  " + package + " " + output + " " + std::to_string(figures.ms) +
+                   " ms, energy " + std::to_string(figures.energyNumerator / 1000) + "\n";
+        }
+    }
+    return out;
+}
+
 }  // namespace sim
 }  // namespace kelvo

@@ -45,6 +45,9 @@ public:
     void advanceTo(int64_t ms);
     // The play time on a Bluetooth output per package.
     std::map<std::string, int64_t> bluetoothMs() const;
+    // The truth's lines: per application and output (earpiece, speaker,
+    // both, bluetooth) the play time and the profile's energy.
+    std::string summary() const;
     // The time and energy on the powered outputs per package.
     std::map<std::string, Figures> poweredTruth() const;
 

@@ -653,6 +653,7 @@ int DeviceSimulator::finish(bool completed) {
         componentReport.build(&components);
         componentTable = componentReport.table();
         mAudio->advanceTo(mModelMs);
+        components += mAudio->summary();
         mRadioSensors->advanceTo(mModelMs);
         for (const auto& [package, ms] : mAudio->bluetoothMs()) {
             mRadioSensors->setMedia(package, ms);
