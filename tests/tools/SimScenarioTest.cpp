@@ -51,6 +51,7 @@ const Refusal kRefusals[] = {
     {"gnss of an unknown package", "at 5 gnss start com.other", "no app has the package"},
     {"torch user of a shared uid", "at 5 torch 2101", "app with one package"},
     {"battery model without level", "battery-model 3000", "battery-model <capacity mAh>"},
+    {"audio policy 3", "audio-policy 3", "audio-policy 1|2"},
     {"battery model bad current", "battery-model 3000 50% idle -5", "battery-model <capacity mAh>"},
     {"wakelock of no app", "at 5 held-wakelock com.other Tag 20:00", "no app has the package"},
     {"audio start on stream 13", "at 5 audio start 21 13", "stream 0..12"},

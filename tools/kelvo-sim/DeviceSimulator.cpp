@@ -151,6 +151,28 @@ int64_t DeviceSimulator::simulatedNowMs() const {
     return realtimeMs() + mOffsetMs;
 }
 
+// The root's own configuration (/data, which the daemon prefers): the
+// sample with the audio component's data-source policy replaced.
+bool DeviceSimulator::writeAudioPolicy(const std::string& root, int32_t policy) {
+    std::ifstream in(mOptions.configDir + "/tv_kelvo_config.xml");
+    std::stringstream text;
+    text << in.rdbuf();
+    std::string xml = text.str();
+    static const std::string kAudio =
+        "<!-- audio -->\n        <component id=\"2\">\n            <parameter>1</parameter>";
+    size_t at = xml.find(kAudio);
+    if (!in || at == std::string::npos || !makeDirs(root + "/data/misc/kelvo")) {
+        return false;
+    }
+    std::string replaced = kAudio;
+    replaced.replace(replaced.size() - std::string("1</parameter>").size(), 1,
+                     std::to_string(policy));
+    xml.replace(at, kAudio.size(), replaced);
+    std::ofstream out(root + "/data/misc/kelvo/tv_kelvo_config.xml");
+    out << xml;
+    return static_cast<bool>(out.flush());
+}
+
 bool DeviceSimulator::prepareRoot(std::string* error) {
     if (mOptions.root.empty()) {
         char pattern[] = "/tmp/kelvo-sim-XXXXXX";
@@ -182,6 +204,11 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         !copyFile(mOptions.configDir + "/tv_kelvo_config.xml",
                   root + "/vendor/etc/xml/tv_kelvo_config.xml")) {
         *error = "cannot copy the sample configuration from " + mOptions.configDir;
+        return false;
+    }
+    if (mScenario.audioPolicy() != 1 && !writeAudioPolicy(root, mScenario.audioPolicy())) {
+        *error = "cannot write the root's configuration with audio policy " +
+                 std::to_string(mScenario.audioPolicy()) + " below " + root;
         return false;
     }
     mTree.reset(new CpuTree(root));
@@ -662,6 +689,11 @@ int DeviceSimulator::finish(bool completed) {
             mRadioSensors->setAudio(package, figures.ms, figures.energyNumerator / 1000.0);
         }
         components += mRadioSensors->report(SimReport::databasePath(mOptions.root));
+        if (mScenario.audioPolicy() == 2) {
+            components +=
+                "  audio policy 2: the daemon rescales the audio energy to the amplifiers' "
+                "answers (smartpa lines); the truth's energy is the profile's model\n";
+        }
         components += mGpu->report(SimReport::databasePath(mOptions.root));
         mCameras->advanceTo(mModelMs);
         components += mCameras->report(SimReport::databasePath(mOptions.root));

@@ -9,13 +9,13 @@
 #include <string>
 
 #include "AudioModel.h"
-#include "ComponentTruth.h"
-#include "GpuLoadTruth.h"
-#include "RadioSensorTruth.h"
 #include "CameraTruth.h"
+#include "ComponentTruth.h"
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
+#include "GpuLoadTruth.h"
 #include "PlatformState.h"
+#include "RadioSensorTruth.h"
 #include "Scenario.h"
 #include "SystemScene.h"
 #include "TrafficModel.h"
@@ -63,6 +63,8 @@ public:
 
 private:
     enum class Phase { Start, Load, HourlyRound, Report };
+
+    bool writeAudioPolicy(const std::string& root, int32_t policy);
 
     bool prepareRoot(std::string* error);
     bool startServices(std::string* error);

@@ -1,7 +1,5 @@
 #include "Scenario.h"
 
-#include "AudioModel.h"
-
 #include <errno.h>
 #include <stdlib.h>
 
@@ -10,13 +8,14 @@
 #include <set>
 #include <sstream>
 
+#include "AudioModel.h"
+#include "CameraTruth.h"
 #include "CpuTree.h"
+#include "GpuLoadTruth.h"
+#include "RadioSensorTruth.h"
 #include "SystemScene.h"
 #include "TrafficModel.h"
 #include "WifiRecords.h"
-#include "GpuLoadTruth.h"
-#include "RadioSensorTruth.h"
-#include "CameraTruth.h"
 
 namespace kelvo {
 namespace sim {
@@ -284,6 +283,13 @@ bool Scenario::parseLine(const std::vector<std::string>& words, std::string* rea
     if (verb == "battery-model") {
         return BatteryModel::parse(words, &mBattery, reason);
     }
+    if (verb == "audio-policy") {
+        if (words.size() != 2 || !parseInt32(words[1], 1, 2, &mAudioPolicy)) {
+            *reason = "expected \"audio-policy 1|2\"";
+            return false;
+        }
+        return true;
+    }
     *reason = "unknown verb \"" + verb + "\"";
     return false;
 }
@@ -340,8 +346,7 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
         step.action = Action::HeldWakelock;
         int64_t heldMs = 0;
         if (words.size() != 4 || !isName(words[1]) || !isName(words[2]) ||
-            !parseOffset(words[3], &heldMs) ||
-            heldMs < 1 || heldMs > 0x7FFFFFFF) {
+            !parseOffset(words[3], &heldMs) || heldMs < 1 || heldMs > 0x7FFFFFFF) {
             *reason = "expected \"at <time> held-wakelock <package> <tag> <time held>\"";
             return false;
         }

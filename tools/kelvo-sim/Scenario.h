@@ -35,26 +35,27 @@ public:
 
     // What a timed line does. Later components add their verbs here.
     enum class Action {
-        Load,        // pid, cluster, percent, frequency (kHz, 0: the highest)
-        Foreground,  // text: the package
-        Screen,      // flag: on
-        Charger,     // text: "ac", "usb", "wireless" or "off"
-        Battery,     // value: level
-        Brightness,  // value: level 0..255
-        Ambient,     // value: type (0 auto, 1 manual, 2 app, 3 front), values: six durations
-        Gnss,        // flag: start, text: the package
-        Flashlight,  // flag: on
-        Torch,       // pid: the torch user's process
-        System,      // text: the record (SystemScene::parseStep)
+        Load,           // pid, cluster, percent, frequency (kHz, 0: the highest)
+        Foreground,     // text: the package
+        Screen,         // flag: on
+        Charger,        // text: "ac", "usb", "wireless" or "off"
+        Battery,        // value: level
+        Brightness,     // value: level 0..255
+        Ambient,        // value: type (0 auto, 1 manual, 2 app, 3 front), values: six durations
+        Gnss,           // flag: start, text: the package
+        Flashlight,     // flag: on
+        Torch,          // pid: the torch user's process
+        System,         // text: the record (SystemScene::parseStep)
         Traffic,        // pid: uid, text: interface, value: counter set, counters
         SystemTraffic,  // pid, text: interface, counters
         Wifi,           // value: record kind, pid: its number (WifiRecords)
         HeldWakelock,   // text: package, tag: the wakelock, value: ms held
-        Audio,       // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
-        Bluetooth,   // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
-        Sensor,      // flag: enable, pid, value: sensor type (-1 every type), text: connection
-        Gpu,         // text: package, frequency: MHz, value: busy ms (GpuLoadTruth)
-        Camera,      // text: connect (pid, values: id), configure (values: dual, type, width, height), unconfigure (values: type), disconnect
+        Audio,          // text: "audio <verb>", "call" or "smartpa <answer>" (AudioModel)
+        Bluetooth,  // text: discovery-start (pid: the requester), discovery-stop, send, receive, stop
+        Sensor,     // flag: enable, pid, value: sensor type (-1 every type), text: connection
+        Gpu,        // text: package, frequency: MHz, value: busy ms (GpuLoadTruth)
+        Camera,  // text: connect (pid, values: id), configure (values: dual, type, width, height),
+                 // unconfigure (values: type), disconnect
     };
 
     struct Step {
@@ -88,6 +89,9 @@ public:
     const std::vector<Process>& processes() const { return mProcesses; }
     // The battery (the defaults without a "battery-model" line).
     const BatteryModel::Config& battery() const { return mBattery; }
+    // The audio data-source policy of the root's own configuration (1 the
+    // shipped one; 2 the smart amplifier's measured energy).
+    int32_t audioPolicy() const { return mAudioPolicy; }
     // In time order (lines of equal time keep their order).
     const std::vector<Step>& steps() const { return mSteps; }
 
@@ -115,6 +119,7 @@ private:
     std::vector<Process> mProcesses;
     std::vector<Step> mSteps;
     BatteryModel::Config mBattery;
+    int32_t mAudioPolicy = 1;
 };
 
 }  // namespace sim
