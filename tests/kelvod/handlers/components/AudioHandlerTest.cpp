@@ -7,6 +7,7 @@
 #include <json/json.h>
 
 #include <atomic>
+#include <cstdio>
 #include <memory>
 #include <string>
 #include <vector>
@@ -375,6 +376,69 @@ TEST_F(AudioSmartPaTest, MeasuredEnergyRescalesTheCachedResults) {
                        std::to_string(kT + dt) + " ORDER BY name)"))
             << (c.answer != nullptr ? c.answer : "no service");
         EXPECT_EQ(c.readings, rows("SELECT speaker FROM raw_audio_smartpa_value").size());
+    }
+}
+
+// Spans count each part of a play once, the component's in the rows and the
+// loudspeaker's and earpiece's (stream 3 is 0x3) in the dump: a poll during
+// play restarts the spans at its time, a time before a span's start adds
+// nothing, and a second stop (its reference would go below 0) keeps the
+// other session counted up to its own stop. Steps in seconds: "+20" starts
+// session 20, "-20" stops it, "" polls.
+TEST_F(AudioSmartPaTest, SpansCountEachPartOnce) {
+    ASSERT_EQ(0, log(T::TAG_AUDIO_DEVICE, 0, "stream=3 device=2"));
+    for (const char* id : {"20", "21"}) {
+        ASSERT_EQ(0, log(T::TAG_AUDIO_SESSION_ACQUIRE, 0,
+                         std::string("session=") + id + " pid=501 uid=10010"));
+    }
+    const struct {
+        const char* name;
+        std::vector<std::pair<int64_t, std::string>> steps;
+        std::vector<std::string> rows;  // end | duration of the component rows
+        long long spans;
+    } cases[] = {
+        {"polls during play",
+         {{0, "+20"}, {100, ""}, {250, ""}, {300, "-20"}, {400, ""}},
+         {"100|100", "250|150", "300|50"},
+         300},
+        {"earlier times",
+         {{0, "+20"}, {-30, ""}, {60, "-20"}, {100, "+20"}, {80, "-20"}, {200, ""}},
+         {"80|60"},  // the row ends at the last stop
+         60},
+        {"second stop",
+         {{0, "+20"}, {0, "+21"}, {100, "-21"}, {150, "-21"}, {200, "-20"}, {300, ""}},
+         {"200|200"},
+         200},
+    };
+    auto spans = [&](long long* speaker, long long* receiver) {
+        const std::string state = dump();
+        return sscanf(state.c_str() + state.find("mSpeaker={"),
+                      "mSpeaker={%*[^,], %*[^,], %lld} mReceiver={%*[^,], %*[^,], %lld}", speaker,
+                      receiver);
+    };
+    int64_t base = 0;
+    for (const auto& c : cases) {
+        base += 1000;
+        long long speaker = 0, receiver = 0, speakerAfter = 0, receiverAfter = 0;
+        ASSERT_EQ(2, spans(&speaker, &receiver));
+        for (const auto& step : c.steps) {
+            const int64_t dt = (base + step.first) * 1000;
+            const std::string text =
+                step.second.empty() ? "" : "session=" + step.second.substr(1) + " stream=3";
+            ASSERT_EQ(0, text.empty() ? poll(dt)
+                                      : log(step.second[0] == '+' ? T::TAG_AUDIO_SESSION_START
+                                                                  : T::TAG_AUDIO_SESSION_STOP,
+                                            dt, text))
+                << c.name;
+        }
+        const int64_t start = kT + (base - 500) * 1000;
+        EXPECT_EQ(c.rows, rows("SELECT (end_time - " + std::to_string(start) + ") / 1000 - 500, " +
+                               "background_duration / 1000 FROM raw_component_audio WHERE " +
+                               "end_time > " + std::to_string(start) + " ORDER BY rowid"))
+            << c.name;
+        ASSERT_EQ(2, spans(&speakerAfter, &receiverAfter));
+        EXPECT_EQ(c.spans * 1000, speakerAfter - speaker) << c.name;
+        EXPECT_EQ(c.spans * 1000, receiverAfter - receiver) << c.name;
     }
 }
 
