@@ -795,9 +795,10 @@ WifiEnergyTruth::Result DeviceSimulator::wifiEnergyTruth(int64_t endMs) {
         WifiEnergyTruth(mScenario, mWifiProfile).compute(polls, endMs);
     char text[512];
     snprintf(text, sizeof(text),
-             "truth energy = the profile's Wi-Fi energy of the scenario's packets (traffic and\n"
-             "scans; hotspot on its own line), weighed %s (%d batches). Level times are\n"
-             "the scenario's, the daemon's are its own clock's: a few ms apart per batch.\n",
+             "truth energy = the profile's Wi-Fi energy of the scenario's packets (traffic\n"
+             "and scans; the hotspot on its own line), weighed %s\n"
+             "(%d traffic batches). The daemon times the levels on its own clock as it\n"
+             "reads the records, a few ms after the scenario: the two differ by about that.\n",
              truth.perPoll ? "at the daemon's polls (debug_data_polling) and screen changes"
                            : "as one batch over the whole run (no poll times)",
              truth.batches);

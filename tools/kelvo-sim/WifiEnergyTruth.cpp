@@ -2,13 +2,11 @@
 
 #include <sqlite3.h>
 #include <stdlib.h>
+#include <tinyxml2.h>
 
 #include <algorithm>
 #include <set>
 #include <tuple>
-
-#include <tinyxml2.h>
-
 
 namespace kelvo {
 namespace sim {
@@ -211,8 +209,8 @@ WifiEnergyTruth::Result WifiEnergyTruth::compute(std::vector<int64_t> polls, int
                 }
             } else if (step.action == Scenario::Action::Brightness ||
                        step.action == Scenario::Action::Screen) {
-                int32_t value = step.action == Scenario::Action::Brightness ? step.value
-                                                                            : (step.flag ? 1 : 0);
+                int32_t value =
+                    step.action == Scenario::Action::Brightness ? step.value : (step.flag ? 1 : 0);
                 displayOn = value >= 1;
                 if (!result.perPoll) {
                     screenOn = displayOn;

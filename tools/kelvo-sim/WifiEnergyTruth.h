@@ -36,10 +36,10 @@ public:
     };
 
     struct Result {
-        std::map<int32_t, double> byUid;            // applications
-        std::map<std::string, double> byProcess;    // system processes, by name
-        double hotspot = 0;                         // "wifi_ap"
-        bool perPoll = false;  // false: the whole run as one batch
+        std::map<int32_t, double> byUid;          // applications
+        std::map<std::string, double> byProcess;  // system processes, by name
+        double hotspot = 0;                       // "wifi_ap"
+        bool perPoll = false;                     // false: the whole run as one batch
         int32_t batches = 0;
     };
 
