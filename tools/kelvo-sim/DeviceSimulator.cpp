@@ -796,10 +796,10 @@ WifiEnergyTruth::Result DeviceSimulator::wifiEnergyTruth(int64_t endMs) {
     char text[512];
     snprintf(text, sizeof(text),
              "truth energy = the profile's Wi-Fi energy of the scenario's packets (traffic\n"
-             "and scans; the hotspot on its own line), weighed %s\n"
-             "(%d traffic batches). The daemon times the levels on its own clock as it\n"
+             "and scans; the hotspot on its own line), weighed\n%s (%d traffic batches).\n"
+             "The daemon times the levels on its own clock as it\n"
              "reads the records, a few ms after the scenario: the two differ by about that.\n",
-             truth.perPoll ? "at the daemon's polls (debug_data_polling) and screen changes"
+             truth.perPoll ? "at the daemon's polls (debug_data_polling) and its screen changes"
                            : "as one batch over the whole run (no poll times)",
              truth.batches);
     mWifiEnergyHeading = text;
