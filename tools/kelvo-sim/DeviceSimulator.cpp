@@ -233,6 +233,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
         return false;
     }
     mTraffic.reset(new TrafficModel(mScenario, root));
+    WifiEnergyTruth::readProfile(config, &mWifiProfile);
     if (!mTraffic->write()) {
         *error = "cannot write the traffic counters below " + root + ": " + strerror(errno);
         return false;
@@ -716,6 +717,7 @@ int DeviceSimulator::finish(bool completed) {
     std::ofstream(mOptions.root + "/sim/truth.tsv") << report.truthTable();
     std::ofstream(mOptions.root + "/sim/components.tsv") << componentTable;
     if (mTraffic) {
+        mTraffic->setEnergyTruth(wifiEnergyTruth(endMs - mStartMs), mWifiEnergyHeading);
         std::string traffic = mTraffic->summary(SimReport::databasePath(mOptions.root));
         fputs(traffic.c_str(), stdout);
         std::ofstream(mOptions.root + "/sim/summary.txt", std::ios::app) << traffic;
@@ -778,6 +780,30 @@ int DeviceSimulator::run() {
     mNextHourMs = (mStartMs / kHourMs + 1) * kHourMs - mStartMs;
     bool completed = play();
     return finish(completed);
+}
+
+}  // namespace sim
+}  // namespace kelvo
+
+namespace kelvo {
+namespace sim {
+
+WifiEnergyTruth::Result DeviceSimulator::wifiEnergyTruth(int64_t endMs) {
+    std::vector<int64_t> polls;
+    WifiEnergyTruth::readPolls(SimReport::databasePath(mOptions.root), mStartMs, &polls);
+    WifiEnergyTruth::Result truth =
+        WifiEnergyTruth(mScenario, mWifiProfile).compute(polls, endMs);
+    char text[512];
+    snprintf(text, sizeof(text),
+             "truth energy = the profile's Wi-Fi energy of the scenario's packets (traffic\n"
+             "and scans; the hotspot on its own line), weighed\n%s (%d traffic batches).\n"
+             "The daemon times the levels on its own clock as it\n"
+             "reads the records, a few ms after the scenario: the two differ by about that.\n",
+             truth.perPoll ? "at the daemon's polls (debug_data_polling) and its screen changes"
+                           : "as one batch over the whole run (no poll times)",
+             truth.batches);
+    mWifiEnergyHeading = text;
+    return truth;
 }
 
 }  // namespace sim

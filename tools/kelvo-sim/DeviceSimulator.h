@@ -108,6 +108,10 @@ private:
     // driver thread reads the panel's advanced brightness).
     std::unique_ptr<ComponentTruth> mComponents;
     std::unique_ptr<TrafficModel> mTraffic;
+    // The Wi-Fi energy truth at the end, at the daemon's polls when known.
+    WifiEnergyTruth::Result wifiEnergyTruth(int64_t endMs);
+    WifiEnergyTruth::Profile mWifiProfile;
+    std::string mWifiEnergyHeading;
     std::unique_ptr<BatteryModel> mBattery;  // the play thread's
     // The audio framework with its truth (under mLock).
     std::unique_ptr<AudioModel> mAudio;

@@ -279,9 +279,23 @@ std::string TrafficModel::summary(const std::string& dbPath) const {
         "and on the other (cellular) interfaces; rows = raw_wifi_package_traffic; accounted =\n"
         "raw_applications_wifi bytes and energy (\"-\": table absent). Traffic after the\n"
         "daemon's last poll is not in its tables yet.\n";
+    if (mHaveEnergyTruth) {
+        out += mEnergyHeading;
+    }
+    auto truthEnergy = [this](const double* value) {
+        char text[32];
+        if (!mHaveEnergyTruth || value == nullptr) return std::string("-");
+        snprintf(text, sizeof(text), "%.0f", *value);
+        return std::string(text);
+    };
+    auto byProcess = [this](const std::string& name) {
+        auto it = mEnergyTruth.byProcess.find(name);
+        return it == mEnergyTruth.byProcess.end() ? nullptr : &it->second;
+    };
+    const double zero = 0;
     char line[256];
-    snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12s %12s %10s\n", "application", "uid",
-             "wifi truth", "cell truth", "rows", "accounted", "energy");
+    snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12s %12s %10s %12s\n", "application",
+             "uid", "wifi truth", "cell truth", "rows", "accounted", "energy", "truth energy");
     out += line;
     std::istringstream truth(truthTable());
     std::string entry;
@@ -299,11 +313,14 @@ std::string TrafficModel::summary(const std::string& dbPath) const {
         std::string field;
         while (std::getline(split, field, '\t')) f.push_back(field);
         shown.insert(f[0]);
-        snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12s %12s %10s\n", f[0].c_str(),
+        auto uidTruth = mEnergyTruth.byUid.find(atoi(f[1].c_str()));
+        snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12s %12s %10s %12s\n", f[0].c_str(),
                  f[1].c_str(), f[2].c_str(), f[3].c_str(),
                  value(haveRows, rows, f[0], false).c_str(),
                  value(haveAccounted, accounted, f[0], false).c_str(),
-                 value(haveAccounted, accounted, f[0], true).c_str());
+                 value(haveAccounted, accounted, f[0], true).c_str(),
+                 truthEnergy(uidTruth == mEnergyTruth.byUid.end() ? &zero : &uidTruth->second)
+                     .c_str());
         out += line;
     }
     // System processes and names only the daemon knows.
@@ -315,18 +332,27 @@ std::string TrafficModel::summary(const std::string& dbPath) const {
         }
     }
     for (const auto& p : processTruth) {
-        snprintf(line, sizeof(line), "%-30s %6s %12" PRId64 " %12s %12s %12s %10s\n",
-                 ("process " + p.first).c_str(), "", p.second, "-", "-", "-", "-");
+        const double* energy = byProcess(p.first);
+        snprintf(line, sizeof(line), "%-30s %6s %12" PRId64 " %12s %12s %12s %10s %12s\n",
+                 ("process " + p.first).c_str(), "", p.second, "-", "-", "-", "-",
+                 truthEnergy(energy != nullptr ? energy : &zero).c_str());
         out += line;
     }
     for (const auto& r : rows) {
         if (shown.count(r.first) == 0) {
-            snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12" PRId64 " %12s %10s\n",
+            snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12" PRId64 " %12s %10s %12s\n",
                      r.first.c_str(), "", "-", "-", r.second.first,
                      value(haveAccounted, accounted, r.first, false).c_str(),
-                     value(haveAccounted, accounted, r.first, true).c_str());
+                     value(haveAccounted, accounted, r.first, true).c_str(),
+                     truthEnergy(byProcess(r.first)).c_str());
             out += line;
         }
+    }
+    if (mHaveEnergyTruth && (mEnergyTruth.hotspot > 0 || accounted.count("wifi_ap") != 0)) {
+        snprintf(line, sizeof(line), "%-30s %6s %12s %12s %12s %12s %10s %12s\n", "wifi_ap (hotspot)",
+                 "", "-", "-", "-", "-", value(haveAccounted, accounted, "wifi_ap", true).c_str(),
+                 truthEnergy(&mEnergyTruth.hotspot).c_str());
+        out += line;
     }
     return out;
 }

@@ -8,6 +8,7 @@
 #include <vector>
 
 #include "Scenario.h"
+#include "WifiEnergyTruth.h"
 
 namespace kelvo {
 namespace sim {
@@ -52,6 +53,13 @@ public:
     // each app on Wi-Fi and on the cellular interfaces, beside what the
     // daemon stored, read from the database at dbPath.
     std::string summary(const std::string& dbPath) const;
+    // The Wi-Fi energy the profile gives, shown beside the attributed energy;
+    // heading says what it models.
+    void setEnergyTruth(const WifiEnergyTruth::Result& truth, const std::string& heading) {
+        mEnergyTruth = truth;
+        mEnergyHeading = heading;
+        mHaveEnergyTruth = true;
+    }
     // name \t uid \t Wi-Fi bytes \t cellular bytes, one line per app.
     std::string truthTable() const;
 
@@ -68,6 +76,9 @@ private:
     std::string mRoot;
     std::map<UidKey, Counters> mUids;
     std::map<ProcessKey, Counters> mProcesses;
+    WifiEnergyTruth::Result mEnergyTruth;
+    std::string mEnergyHeading;
+    bool mHaveEnergyTruth = false;
 };
 
 }  // namespace sim
