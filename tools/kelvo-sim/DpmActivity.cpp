@@ -145,6 +145,17 @@ void DpmActivity::apply(const Scenario::Step& step, fake::FakeKernelDriver& driv
         driver.addDdr(step.value, step.counters[0], step.counters[1]);
         mDdrSeconds += step.counters[0];
         mDdrFlux += step.counters[1];
+        // The step's bandwidth picks the level's pair: time and traffic at
+        // or below its threshold, or above it.
+        const dpm_ddr_level& level = kDpmDdrLevels[step.value];
+        const int64_t ms = step.counters[0] * 1000;
+        const int64_t bandwidth = step.counters[0] > 0 ? step.counters[1] / step.counters[0] : 0;
+        auto c = mCoefficients.find(level.id);
+        if (c != mCoefficients.end()) {
+            const size_t pair = bandwidth <= level.threshold ? 0 : 2;
+            mTruth[level.name].energy +=
+                (ms * c->second[pair] + step.counters[1] * c->second[pair + 1]) / 1000;
+        }
         return;
     }
     const auto which = static_cast<fake::FakeKernelDriver::DpmTime>(step.value);
@@ -165,7 +176,7 @@ void DpmActivity::apply(const Scenario::Step& step, fake::FakeKernelDriver& driv
 
 std::string DpmActivity::report(const std::string& databasePath,
                                 const std::string& eventsPath) const {
-    if (mTruth.empty() && mDdrSeconds == 0) {
+    if (mTruth.empty() && mDdrSeconds == 0 && mDdrFlux == 0) {
         return "";
     }
     // How many hourly uploads carried each block in their top list.

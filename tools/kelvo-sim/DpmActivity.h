@@ -19,7 +19,8 @@ namespace sim {
 // low-voltage busy or idle time to one IP block of the kernel driver, "ddr"
 // steps add residency and traffic to one DDR bandwidth level. It keeps the
 // truth per block: the time driven and its energy from the profile's
-// coefficients (ms x coefficient / 1000, the accounter's unit).
+// coefficients (ms x coefficient / 1000, the accounter's unit); per DDR
+// level the energy of each step's time and traffic by its bandwidth.
 class DpmActivity {
 public:
     // "dpm <ip-name> off|busy|low|idle <seconds>" (text the name, value the
