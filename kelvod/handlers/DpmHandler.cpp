@@ -39,15 +39,9 @@ constexpr uint32_t kClassBlock = 903009043;
 constexpr int32_t kTopBlocks = 20;
 
 const column_attribute kRawColumns[] = {
-    {COLUMN_TIME, "start_time"},
-    {COLUMN_TIME, "end_time"},
-    {COLUMN_INT, "ip"},
-    {COLUMN_LONG, "off_time"},
-    {COLUMN_LONG, "busy_time"},
-    {COLUMN_LONG, "busy_time_low_voltage"},
-    {COLUMN_LONG, "idle_time"},
-    {COLUMN_LONG, "energy"},
-    {COLUMN_LONG, "charge_energy"},
+    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},  {COLUMN_INT, "ip"},
+    {COLUMN_LONG, "off_time"},   {COLUMN_LONG, "busy_time"}, {COLUMN_LONG, "busy_time_low_voltage"},
+    {COLUMN_LONG, "idle_time"},  {COLUMN_LONG, "energy"},    {COLUMN_LONG, "charge_energy"},
 };
 const column_attribute kHourlyColumns[] = {
     {COLUMN_TIME, "timestamp"},
@@ -75,13 +69,12 @@ int64_t timesThousand(int64_t value) {
     int64_t out = 0;
     if (__builtin_mul_overflow(value, static_cast<int64_t>(1000), &out)) {
         HealthCounters::add(Health::ValuesSaturated);
-        return value < 0 ? std::numeric_limits<int64_t>::min()
-                         : std::numeric_limits<int64_t>::max();
+        return value < 0 ? std::numeric_limits<int64_t>::min() : std::numeric_limits<int64_t>::max();
     }
     return out;
 }
 
-} // namespace
+}  // namespace
 
 const table_attribute& DpmHandler::rawTable() {
     return kRaw;
@@ -172,8 +165,7 @@ int32_t DpmHandler::checkEnable() {
         return -2;
     }
     restartDdr();
-    KLOGI("DPM is supported, version: %d, Ip count: %d, Ddr count: %d", version, mIpCount,
-          ddrCount);
+    KLOGI("DPM is supported, version: %d, Ip count: %d, Ddr count: %d", version, mIpCount, ddrCount);
     return 0;
 }
 
@@ -222,9 +214,12 @@ void DpmHandler::restartDdr() {
 
 void DpmHandler::setupListeners(Parcel& out) {
     static const int32_t kNotifications[] = {
-        NOTIFICATION_DATA_POLLING,         NOTIFICATION_HOURLY_TICK,
-        NOTIFICATION_APPLICATIONS_ACCOUNTING, NOTIFICATION_COMPONENT_ACCOUNTING,
-        NOTIFICATION_HOURLY_UPLOADING,     NOTIFICATION_DAILY_UPLOADING,
+        NOTIFICATION_DATA_POLLING,
+        NOTIFICATION_HOURLY_TICK,
+        NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING,
+        NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_DAILY_UPLOADING,
         NOTIFICATION_DAWN_UPLOADING,
     };
     for (int32_t type : kNotifications) {
@@ -261,13 +256,14 @@ int32_t DpmHandler::readIpData(std::vector<record>* records) {
         dpm_ip_fields_t fields;
         memcpy(&fields, bytes.bytes, sizeof(fields));
         const std::string name(fields.name, strnlen(fields.name, sizeof(fields.name)));
-        std::array<int64_t, 4> values = {fields.offTime, fields.busyTime,
-                                         fields.busyTimeLowVoltage, fields.idleTime};
+        std::array<int64_t, 4> values = {fields.offTime, fields.busyTime, fields.busyTimeLowVoltage,
+                                         fields.idleTime};
         if (values[0] < 0 || values[1] < 0 || values[2] < 0 || values[3] < 0) {
             HealthCounters::add(Health::DeviceAnswersRefused);
-            KLOGE("Invalid DPM data: name=%s, off=%lld, busy_time=%lld, "
-                  "busy_time_low_voltage=%lld, idle_time=%lld",
-                  name.c_str(), ll(values[0]), ll(values[1]), ll(values[2]), ll(values[3]));
+            KLOGE(
+                "Invalid DPM data: name=%s, off=%lld, busy_time=%lld, "
+                "busy_time_low_voltage=%lld, idle_time=%lld",
+                name.c_str(), ll(values[0]), ll(values[1]), ll(values[2]), ll(values[3]));
             continue;
         }
         readings[name] = values;
@@ -277,9 +273,10 @@ int32_t DpmHandler::readIpData(std::vector<record>* records) {
                 values[i] = increase(values[i], baseline->second[i]);
             }
         }
-        KLOGD("DPM data: name=%s, off=%lld, busy_time=%lld, busy_time_low_voltage=%lld, "
-              "idle_time=%lld",
-              name.c_str(), ll(values[0]), ll(values[1]), ll(values[2]), ll(values[3]));
+        KLOGD(
+            "DPM data: name=%s, off=%lld, busy_time=%lld, busy_time_low_voltage=%lld, "
+            "idle_time=%lld",
+            name.c_str(), ll(values[0]), ll(values[1]), ll(values[2]), ll(values[3]));
         if (values[0] == 0 && values[1] == 0 && values[2] == 0 && values[3] == 0) {
             KLOGD("No difference on %s, ignore logging", name.c_str());
             continue;
@@ -343,8 +340,8 @@ int32_t DpmHandler::readDdrData(std::vector<record>* records) {
                 KLOGD("No difference on %s%d, ignore logging", kDpmDdrLevelPrefix, i);
             } else if (deltaTime >= 0 && deltaFlux >= 0) {
                 const int64_t bandwidth = deltaTime < 1 ? 0 : deltaFlux / deltaTime;
-                KLOGD("delta time: %lld, delta flux: %lld, bw: %lld", ll(deltaTime),
-                      ll(deltaFlux), ll(bandwidth));
+                KLOGD("delta time: %lld, delta flux: %lld, bw: %lld", ll(deltaTime), ll(deltaFlux),
+                      ll(bandwidth));
                 const int64_t ms = timesThousand(deltaTime);
                 const auto& [id, threshold] = mDdrLevels[i];
                 if (bandwidth <= threshold) {
@@ -557,9 +554,10 @@ int32_t DpmHandler::setPeriodData(Parcel& out, int64_t end, int64_t window, floa
             }
         }
         const int64_t energy = KelvoUtils::scaleEnergy(v[5], ratio);
-        KLOGD("Ip: %lld, Off: %lld, Busy: %lld, LowBusy: %lld, Idle: %lld, Energy: %lld, "
-              "Total: %lld",
-              ll(v[0]), ll(v[1]), ll(v[2]), ll(v[3]), ll(v[4]), ll(energy), ll(v[5]));
+        KLOGD(
+            "Ip: %lld, Off: %lld, Busy: %lld, LowBusy: %lld, Idle: %lld, Energy: %lld, "
+            "Total: %lld",
+            ll(v[0]), ll(v[1]), ll(v[2]), ll(v[3]), ll(v[4]), ll(energy), ll(v[5]));
         if (energy < 1) {
             continue;
         }
@@ -605,4 +603,4 @@ int32_t DpmHandler::onDawnUploading(const Parcel& data) {
     return uploadPeriod(EVENT_DAILY_COMPONENTS, data, kDawnMs, kCandidateDawnUpload);
 }
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -1,13 +1,12 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stdint.h>
 
 #include <array>
 #include <map>
 #include <string>
 #include <vector>
-
-#include <binder/Parcel.h>
 
 #include "core/KelvoOperator.h"
 #include "storage/TableAttribute.h"
@@ -90,4 +89,4 @@ private:
     bool mChargerOnline = false;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -30,7 +30,7 @@ int64_t saturate(bool overflow, int64_t value, bool negative, bool* clamped) {
     return negative ? std::numeric_limits<int64_t>::min() : std::numeric_limits<int64_t>::max();
 }
 
-} // namespace
+}  // namespace
 
 DpmAccounter::DpmAccounter() {
     std::vector<config_parameter> parameters;
@@ -131,4 +131,4 @@ int32_t DpmAccounter::onActionSetValue(const Parcel& action) {
     return 0;
 }
 
-} // namespace kelvo
+}  // namespace kelvo

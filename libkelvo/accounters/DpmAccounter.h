@@ -1,11 +1,10 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stdint.h>
 
 #include <array>
 #include <map>
-
-#include <binder/Parcel.h>
 
 #include "accounters/DataAccounter.h"
 
@@ -36,4 +35,4 @@ private:
     std::map<int32_t, std::array<int64_t, 4>> mCoefficients;
 };
 
-} // namespace kelvo
+}  // namespace kelvo

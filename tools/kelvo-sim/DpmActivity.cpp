@@ -129,9 +129,9 @@ DpmActivity::DpmActivity(const std::string& configPath) {
             values.push_back(v->GetText() != nullptr ? atoll(v->GetText()) : 0);
         }
         if (values.size() >= 4) {
-            mCoefficients.emplace(p->IntAttribute("id", -1),
-                                  std::array<int64_t, 4>{values[0], values[1], values[2],
-                                                         values[3]});
+            mCoefficients.emplace(
+                p->IntAttribute("id", -1),
+                std::array<int64_t, 4>{values[0], values[1], values[2], values[3]});
         }
     }
 }
@@ -236,8 +236,7 @@ std::string DpmActivity::report(const std::string& databasePath,
     snprintf(line, sizeof(line),
              "  driven: %zu blocks, DDR %lld s and %lld MB (the DDR_BW_FREQ_ rows; the first "
              "read only takes the DDR baselines)\n",
-             mTruth.size(), static_cast<long long>(mDdrSeconds),
-             static_cast<long long>(mDdrFlux));
+             mTruth.size(), static_cast<long long>(mDdrSeconds), static_cast<long long>(mDdrFlux));
     out << line;
     return out.str();
 }

@@ -24,6 +24,7 @@ struct dpm_ddr_level {
     int64_t threshold;
 };
 
+// clang-format off
 inline constexpr dpm_ip_name kDpmPolicy1Ips[] = {
     {0, "DSS"},            {1, "DDRC_CH0"},        {2, "DDRC_CH1"},      {3, "DDRC_CH2"},
     {4, "DDRC_CH3"},       {5, "MEM_SUBSYS"},      {6, "CPU_LITTLE"},    {7, "CPU_BIG"},
@@ -53,6 +54,7 @@ inline constexpr dpm_ip_name kDpmPolicy2Ips[] = {
     {151, "SLEEP_STATE2"},  {152, "LP_STATE0"},     {153, "LP_STATE1"},     {154, "LP_STATE2"},
     {155, "LP_STATE3"},     {156, "LP_STATE4"},
 };
+// clang-format on
 
 // Policy 2 only; level i is "DDR_BW_FREQ_<i>".
 inline constexpr dpm_ddr_level kDpmDdrLevels[] = {
@@ -71,4 +73,4 @@ static_assert(kDpmPolicy2IpCount == 58, "policy 2 table");
 // The name prefix of the DDR bandwidth levels.
 inline constexpr const char* kDpmDdrLevelPrefix = "DDR_BW_FREQ_";
 
-} // namespace kelvo
+}  // namespace kelvo

@@ -54,7 +54,9 @@ std::string config(int32_t policy) {
 class Poller : public KelvoOperator {
 public:
     Poller() : KelvoOperator("DpmPoller", -1, 0) {}
-    void setupListeners(Parcel& out) override { addNotifierListener(NOTIFICATION_HOURLY_TICK, out); }
+    void setupListeners(Parcel& out) override {
+        addNotifierListener(NOTIFICATION_HOURLY_TICK, out);
+    }
     int32_t onHourlyTick(const Parcel& data) override {
         PollingPayload poll;
         poll.reason = POLLING_HOURLY_TICK;
@@ -128,8 +130,10 @@ protected:
         mDriver.update([&](Driver::State& s) { s.ddrValues = {times, flux}; });
     }
     std::vector<std::string> rawRows(const std::string& where = "1") {
-        return rows("SELECT ip, off_time, busy_time, busy_time_low_voltage, idle_time, energy, "
-                    "charge_energy FROM raw_component_dpm WHERE " + where + " ORDER BY id");
+        return rows(
+            "SELECT ip, off_time, busy_time, busy_time_low_voltage, idle_time, energy, "
+            "charge_energy FROM raw_component_dpm WHERE " +
+            where + " ORDER BY id");
     }
 
     test::LogCapture mLog;
@@ -177,9 +181,10 @@ TEST_F(DpmHandlerTest, DdrLevels) {
     };
     const std::vector<Step> steps = {
         {{5, 5, 5, 5}, {100, 100, 100, 100}, {}},
-        {{15, 15, 15, 6}, {15100, 15100, 15100, 1100}, {
-             "10000|0|0|10000|15000|25", "10001|0|0|10000|15000|35",
-             "10002|10000|15000|0|0|45", "10003|1000|1000|0|0|5"}},
+        {{15, 15, 15, 6},
+         {15100, 15100, 15100, 1100},
+         {"10000|0|0|10000|15000|25", "10001|0|0|10000|15000|35", "10002|10000|15000|0|0|45",
+          "10003|1000|1000|0|0|5"}},
         {{3, 15, 15, 6}, {3000, 15100, 15100, 1100}, {"10000|3000|3000|0|0|6"}},
         {{1, 1, 1}, {1, 1, 1}, {}},
         {{9, 9, 9, 9}, {9, 9, 9, 9}, {}},
@@ -244,10 +249,10 @@ TEST_F(DpmHandlerTest, ForcedReadMovesTheNextStart) {
     EXPECT_EQ(0, mDpm->sendCustomizedMessage(DpmHandler::kCustomizedRead, Parcel(), &reply, true));
     mDriver.addIpTime("DSS", Driver::DPM_BUSY, 1000);
     poll(60000);
-    EXPECT_EQ((std::vector<std::string>{std::to_string(kT) + "|" + std::to_string(kT + 30000),
-                                        std::to_string(kT + 30000) + "|" +
-                                            std::to_string(kT + 60000)}),
-              rows("SELECT start_time, end_time FROM raw_component_dpm ORDER BY id"));
+    EXPECT_EQ(
+        (std::vector<std::string>{std::to_string(kT) + "|" + std::to_string(kT + 30000),
+                                  std::to_string(kT + 30000) + "|" + std::to_string(kT + 60000)}),
+        rows("SELECT start_time, end_time FROM raw_component_dpm ORDER BY id"));
 }
 
 // The hourly round: the hour's read, the component accounting and the
