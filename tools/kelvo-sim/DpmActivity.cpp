@@ -233,10 +233,14 @@ std::string DpmActivity::report(const std::string& databasePath,
     }
     sqlite3_finalize(stmt);
     sqlite3_close(db);
+    size_t blocks = 0;
+    for (const auto& entry : mTruth) {
+        blocks += entry.first.rfind(kDpmDdrLevelPrefix, 0) == 0 ? 0 : 1;
+    }
     snprintf(line, sizeof(line),
              "  driven: %zu blocks, DDR %lld s and %lld MB (the DDR_BW_FREQ_ rows; the first "
              "read only takes the DDR baselines)\n",
-             mTruth.size(), static_cast<long long>(mDdrSeconds), static_cast<long long>(mDdrFlux));
+             blocks, static_cast<long long>(mDdrSeconds), static_cast<long long>(mDdrFlux));
     out << line;
     return out.str();
 }
