@@ -8,6 +8,7 @@
 #include "accounters/BrightnessAccounter.h"
 #include "accounters/CameraAccounter.h"
 #include "accounters/CpuAccounter.h"
+#include "accounters/DpmAccounter.h"
 #include "accounters/FlashlightAccounter.h"
 #include "accounters/GnssAccounter.h"
 #include "accounters/GpuAccounter.h"
@@ -51,6 +52,8 @@ KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
             return [] { return std::make_unique<AudioAccounter>(); };
         case ACCOUNTER_WIFI:
             return [] { return std::make_unique<WifiAccounter>(); };
+        case ACCOUNTER_DPM:
+            return [] { return std::make_unique<DpmAccounter>(); };
         case ACCOUNTER_CPU:
             return [] {
                 return std::make_unique<CpuAccounter>(

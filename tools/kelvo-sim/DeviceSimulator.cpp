@@ -249,6 +249,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
     mGpu.reset(new GpuLoadTruth(config));
     mCameras.reset(new CameraTruth(mScenario, config));
+    mDpm.reset(new DpmActivity(config));
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -290,6 +291,7 @@ bool DeviceSimulator::startServices(std::string* error) {
         return mComponents->takeAdvancedValue(mModelMs);
     });
     mSystem->configureDriver(*mDriver);
+    mDpm->prepare(*mDriver);
     mReporter.reset(new fake::FakeDriverReporter(*mDriver));
     mReporter->setBodyProvider([this](const fake::FakeDriverReporter::Report& report) {
         return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME
@@ -426,6 +428,15 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             std::lock_guard<std::mutex> lock(mLock);
             if (mDriver) {
                 mGpu->apply(step, *mDriver);
+            }
+            return;
+        }
+        case Scenario::Action::Dpm:
+        case Scenario::Action::Ddr: {
+            // Counters the daemon reads from the power monitor: no record.
+            std::lock_guard<std::mutex> lock(mLock);
+            if (mDriver) {
+                mDpm->apply(step, *mDriver);
             }
             return;
         }
@@ -698,6 +709,8 @@ int DeviceSimulator::finish(bool completed) {
         components += mGpu->report(SimReport::databasePath(mOptions.root));
         mCameras->advanceTo(mModelMs);
         components += mCameras->report(SimReport::databasePath(mOptions.root));
+        components += mDpm->report(SimReport::databasePath(mOptions.root),
+                                   SimReport::eventsPath(mOptions.root));
     }
     report.addSection(components);
     BatteryReport::Model battery;

@@ -14,6 +14,7 @@
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "GpuLoadTruth.h"
+#include "DpmActivity.h"
 #include "PlatformState.h"
 #include "RadioSensorTruth.h"
 #include "Scenario.h"
@@ -118,6 +119,7 @@ private:
     std::unique_ptr<RadioSensorTruth> mRadioSensors;
     std::unique_ptr<GpuLoadTruth> mGpu;  // under mLock
     std::unique_ptr<CameraTruth> mCameras;
+    std::unique_ptr<DpmActivity> mDpm;  // under mLock
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;
