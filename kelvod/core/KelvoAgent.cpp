@@ -26,6 +26,7 @@
 #include "handlers/components/WifiHandler.h"
 #include "handlers/components/SensorHandler.h"
 #include "handlers/components/CameraHandler.h"
+#include "handlers/components/ModemHandler.h"
 #include "handlers/SystemHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
@@ -93,6 +94,10 @@ android::sp<KelvoOperator> makeCameraHandler() {
     return new CameraHandler();
 }
 
+android::sp<KelvoOperator> makeModemHandler() {
+    return new ModemHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -124,6 +129,7 @@ struct Factories {
         handlers[HANDLER_SENSOR] = &makeSensorHandler;
         handlers[HANDLER_GPU] = &makeGpuHandler;
         handlers[HANDLER_CAMERA] = &makeCameraHandler;
+        handlers[HANDLER_MODEM] = &makeModemHandler;
     }
 
     std::mutex lock;
