@@ -11,6 +11,7 @@
 #include "accounters/FlashlightAccounter.h"
 #include "accounters/GnssAccounter.h"
 #include "accounters/GpuAccounter.h"
+#include "accounters/ModemAccounter.h"
 #include "accounters/SensorAccounter.h"
 #include "accounters/WifiAccounter.h"
 #include "SqlTypes.h"
@@ -51,6 +52,8 @@ KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
             return [] { return std::make_unique<AudioAccounter>(); };
         case ACCOUNTER_WIFI:
             return [] { return std::make_unique<WifiAccounter>(); };
+        case ACCOUNTER_MODEM:
+            return [] { return std::make_unique<ModemAccounter>(); };
         case ACCOUNTER_CPU:
             return [] {
                 return std::make_unique<CpuAccounter>(
