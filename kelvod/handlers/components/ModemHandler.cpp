@@ -37,8 +37,6 @@ constexpr int64_t kDawnMs = 21600000;
 constexpr int32_t kRowsPerInsert = 200;
 constexpr uint32_t kClassCallUsage = 903009042;
 constexpr uint32_t kCallUsageField = 24;
-// The accounter's modem SetValue subtype of the charger state.
-constexpr int32_t kChargerSubtype = 5;
 // A component record in the result: int64 start, int64 end, int32 module,
 // int64 duration, int64 energy.
 constexpr size_t kComponentRecordBytes = 8 + 8 + 4 + 8 + 8;
@@ -514,7 +512,7 @@ int32_t ModemHandler::onBlockMessage(const Parcel& data) {
         Parcel action;
         action.writeInt32(mAccounterType);
         action.writeInt32(ACTION_SET_VALUE);
-        action.writeInt32(kChargerSubtype);
+        action.writeInt32(MODEM_CHARGER);
         action.writeBool(mChargerOnline);
         feedAccounter(action);
     }
