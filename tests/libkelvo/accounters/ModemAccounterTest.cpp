@@ -47,7 +47,7 @@ using Line = std::pair<int64_t, int64_t>;  // usage, energy
 using Lines = std::map<std::pair<int32_t, int32_t>, Line>;
 
 struct Residency {
-    int32_t subtype;
+    int32_t subtype;  // 0 voice, 1 idle, 2 data
     int32_t module;
     std::vector<int32_t> lte;  // modulation, base usage (module 5 only)
     std::vector<int32_t> times;
@@ -155,95 +155,46 @@ protected:
 TEST_F(ModemAccounterTest, ResidencyPerModuleAndLevel) {
     // 9 levels of INT32_MAX ms at INT32_MAX: the sum needs more than 64 bits.
     const int64_t wide = static_cast<int64_t>(static_cast<__int128>(kMax) * kMax * 9 / 1000);
-    const std::vector<int32_t> maxTimes(9, kMax);
+    // code: the scenario code of the one line expected; -1: refused, no line.
     struct Case {
         const char* what;
-        Residency residency;
-        int32_t result;
-        Lines expected;
+        Residency r;
+        int32_t code;
+        int64_t usage, energy;
         const char* logged;
     } cases[] = {
-        {"idle, module 9",
-         {MODEM_IDLE_RESIDENCY, 9, {}, {100, 200, 300}},
-         0,
-         {{{1, 9}, {600, (1000 + 4000 + 9000) / 1000}}},
-         nullptr},
-        {"a level past the configured powers counts 0",
-         {MODEM_IDLE_RESIDENCY, 9, {}, {0, 0, 0, 500}},
-         0,
-         {{{1, 9}, {500, 0}}},
-         nullptr},
-        {"negative and zero times are skipped",
-         {MODEM_IDLE_RESIDENCY, 9, {}, {-50, 0, 1000}},
-         0,
-         {{{1, 9}, {1000, 30}}},
-         nullptr},
-        {"LTE voice, modulation 1: key 1, usage the base",
-         {MODEM_VOICE_RESIDENCY, 5, {1, 500}, {10, 20}},
-         0,
-         {{{0, 5}, {500, (1000 + 4000) / 1000}}},
-         nullptr},
-        {"LTE data, modulation 0: key 2, usage base + times",
-         {MODEM_DATA_RESIDENCY, 5, {0, 7}, {1, 2}},
-         0,
-         {{{2, 5}, {10, 5}}},
-         nullptr},
-        {"LTE voice, modulation 0: key 2",
-         {MODEM_VOICE_RESIDENCY, 5, {0, 40}, {1, 2}},
-         0,
-         {{{0, 5}, {40, 5}}},
-         nullptr},
-        {"LTE, unknown modulation: key 2",
-         {MODEM_DATA_RESIDENCY, 5, {3, 0}, {1}},
-         0,
-         {{{2, 5}, {1, 1}}},
-         "Unknown modulation type: 3"},
-        {"module 7, data: mode 5 by scenario",
-         {MODEM_DATA_RESIDENCY, 7, {}, {1000}},
-         0,
-         {{{2, 7}, {1000, 1000}}},
-         nullptr},
-        {"module 11: Px at every level",
-         {MODEM_DATA_RESIDENCY, 11, {}, {1000, 1000, 1000}},
-         0,
-         {{{2, 11}, {3000, 21}}},
-         nullptr},
-        {"nine levels",
-         {MODEM_DATA_RESIDENCY, 8, {}, {1000, 1000, 1000, 1000, 1000, 1000, 1000, 1000, 1000}},
-         0,
-         {{{2, 8}, {9000, 45}}},
-         nullptr},
-        {"sums beyond 64 bits",
-         {MODEM_DATA_RESIDENCY, 0, {}, maxTimes},
-         0,
-         {{{2, 0}, {9LL * kMax, wide}}},
-         nullptr},
-        {"ten levels",
-         {MODEM_DATA_RESIDENCY, 8, {}, std::vector<int32_t>(10, 1000)},
-         -1,
-         {},
-         "Invalid signal level size: 10"},
-        {"negative level count",
-         {MODEM_DATA_RESIDENCY, 8, {}, {}, -1},
-         -1,
-         {},
-         "Invalid signal level size: -1"},
-        {"module -1", {MODEM_DATA_RESIDENCY, -1, {}, {1000}}, -1, {}, "Invalid module: -1"},
-        {"module 12", {MODEM_DATA_RESIDENCY, 12, {}, {1000}}, -1, {}, "Invalid module: 12"},
-        {"module 10", {MODEM_DATA_RESIDENCY, 10, {}, {1000}}, -1, {}, "Unknown module: 10"},
-        {"level count past the data", {MODEM_DATA_RESIDENCY, 8, {}, {1000}, 3}, -1, {}, nullptr},
+        {"idle, module 9", {1, 9, {}, {100, 200, 300}}, 1, 600, (1000 + 4000 + 9000) / 1000, ""},
+        {"a level past the configured powers", {1, 9, {}, {0, 0, 0, 500}}, 1, 500, 0, ""},
+        {"negative and zero times skipped", {1, 9, {}, {-50, 0, 1000}}, 1, 1000, 30, ""},
+        {"LTE voice, modulation 1: key 1, the base", {0, 5, {1, 500}, {10, 20}}, 0, 500, 5, ""},
+        {"LTE data, modulation 0: key 2, base + times", {2, 5, {0, 7}, {1, 2}}, 2, 10, 5, ""},
+        {"LTE voice, modulation 0: key 2", {0, 5, {0, 40}, {1, 2}}, 0, 40, 5, ""},
+        {"LTE, modulation 3: key 2", {2, 5, {3, 0}, {1}}, 2, 1, 1, "Unknown modulation type: 3"},
+        {"module 7: mode 5 by scenario", {2, 7, {}, {1000}}, 2, 1000, 1000, ""},
+        {"module 11: Px at every level", {2, 11, {}, {1000, 1000, 1000}}, 2, 3000, 21, ""},
+        {"nine levels", {2, 8, {}, std::vector<int32_t>(9, 1000)}, 2, 9000, 45, ""},
+        {"sums beyond 64 bits", {2, 0, {}, std::vector<int32_t>(9, kMax)}, 2, 9LL * kMax, wide, ""},
+        {"ten levels", {2, 8, {}, std::vector<int32_t>(10, 1)}, -1, 0, 0, "level size: 10"},
+        {"negative level count", {2, 8, {}, {}, -1}, -1, 0, 0, "Invalid signal level size: -1"},
+        {"module -1", {2, -1, {}, {1000}}, -1, 0, 0, "Invalid module: -1"},
+        {"module 12", {2, 12, {}, {1000}}, -1, 0, 0, "Invalid module: 12"},
+        {"module 10", {2, 10, {}, {1000}}, -1, 0, 0, "Invalid mode index: -1"},
+        {"level count past the data", {2, 8, {}, {1000}, 3}, -1, 0, 0, ""},
     };
     int64_t t = 0;
     for (const Case& c : cases) {
         SCOPED_TRACE(c.what);
         mLog.clear();
-        EXPECT_EQ(c.result, send(c.residency));
-        EXPECT_EQ(c.expected, balance(t += 3600000));
-        if (c.logged != nullptr) {
+        EXPECT_EQ(c.code < 0 ? -1 : 0, send(c.r));
+        Lines expected;
+        if (c.code >= 0) {
+            expected[{c.code, c.r.module}] = {c.usage, c.energy};
+        }
+        EXPECT_EQ(expected, balance(t += 3600000));
+        if (*c.logged != '\0') {
             EXPECT_TRUE(mLog.contains(c.logged));
         }
     }
-    EXPECT_TRUE(mLog.contains("Invalid mode index: -1"));
 }
 
 // E = 1000 from the data residencies, X = 150 + 50: an application with

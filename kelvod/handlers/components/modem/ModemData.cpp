@@ -7,6 +7,18 @@
 #include "AccounterTypes.h"
 #include "HealthCounters.h"
 #include "KelvoLog.h"
+#include "handlers/components/modem/Cdma1xCasData.h"
+#include "handlers/components/modem/Cdma1xCprocData.h"
+#include "handlers/components/modem/CdmaEvdoCasData.h"
+#include "handlers/components/modem/CdmaEvdoCprocData.h"
+#include "handlers/components/modem/DriverData.h"
+#include "handlers/components/modem/GsmPhyData.h"
+#include "handlers/components/modem/LtePhyData.h"
+#include "handlers/components/modem/LteRrcData.h"
+#include "handlers/components/modem/TdsPhyData.h"
+#include "handlers/components/modem/TdsRrcData.h"
+#include "handlers/components/modem/WcdmaPhyData.h"
+#include "handlers/components/modem/WcdmaRrcData.h"
 #include "utils/TimeProvider.h"
 
 using android::Parcel;
@@ -30,14 +42,69 @@ int32_t clampModemLevel(uint64_t value) {
 }
 
 std::unique_ptr<ModemData> ModemData::create(int32_t module, ModemDataOwner* owner) {
-    (void)module;
-    (void)owner;
-    return nullptr;
+    if (owner == nullptr) {
+        KLOGE("Invalid owner");
+        return nullptr;
+    }
+    switch (module) {
+        case 0:
+            return std::make_unique<Cdma1xCasData>(owner);
+        case 1:
+            return std::make_unique<Cdma1xCprocData>(owner);
+        case 2:
+            return std::make_unique<CdmaEvdoCasData>(owner);
+        case 3:
+            return std::make_unique<CdmaEvdoCprocData>(owner);
+        case 4:
+            return std::make_unique<TdsPhyData>(owner);
+        case 5:
+            return std::make_unique<LtePhyData>(owner);
+        case 6:
+            return std::make_unique<TdsRrcData>(owner);
+        case 7:
+            return std::make_unique<LteRrcData>(owner);
+        case 8:
+            return std::make_unique<WcdmaPhyData>(owner);
+        case 9:
+            return std::make_unique<GsmPhyData>(owner);
+        case 10:
+            return std::make_unique<DriverData>(owner);
+        case 11:
+            return std::make_unique<WcdmaRrcData>(owner);
+        default:
+            return nullptr;
+    }
 }
 
 const table_attribute* ModemData::table(int32_t module) {
-    (void)module;
-    return nullptr;
+    switch (module) {
+        case 0:
+            return &Cdma1xCasData::kTable;
+        case 1:
+            return &Cdma1xCprocData::kTable;
+        case 2:
+            return &CdmaEvdoCasData::kTable;
+        case 3:
+            return &CdmaEvdoCprocData::kTable;
+        case 4:
+            return &TdsPhyData::kTable;
+        case 5:
+            return &LtePhyData::kTable;
+        case 6:
+            return &TdsRrcData::kTable;
+        case 7:
+            return &LteRrcData::kTable;
+        case 8:
+            return &WcdmaPhyData::kTable;
+        case 9:
+            return &GsmPhyData::kTable;
+        case 10:
+            return &DriverData::kTable;
+        case 11:
+            return &WcdmaRrcData::kTable;
+        default:
+            return nullptr;
+    }
 }
 
 ModemData::ModemData(int32_t module, size_t recordSize, ModemDataOwner* owner)
@@ -76,7 +143,7 @@ int32_t ModemData::setData(const uint8_t* packet, size_t size, int64_t time, int
         return MODEM_RECORD_REFUSED;
     }
     if (header.length < mRecordSize) {
-        KLOGE("Invalid input data length %d", clampModemLevel(header.length));
+        KLOGE("Invalid input data length %d", modemLogValue(header.length));
         HealthCounters::add(Health::ModemRecordsRefused);
         return MODEM_RECORD_REFUSED;
     }
@@ -99,9 +166,10 @@ int32_t ModemData::logEntry(int32_t sim, const void* record, int64_t time) {
     if (hasSimColumn()) {
         row.writeInt32(sim);
     }
-    // The columns are int32: a counter past its range is kept at the top.
+    // The columns are int32: a counter keeps its 32 bits, so one above
+    // INT32_MAX reads back as itself once taken as unsigned.
     for (size_t i = 0; i < mRecordSize / sizeof(uint32_t); ++i) {
-        row.writeInt32(clampModemLevel(fields[i]));
+        row.writeInt32(static_cast<int32_t>(fields[i]));
     }
     row.setDataPosition(0);
     return mOwner->logModemData(tableIndex(mModule), row);
@@ -127,7 +195,7 @@ int32_t ModemData::sendLevels(int32_t subtype, const int64_t* levels, int32_t co
 }
 
 int32_t ModemData::sendIdleSplit(uint64_t total, uint64_t divisor, const uint32_t counts[3],
-                                 uint64_t factor) {
+                                 uint64_t factor, bool perCount) {
     if (divisor == 0) {
         KLOGI("idle count is 0");
         if (total > 0) {
@@ -138,11 +206,12 @@ int32_t ModemData::sendIdleSplit(uint64_t total, uint64_t divisor, const uint32_
     }
     int64_t levels[3] = {};
     for (int32_t i = 0; i < 3; ++i) {
-        // Multiplied first, then divided, as the modem counts it; exact in
-        // 128 bits.
+        // Exact in 128 bits: a count, a total and a factor of 32 bits each.
         const unsigned __int128 share =
-                static_cast<unsigned __int128>(counts[i]) * total / divisor * factor;
-        levels[i] = clampModemLevel(share > kInt32Max ? kInt32Max + 1 : static_cast<uint64_t>(share));
+            perCount ? static_cast<unsigned __int128>(counts[i]) * (total / divisor) * factor
+                     : static_cast<unsigned __int128>(counts[i]) * total / divisor * factor;
+        levels[i] =
+            clampModemLevel(share > kInt32Max ? kInt32Max + 1 : static_cast<uint64_t>(share));
     }
     KLOGM(LOG_MODULE_MODEM, "module=%d, idle weak=%d, mid=%d, strong=%d", mModule,
           static_cast<int32_t>(levels[0]), static_cast<int32_t>(levels[1]),

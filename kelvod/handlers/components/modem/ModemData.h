@@ -1,11 +1,11 @@
 #pragma once
 
+#include <binder/Parcel.h>
 #include <stddef.h>
 #include <stdint.h>
+#include <string.h>
 
 #include <memory>
-
-#include <binder/Parcel.h>
 
 #include "handlers/components/modem/ModemDataOwner.h"
 #include "storage/TableAttribute.h"
@@ -50,10 +50,10 @@ static_assert(kModemPacketHeaderSize == 12, "modem record header is three uint32
 // What setData made of one record. A refused record never ends the block:
 // only the caller's own checks of the block do.
 enum ModemRecordResult : int32_t {
-    MODEM_RECORD_ACCOUNTED = 0,  // row stored, every action sent
-    MODEM_RECORD_STORED = 1,     // row stored; the energy step refused (part of) the record
-    MODEM_RECORD_REFUSED = 2,    // dropped (null or short): no row, no action
-    MODEM_RECORD_NOT_STORED = 3, // the owner refused the row (actions were sent)
+    MODEM_RECORD_ACCOUNTED = 0,   // row stored, every action sent
+    MODEM_RECORD_STORED = 1,      // row stored; the energy step refused (part of) the record
+    MODEM_RECORD_REFUSED = 2,     // dropped (null or short): no row, no action
+    MODEM_RECORD_NOT_STORED = 3,  // the owner refused the row (actions were sent)
     // Negative: the packet does not fit in the bytes handed over (a block fault).
 };
 
@@ -107,15 +107,16 @@ protected:
     // physical layer the modulation and base usage, then the level times.
     int32_t sendLevels(int32_t subtype, const int64_t* levels, int32_t count,
                        int32_t modulation = 0, int64_t baseUsage = 0);
-    // Idle times at three signal levels: level i is counts[i] * total /
-    // divisor, then * factor; nothing is sent for a divisor of 0. Returns 1
-    // when refused, else 0.
+    // Idle times at three signal levels (weak, mid, strong). Split: level i
+    // is counts[i] * total / divisor, then * factor. Per count (perCount):
+    // counts[i] * (total / divisor), then * factor. Nothing is sent for a
+    // divisor of 0. Returns 1 when refused, else 0.
     int32_t sendIdleSplit(uint64_t total, uint64_t divisor, const uint32_t counts[3],
-                          uint64_t factor);
+                          uint64_t factor, bool perCount = false);
     // Whether a record with this table has a SIM column.
     bool hasSimColumn() const;
 
-    ModemDataOwner* mOwner; // not owned; outlives the decoder
+    ModemDataOwner* mOwner;  // not owned; outlives the decoder
 
 private:
     const int32_t mModule;
@@ -123,8 +124,35 @@ private:
     int64_t mLastUpdateTime;
 };
 
+// Record layouts are lists of uint32 counters, each written once: the
+// record struct takes MODEM_RECORD_FIELD of the list, the table's columns
+// MODEM_RECORD_COLUMN.
+#define MODEM_RECORD_FIELD(name) uint32_t name;
+#define MODEM_RECORD_COLUMN(name) {COLUMN_INT, #name},
+
+// A record read from the decoder's aligned copy.
+template <typename Record>
+Record readModemRecord(const void* data) {
+    Record record;
+    memcpy(&record, data, sizeof(record));
+    return record;
+}
+
+template <size_t N>
+constexpr int32_t modemColumnCount(const column_attribute (&)[N]) {
+    return static_cast<int32_t>(N);
+}
+
 // Bounded integer helpers of the energy step: every product is formed in 64
 // bits, and a level sent to the accounter never exceeds INT32_MAX.
 int32_t clampModemLevel(uint64_t value);
+// A counter for a log line: held at INT32_MAX, not counted as clamped.
+inline int32_t modemLogValue(uint32_t value) {
+    return value > 0x7FFFFFFFu ? 0x7FFFFFFF : static_cast<int32_t>(value);
+}
+// A tick counter in ms: t >> 12, then * 125 (t * 125 / 4096, the shift first).
+inline int64_t modemTicksToMs(uint32_t ticks) {
+    return static_cast<int64_t>(ticks >> 12) * 125;
+}
 
 }  // namespace kelvo
