@@ -316,9 +316,9 @@ TEST_F(ModemHandlerTest, RecordsTrafficAndTheHour) {
     EXPECT_EQ((std::vector<std::string>{"com.a|5000|500|250", "com.b|15000|1500|750"}),
               rows("SELECT name, background_tx_bytes, background_rx_bytes, background_energy "
                    "FROM raw_applications_modem ORDER BY name"));
-    EXPECT_EQ((std::vector<std::string>{"com.a|0|250", "com.b|0|750", "modem_idle|8|0",
-                                        "modem_voice|0|250"}),
-              rows("SELECT name, foreground_energy, background_energy FROM "
+    EXPECT_EQ((std::vector<std::string>{h + "|com.a|0|250", h + "|com.b|0|750",
+                                        h + "|modem_idle|8|0", h + "|modem_voice|0|250"}),
+              rows("SELECT timestamp, name, foreground_energy, background_energy FROM "
                    "hourly_applications_accounting WHERE component = 9 ORDER BY name"));
     EXPECT_EQ(std::vector<std::string>{h + "|8|1250|20000"},
               rows("SELECT timestamp, foreground_energy, background_energy, background_tx_bytes "
@@ -337,16 +337,23 @@ TEST_F(ModemHandlerTest, RecordsTrafficAndTheHour) {
 }
 
 // Without an answer the hour is voted for after the (shortened) time-out;
-// the late answer casts no vote and is stamped when it arrives.
+// the late answer casts no vote and is stamped when it arrives. Its traffic
+// came without any data energy and still reaches the applications' rows.
 TEST_F(ModemHandlerTest, NoAnswerVotesAndALateOneIsStampedAtArrival) {
     test::LogCapture log;
     ModemHandler::setTimingForTest(200, 50);
     tick(kH);
     ASSERT_TRUE(roundDone(1));
+    writeTraffic(*mRoot, 50, 150);
     ASSERT_EQ(0, post(block({pam(1)})));
     EXPECT_EQ(std::vector<std::string>{std::to_string(kH + 500)},
               rows("SELECT timestamp FROM raw_modem_pam_wakeup_source"));
     EXPECT_FALSE(log.contains("mismatched candidate"));
+    tick(kH + kHour);
+    ASSERT_TRUE(roundDone(2));
+    EXPECT_EQ((std::vector<std::string>{"com.a|5000|0", "com.b|15000|0"}),
+              rows("SELECT name, background_tx_bytes, background_energy FROM "
+                   "raw_applications_modem ORDER BY name"));
 }
 
 }  // namespace
