@@ -67,9 +67,16 @@ std::string block() {
     for (size_t fields : kFields) {
         put(static_cast<uint32_t>(4 * fields));
         put(0);
-        put(module++);
+        const uint32_t id = module++;
+        put(id);
         for (size_t i = 0; i < fields; ++i) {
-            put(static_cast<uint32_t>(1000 + 100 * i));
+            uint32_t value = static_cast<uint32_t>(1000 + 100 * i);
+            if (id == 5) {
+                // LTE physical layer: band 0, the active time within the
+                // connected time and above the transmit and VoLTE times.
+                value = i == 10 ? 0 : i == 7 ? (1u << 28) : i == 8 ? (1u << 27) : value << 12;
+            }
+            put(value);
         }
     }
     std::string out;
