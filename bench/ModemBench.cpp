@@ -43,9 +43,8 @@ void writeCounters(long long n) {
     for (int uid = 10000; uid < 10000 + kUids; ++uid) {
         for (int set = 0; set < 2; ++set) {
             uids += std::to_string(index++) + " rmnet_data0 0x0 " + std::to_string(uid) + " " +
-                    std::to_string(set) + " " + std::to_string(n * 1500) + " " +
-                    std::to_string(n) + " " + std::to_string(n * 700) + " " + std::to_string(n) +
-                    "\n";
+                    std::to_string(set) + " " + std::to_string(n * 1500) + " " + std::to_string(n) +
+                    " " + std::to_string(n * 700) + " " + std::to_string(n) + "\n";
         }
     }
     const std::string root = kelvo::RootPath::root();
@@ -53,9 +52,8 @@ void writeCounters(long long n) {
     writeFile(root + kelvo::TrafficReader::kPidStatsPath,
               "iface\tuid\tpid\tname\trx_bytes\ttx_bytes\trx_packets\ttx_packets\n");
     writeFile(root + kelvo::TrafficReader::kInterfaceStatsPath,
-              "rmnet_data0 1 0 0 0 0 " + std::to_string(n * 900000) + " " +
-                  std::to_string(n * 600) + " " + std::to_string(n * 400000) + " " +
-                  std::to_string(n * 600) + "\n");
+              "rmnet_data0 1 0 0 0 0 " + std::to_string(n * 900000) + " " + std::to_string(n * 600) +
+                  " " + std::to_string(n * 400000) + " " + std::to_string(n * 600) + "\n");
 }
 
 // The block: n, data length, then per record L, SIM, module and counters
@@ -95,12 +93,11 @@ void BM_ModemBlock(benchmark::State& state) {
     const std::string root = tmpl;
     const std::string savedRoot = kelvo::RootPath::root();
     kelvo::RootPath::setRoot(root.c_str());
-    std::string cmd = "mkdir -p '" + root + "/proc/net/xt_qtaguid' '" + root +
-                      "/proc/net/proc_netstat' '" + root +
-                      "/sys/devices/platform/tervin_modem_pm_info' '" + root +
-                      "/data/misc/kelvo' && touch '" + root + kelvo::ModemHandler::kControlPath +
-                      "' && cp '" KELVO_SAMPLE_CONFIG "' '" + root +
-                      "/data/misc/kelvo/tv_kelvo_config.xml'";
+    std::string cmd =
+        "mkdir -p '" + root + "/proc/net/xt_qtaguid' '" + root + "/proc/net/proc_netstat' '" +
+        root + "/sys/devices/platform/tervin_modem_pm_info' '" + root +
+        "/data/misc/kelvo' && touch '" + root + kelvo::ModemHandler::kControlPath +
+        "' && cp '" KELVO_SAMPLE_CONFIG "' '" + root + "/data/misc/kelvo/tv_kelvo_config.xml'";
     bool failed = system(cmd.c_str()) != 0;
     kelvo::XmlParser::resetInstance();
     kelvo::KelvoLibAgent::getInstance()->resetAccountersForTest();

@@ -48,39 +48,47 @@ const column_attribute kPamColumns[] = {
     {COLUMN_INT, "receiver_pid"}, {COLUMN_INT, "msg_id"}, {COLUMN_INT, "count"},
 };
 const column_attribute kRawComponentColumns[] = {
-    {COLUMN_TIME, "start_time"}, {COLUMN_TIME, "end_time"},        {COLUMN_INT, "type"},
-    {COLUMN_INT, "module"},      {COLUMN_LONG, "duration"},        {COLUMN_LONG, "energy"},
+    {COLUMN_TIME, "start_time"},      {COLUMN_TIME, "end_time"},      {COLUMN_INT, "type"},
+    {COLUMN_INT, "module"},           {COLUMN_LONG, "duration"},      {COLUMN_LONG, "energy"},
     {COLUMN_LONG, "charge_duration"}, {COLUMN_LONG, "charge_energy"},
 };
 
-#define MODEM_TEMP_BUCKET(prefix)                                           \
-    {COLUMN_LONG, prefix "_tx_bytes"}, {COLUMN_LONG, prefix "_tx_packets"}, \
-        {COLUMN_LONG, prefix "_rx_bytes"}, {COLUMN_LONG, prefix "_rx_packets"}, {  \
+#define MODEM_TEMP_BUCKET(prefix)                                                 \
+    {COLUMN_LONG, prefix "_tx_bytes"}, {COLUMN_LONG, prefix "_tx_packets"},       \
+        {COLUMN_LONG, prefix "_rx_bytes"}, {COLUMN_LONG, prefix "_rx_packets"}, { \
+        COLUMN_LONG, prefix "_energy"                                             \
+    }
+#define MODEM_BUCKET(prefix)                                                \
+    {COLUMN_LONG, prefix "_tx_bytes"}, {COLUMN_LONG, prefix "_rx_bytes"}, { \
         COLUMN_LONG, prefix "_energy"                                       \
     }
-#define MODEM_BUCKET(prefix)                                           \
-    {COLUMN_LONG, prefix "_tx_bytes"}, {COLUMN_LONG, prefix "_rx_bytes"}, { \
-        COLUMN_LONG, prefix "_energy"                                  \
-    }
 
-const column_attribute kTempApplicationsColumns[] = {
-    {COLUMN_TIME, "start_time"},          {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "name"},                MODEM_TEMP_BUCKET("foreground"),
-    MODEM_TEMP_BUCKET("background"),      MODEM_TEMP_BUCKET("screen_on"),
-    MODEM_TEMP_BUCKET("screen_off"),      MODEM_TEMP_BUCKET("charge_foreground"),
-    MODEM_TEMP_BUCKET("charge_background")};
-const column_attribute kRawApplicationsColumns[] = {
-    {COLUMN_TIME, "start_time"},     {COLUMN_TIME, "end_time"},
-    {COLUMN_TEXT, "name"},           MODEM_BUCKET("foreground"),
-    MODEM_BUCKET("background"),      MODEM_BUCKET("screen_on"),
-    MODEM_BUCKET("screen_off"),      MODEM_BUCKET("charge_foreground"),
-    MODEM_BUCKET("charge_background")};
+const column_attribute kTempApplicationsColumns[] = {{COLUMN_TIME, "start_time"},
+                                                     {COLUMN_TIME, "end_time"},
+                                                     {COLUMN_TEXT, "name"},
+                                                     MODEM_TEMP_BUCKET("foreground"),
+                                                     MODEM_TEMP_BUCKET("background"),
+                                                     MODEM_TEMP_BUCKET("screen_on"),
+                                                     MODEM_TEMP_BUCKET("screen_off"),
+                                                     MODEM_TEMP_BUCKET("charge_foreground"),
+                                                     MODEM_TEMP_BUCKET("charge_background")};
+const column_attribute kRawApplicationsColumns[] = {{COLUMN_TIME, "start_time"},
+                                                    {COLUMN_TIME, "end_time"},
+                                                    {COLUMN_TEXT, "name"},
+                                                    MODEM_BUCKET("foreground"),
+                                                    MODEM_BUCKET("background"),
+                                                    MODEM_BUCKET("screen_on"),
+                                                    MODEM_BUCKET("screen_off"),
+                                                    MODEM_BUCKET("charge_foreground"),
+                                                    MODEM_BUCKET("charge_background")};
 const column_attribute kHourlyApplicationsColumns[] = {
-    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},    MODEM_BUCKET("foreground"),
+    {COLUMN_TIME, "timestamp"}, {COLUMN_TEXT, "name"},     MODEM_BUCKET("foreground"),
     MODEM_BUCKET("background"), MODEM_BUCKET("screen_on"), MODEM_BUCKET("screen_off")};
-const column_attribute kHourlyComponentColumns[] = {
-    {COLUMN_TIME, "timestamp"}, MODEM_BUCKET("foreground"), MODEM_BUCKET("background"),
-    MODEM_BUCKET("screen_on"), MODEM_BUCKET("screen_off")};
+const column_attribute kHourlyComponentColumns[] = {{COLUMN_TIME, "timestamp"},
+                                                    MODEM_BUCKET("foreground"),
+                                                    MODEM_BUCKET("background"),
+                                                    MODEM_BUCKET("screen_on"),
+                                                    MODEM_BUCKET("screen_off")};
 
 #undef MODEM_TEMP_BUCKET
 #undef MODEM_BUCKET
@@ -354,10 +362,14 @@ int32_t ModemHandler::checkEnable() {
 
 void ModemHandler::setupListeners(Parcel& out) {
     static const int32_t kNotifications[] = {
-        NOTIFICATION_DATA_POLLING,         NOTIFICATION_UID_REMOVED,
-        NOTIFICATION_APPLICATIONS_ACCOUNTING, NOTIFICATION_COMPONENT_ACCOUNTING,
-        NOTIFICATION_HOURLY_UPLOADING,     NOTIFICATION_DAILY_UPLOADING,
-        NOTIFICATION_DAWN_UPLOADING,       NOTIFICATION_SCREEN_STATE_CHANGED,
+        NOTIFICATION_DATA_POLLING,
+        NOTIFICATION_UID_REMOVED,
+        NOTIFICATION_APPLICATIONS_ACCOUNTING,
+        NOTIFICATION_COMPONENT_ACCOUNTING,
+        NOTIFICATION_HOURLY_UPLOADING,
+        NOTIFICATION_DAILY_UPLOADING,
+        NOTIFICATION_DAWN_UPLOADING,
+        NOTIFICATION_SCREEN_STATE_CHANGED,
         NOTIFICATION_FOREGROUND_CHANGED,
     };
     for (int32_t type : kNotifications) {
@@ -431,11 +443,10 @@ int32_t ModemHandler::onDataPolling(const Parcel& data) {
         // An hour still waiting (a time-out longer than the hour) is voted
         // for now: its answer is no longer told apart.
         finishHourly();
-        mOutstanding.erase(std::remove_if(mOutstanding.begin(), mOutstanding.end(),
-                                          [](const request& r) {
-                                              return r.reason == POLLING_HOURLY_TICK;
-                                          }),
-                           mOutstanding.end());
+        mOutstanding.erase(
+            std::remove_if(mOutstanding.begin(), mOutstanding.end(),
+                           [](const request& r) { return r.reason == POLLING_HOURLY_TICK; }),
+            mOutstanding.end());
         mHourlyStamp = poll.hour;
         mHourlyPending = true;
         Parcel stamp;
@@ -461,11 +472,10 @@ int32_t ModemHandler::onHourlyTimeout(const Parcel& data) {
           when.toString(TIME_FORMAT_DATE, true));
     mPendingTimeout = -1;
     // A late answer is not this hour's: it is stamped when it arrives.
-    mOutstanding.erase(std::remove_if(mOutstanding.begin(), mOutstanding.end(),
-                                      [](const request& r) {
-                                          return r.reason == POLLING_HOURLY_TICK;
-                                      }),
-                       mOutstanding.end());
+    mOutstanding.erase(
+        std::remove_if(mOutstanding.begin(), mOutstanding.end(),
+                       [](const request& r) { return r.reason == POLLING_HOURLY_TICK; }),
+        mOutstanding.end());
     finishHourly();
     return 0;
 }
@@ -502,9 +512,10 @@ int32_t ModemHandler::onBlockMessage(const Parcel& data) {
         HealthCounters::add(Health::ModemBlocksRefused);
         KLOGE("Failed to read message");
     }
-    int32_t ret = bytes == nullptr ? -9 : handleBlock(static_cast<const uint8_t*>(bytes),
-                                                      static_cast<size_t>(size), answered.time,
-                                                      answered.reason);
+    int32_t ret = bytes == nullptr
+                      ? -9
+                      : handleBlock(static_cast<const uint8_t*>(bytes), static_cast<size_t>(size),
+                                    answered.time, answered.reason);
     // A block read whole, even one a record ended early, is booked.
     if (ret != -9) {
         collectTraffic(answered.time);
@@ -812,9 +823,8 @@ int32_t ModemHandler::redistribute(int64_t time) {
     // hour always reaches the raw table.
     const int64_t packets[2] = {sums[0].v[0], sums[0].v[2]};
     const int64_t energy[2] = {sums[0].v[1], sums[0].v[3]};
-    static const char* const kBuckets[6] = {"foreground",        "background",
-                                            "screen_on",         "screen_off",
-                                            "charge_foreground", "charge_background"};
+    static const char* const kBuckets[6] = {"foreground", "background",        "screen_on",
+                                            "screen_off", "charge_foreground", "charge_background"};
     String8 columns;
     for (const char* b : kBuckets) {
         columns.appendFormat(", %s_tx_bytes, %s_rx_bytes, %s_tx_packets + %s_rx_packets", b, b, b,

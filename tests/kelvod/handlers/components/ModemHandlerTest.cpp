@@ -52,7 +52,9 @@ int64_t monotonic() {
 class TickRelay : public KelvoOperator {
 public:
     TickRelay() : KelvoOperator("TickRelay", -1, 0) {}
-    void setupListeners(Parcel& out) override { addNotifierListener(NOTIFICATION_HOURLY_TICK, out); }
+    void setupListeners(Parcel& out) override {
+        addNotifierListener(NOTIFICATION_HOURLY_TICK, out);
+    }
     int32_t onHourlyTick(const Parcel& data) override {
         PollingPayload poll;
         poll.reason = POLLING_HOURLY_TICK;
@@ -187,8 +189,8 @@ protected:
         parcel.writeInt32(declared >= 0 ? declared : static_cast<int32_t>(bytes.size()));
         parcel.write(bytes.data(), bytes.size());
         Parcel reply;
-        return KelvoAgent::getInstance()->sendToHandler(HANDLER_MODEM, ModemHandler::TAG_MODEM_BLOCK,
-                                                        parcel, &reply, true);
+        return KelvoAgent::getInstance()->sendToHandler(
+            HANDLER_MODEM, ModemHandler::TAG_MODEM_BLOCK, parcel, &reply, true);
     }
     int32_t poll(int32_t reason, int64_t time, int64_t hour = 0) {
         PollingPayload p;
@@ -205,8 +207,9 @@ protected:
         mRoot->writeFile(ModemHandler::kControlPath, "");
         WallClock::setFixedTimeMs(hour + 500);
         mRoutine->sendMessage(ParcelMessage(MESSAGE_TIMER, HourlyRoutine::kHourlyTimerId));
-        ASSERT_TRUE(waitFor(
-            [&] { return mRoot->readFile(ModemHandler::kControlPath) == ModemHandler::kModuleList; }));
+        ASSERT_TRUE(waitFor([&] {
+            return mRoot->readFile(ModemHandler::kControlPath) == ModemHandler::kModuleList;
+        }));
     }
     bool roundDone(size_t rounds) {
         return waitFor([&] { return rows("SELECT id FROM debug_hourly_tick").size() >= rounds; },
@@ -277,10 +280,10 @@ TEST_F(ModemHandlerTest, AnswersCarryTheirRequestsTime) {
     for (uint32_t type : {1u, 2u, 3u}) {
         ASSERT_EQ(0, post(block({pam(type)})));
     }
-    EXPECT_EQ((std::vector<std::string>{std::to_string(kH) + "|1",
-                                        std::to_string(kT + 30 + 50) + "|2",
-                                        std::to_string(kT) + "|3"}),
-              rows("SELECT timestamp, type FROM raw_modem_pam_wakeup_source ORDER BY type"));
+    EXPECT_EQ(
+        (std::vector<std::string>{std::to_string(kH) + "|1", std::to_string(kT + 30 + 50) + "|2",
+                                  std::to_string(kT) + "|3"}),
+        rows("SELECT timestamp, type FROM raw_modem_pam_wakeup_source ORDER BY type"));
 }
 
 // One hour: LTE and WCDMA records answer the hourly request; com.a moved 50
@@ -312,7 +315,8 @@ TEST_F(ModemHandlerTest, RecordsTrafficAndTheHour) {
               rows("SELECT timestamp, fach_time FROM raw_modem_wcdma_rrc"));
     EXPECT_EQ((std::vector<std::string>{"0|8|1000|250", "1|7|1000|8", "2|11|500000|1000"}),
               rows("SELECT type, module, duration, energy FROM raw_component_modem "
-                   "WHERE duration > 0 AND end_time = " + h + " ORDER BY type"));
+                   "WHERE duration > 0 AND end_time = " +
+                   h + " ORDER BY type"));
     EXPECT_EQ((std::vector<std::string>{"com.a|5000|500|250", "com.b|15000|1500|750"}),
               rows("SELECT name, background_tx_bytes, background_rx_bytes, background_energy "
                    "FROM raw_applications_modem ORDER BY name"));
