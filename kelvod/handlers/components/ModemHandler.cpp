@@ -435,7 +435,8 @@ int32_t ModemHandler::onDataPolling(const Parcel& data) {
     data.setDataPosition(0);
     PollingPayload poll;
     if (PollingPayload::readFrom(data, &poll) < 0) {
-        KLOGE("Unknown polling reason");
+        data.setDataPosition(0);
+        KLOGE("Unknown polling reason: %d", data.readInt32());
         return -2;
     }
     KLOGD("reason=%d, timestamp=%lld", poll.reason, static_cast<long long>(poll.time));
@@ -508,9 +509,10 @@ int32_t ModemHandler::onBlockMessage(const Parcel& data) {
         static_cast<size_t>(size) > data.dataAvail()) {
         HealthCounters::add(Health::ModemBlocksRefused);
         KLOGE("Invalid data length: %d", size);
-    } else if ((bytes = data.readInplace(static_cast<size_t>(size))) == nullptr) {
-        HealthCounters::add(Health::ModemBlocksRefused);
-        KLOGE("Failed to read message");
+    } else {
+        // The S bytes are there (checked above); a sender that did not pad
+        // them to four is read all the same.
+        bytes = data.data() + data.dataPosition();
     }
     int32_t ret = bytes == nullptr
                       ? -9
