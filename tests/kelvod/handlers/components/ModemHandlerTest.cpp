@@ -225,7 +225,8 @@ protected:
 // Each length and count of a block is checked against the bytes there
 // before it is used; a record that does not fit, a SIM index of 3 or more
 // or an unknown module ends the block after the records before it. A
-// decoder's own refusal (a short WCDMA record) skips only that record.
+// decoder's own refusal (a short WCDMA record) skips only that record; a
+// long PAM record is stored whole, in inserts the storage takes.
 TEST_F(ModemHandlerTest, MalformedBlocksKeepWhatCameBeforeTheFault) {
     Record cut = pam(9);
     cut.bytes = 1000;  // L past the end
@@ -254,13 +255,15 @@ TEST_F(ModemHandlerTest, MalformedBlocksKeepWhatCameBeforeTheFault) {
         {"module 13", block({pam(1), {0, 13, {1, 2, 3, 4, 5}}, pam(3)}), -1, -3, 1, 1},
         {"module 12 of 45 bytes", pam45Block, -1, 0, 2, 0},
         {"short WCDMA record", block({{1, 11, {1, 2, 3, 4}}, pam(4)}), -1, 0, 1, 0},
+        {"6000 PAM items", block({{0, 12, std::vector<uint32_t>(5 * 6000, 1)}}), -1, 0, 6000, 0},
     };
     for (const Case& c : cases) {
         SCOPED_TRACE(c.name);
         const uint64_t faults = HealthCounters::get(Health::ModemBlocksRefused);
-        const size_t before = rows("SELECT * FROM raw_modem_pam_wakeup_source").size();
+        const std::string count = "SELECT COUNT(*) FROM raw_modem_pam_wakeup_source";
+        const size_t before = std::stoul(rows(count)[0]);
         EXPECT_EQ(c.result, post(c.bytes, c.declared));
-        EXPECT_EQ(before + c.rows, rows("SELECT * FROM raw_modem_pam_wakeup_source").size());
+        EXPECT_EQ(before + c.rows, std::stoul(rows(count)[0]));
         EXPECT_EQ(faults + c.faults, HealthCounters::get(Health::ModemBlocksRefused));
     }
     // The two items of 45 bytes, stamped at their arrival.
