@@ -363,4 +363,28 @@ TEST_F(ModemHandlerTest, NoAnswerVotesAndALateOneIsStampedAtArrival) {
                    "raw_applications_modem ORDER BY name"));
 }
 
+// The component record opens with the accounter's charger state: call time
+// balanced while charging lands in the charge columns and is no
+// discharging energy of modem_voice.
+TEST_F(ModemHandlerTest, ChargingCallTimeFillsTheChargeColumns) {
+    std::vector<uint32_t> wcdmaPhy(34, 0);
+    wcdmaPhy[32] = 100;  // cs_weak_signal_cnt, x 10 ms
+    PollingPayload charger;
+    charger.reason = POLLING_CHARGER;
+    charger.time = kT;
+    charger.online = true;
+    Parcel body;
+    charger.writeTo(body);
+    ASSERT_EQ(0, mModem->sendMessageSync(
+                     ParcelMessage(MESSAGE_NOTIFICATION, NOTIFICATION_DATA_POLLING, body)));
+    ASSERT_EQ(0, post(block({{0, 8, wcdmaPhy}})));  // balanced before the charger went on
+    ASSERT_EQ(0, post(block({{0, 8, wcdmaPhy}})));
+    EXPECT_EQ((std::vector<std::string>{"1000|250|0|0", "0|0|1000|250"}),
+              rows("SELECT duration, energy, charge_duration, charge_energy FROM "
+                   "raw_component_modem WHERE type = 0 ORDER BY rowid"));
+    AppsAccounting::getInstance()->balanceAccount();
+    EXPECT_EQ(std::vector<std::string>{"modem_voice|250"},
+              rows("SELECT name, background_energy FROM hourly_applications_accounting"));
+}
+
 }  // namespace
