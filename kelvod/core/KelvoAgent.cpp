@@ -26,6 +26,7 @@
 #include "handlers/components/WifiHandler.h"
 #include "handlers/components/SensorHandler.h"
 #include "handlers/components/CameraHandler.h"
+#include "handlers/components/ModemHandler.h"
 #include "handlers/SystemHandler.h"
 #include "handlers/DpmHandler.h"
 #include "routines/AbnormalityRoutine.h"
@@ -98,6 +99,10 @@ android::sp<KelvoOperator> makeDpmHandler() {
     return new DpmHandler();
 }
 
+android::sp<KelvoOperator> makeModemHandler() {
+    return new ModemHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -130,6 +135,7 @@ struct Factories {
         handlers[HANDLER_GPU] = &makeGpuHandler;
         handlers[HANDLER_CAMERA] = &makeCameraHandler;
         handlers[HANDLER_DPM] = &makeDpmHandler;
+        handlers[HANDLER_MODEM] = &makeModemHandler;
     }
 
     std::mutex lock;

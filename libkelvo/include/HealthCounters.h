@@ -44,6 +44,7 @@ enum class Health : uint32_t {
     BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
     ModemRecordsRefused,     // modem records dropped (null, short) or not accounted (bad field, no idle count)
+    ModemBlocksRefused,      // modem statistics blocks refused whole or ended early by a record, answers given up
     Count
 };
 

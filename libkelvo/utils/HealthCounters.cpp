@@ -24,6 +24,7 @@ const char* const kHealthNames[] = {
         "battery_readings_kept",
         "handler_state_capped",
         "modem_records_refused",
+        "modem_blocks_refused",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

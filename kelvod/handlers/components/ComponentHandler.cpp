@@ -42,13 +42,15 @@ const upload_pair kResultPairs[] = {{0, 1, 5, 4}, {2, 3, 7, 6}, {4, 5, 1, 0}, {6
 // The energy class of an upload: each (duration, energy) pair whose
 // duration is at least 1, the energy scaled by the period's ratio.
 void energyClass(const component_family& family, const ComponentHandler::sum_row& row, float ratio,
-                 Parcel& out) {
+                 Parcel& out, bool component = false) {
     const int32_t values = static_cast<int32_t>(row.v.size());
     if (family.uploadTraffic != nullptr) {
+        const bool energyAlone = component && family.componentEnergyAlone;
         for (int32_t i = 0; i < family.uploadTrafficCount; ++i) {
             const upload_traffic& group = family.uploadTraffic[i];
             if (group.tx >= values || group.rx >= values || group.energy >= values ||
-                (row.v[group.tx] < 1 && row.v[group.rx] < 1)) {
+                (row.v[group.tx] < 1 && row.v[group.rx] < 1 &&
+                 !(energyAlone && row.v[group.energy] >= 1))) {
                 continue;
             }
             DataUploader::formIntData(group.txField, row.v[group.tx], out);
@@ -513,7 +515,7 @@ int32_t ComponentHandler::uploadComponent(const component_family& family, int64_
         return 0;
     }
     Parcel energy;
-    energyClass(family, sums[0], ratio, energy);
+    energyClass(family, sums[0], ratio, energy, true);
     if (energy.dataSize() > 0) {
         DataUploader::formClassData(family.componentField, kClassEnergy, energy, out);
     }

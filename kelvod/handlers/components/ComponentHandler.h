@@ -142,6 +142,10 @@ struct component_family {
     // overlapping periods up (a day adds its hours up); energies are still
     // summed.
     bool longestDurations = false;
+    // Whether the component class also carries a traffic group with energy
+    // of at least 1 and no bytes (energy drawn without traffic, as the
+    // modem's idle and call energy).
+    bool componentEnergyAlone = false;
 };
 
 // Whether and how a member's component is governed by the data-source policy
