@@ -43,6 +43,7 @@ enum class Health : uint32_t {
     TrafficReadingsRefused,  // traffic lines skipped or refused, keys or lists over their cap
     BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
+    HidlEventsRefused,       // manager service events refused (type, size, memory) or not handed on
     Count
 };
 
