@@ -233,6 +233,12 @@ void HidlHost::serve() {
             if (conn >= 0) {
                 serveConnection(conn, listeners[i - 1]);
                 close(conn);
+            } else if (errno != EAGAIN && errno != EWOULDBLOCK && errno != EINTR &&
+                       errno != ECONNABORTED) {
+                // Out of descriptors, say: the caller stays queued and the
+                // socket readable, so wait before trying again.
+                ALOGE("Cannot accept a call: %s", strerror(errno));
+                usleep(kAcceptRetryMs * 1000);
             }
         }
     }

@@ -36,6 +36,8 @@ public:
     static constexpr int kFrameTimeoutMs = 5000;
     // How long a client waits for the hello and for the reply.
     static constexpr int kCallTimeoutMs = 10000;
+    // The pause after a failed accept (out of descriptors).
+    static constexpr int kAcceptRetryMs = 100;
 
     static HidlHost& self();
 
