@@ -35,6 +35,7 @@ constexpr Ratio kRatios[] = {
         {"binder_vs_raw_process_socket_ratio", "binder_roundtrip_us_p50",
          "raw_unix_socket_process_roundtrip_us_p50"},
         {"gpu_reading_vs_raw_socket_ratio", "gpu_reading_us", "raw_unix_socket_roundtrip_us_p50"},
+        {"hidl_event_vs_binder_ratio", "hidl_event_us_p50", "binder_roundtrip_us_p50"},
 };
 
 bool isFigureName(const std::string& name) {

@@ -1,5 +1,6 @@
 #include "core/KelvoAgent.h"
 
+#include <hidl/HidlTransportSupport.h>
 #include <unistd.h>
 
 #include <algorithm>
@@ -29,6 +30,7 @@
 #include "handlers/components/ModemHandler.h"
 #include "handlers/SystemHandler.h"
 #include "handlers/DpmHandler.h"
+#include "hidl/KelvoManager.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
@@ -335,7 +337,18 @@ void KelvoAgent::stop() {
     }
 }
 
-void KelvoAgent::startHidlService() {}
+void KelvoAgent::startHidlService() {
+    // Vendor calls are served by a pool of their own, apart from the binder
+    // pool the main thread joins.
+    android::hardware::configureRpcThreadpool(KelvoManager::kThreadPoolSize, false);
+    android::sp<KelvoManager> manager = new KelvoManager(this);
+    android::status_t err = manager->registerAsService(KelvoManager::kInstanceName);
+    if (err == android::NO_ERROR) {
+        KLOGI("Register kelvo manager hidl service success");
+    } else {
+        KLOGI("Failed to register kelvo manager hidl service: %d", err);
+    }
+}
 
 void KelvoAgent::startLibrary() {
     kelvo::startLibrary(mStartTime);

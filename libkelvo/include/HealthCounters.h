@@ -45,6 +45,7 @@ enum class Health : uint32_t {
     HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
     ModemRecordsRefused,     // modem records dropped (null, short) or not accounted (bad field, no idle count)
     ModemBlocksRefused,      // modem statistics blocks refused whole or ended early by a record, answers given up
+    HidlEventsRefused,       // manager service events refused (type, size, memory) or not handed on
     Count
 };
 

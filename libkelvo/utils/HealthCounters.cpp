@@ -25,6 +25,7 @@ const char* const kHealthNames[] = {
         "handler_state_capped",
         "modem_records_refused",
         "modem_blocks_refused",
+        "hidl_events_refused",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),
