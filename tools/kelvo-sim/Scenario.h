@@ -56,6 +56,7 @@ public:
         Gpu,        // text: package, frequency: MHz, value: busy ms (GpuLoadTruth)
         Camera,  // text: connect (pid, values: id), configure (values: dual, type, width, height),
                  // unconfigure (values: type), disconnect
+        Modem,   // text: the kind (ModemModel::parseStep), value: level, counters[0]: ms
     };
 
     struct Step {
