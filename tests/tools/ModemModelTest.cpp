@@ -89,7 +89,9 @@ public:
     void request(bool write = true) {
         int fd = open((mRoot + "/" + ModemModel::controlPath()).c_str(), O_WRONLY | O_CLOEXEC);
         ASSERT_GE(fd, 0);
-        if (write) ASSERT_EQ(5, ::write(fd, "30 33", 5));
+        if (write) {
+            ASSERT_EQ(5, ::write(fd, "30 33", 5));
+        }
         close(fd);
     }
     // The n-th block, waiting up to waitMs; empty when none came.
