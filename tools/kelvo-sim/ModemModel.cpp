@@ -101,13 +101,12 @@ int32_t ModemModel::parseStep(const std::vector<std::string>& words, Scenario::S
         bool ok = step->flag ? (words.size() == 3 || words.size() == 4) &&
                                    (words[2] == "lte" || words[2] == "wcdma") &&
                                    (words.size() == 3 ||
-                                    parseLevel(words[3], words[2] == "lte" ? 7 : kWcdmaLevels,
-                                               &step->value))
+                                    parseLevel(words[3], kWcdmaLevels, &step->value))
                              : words.size() == 2;
         if (!ok) {
             *reason =
-                "expected \"at <time> call start lte|wcdma [<level>]\" (LTE 0..6, WCDMA 0..6) "
-                "or \"at <time> call stop\"";
+                "expected \"at <time> call start lte|wcdma [<level 0..6>]\" or \"at <time> call "
+                "stop\"";
             return -1;
         }
         step->tag = step->flag ? words[2] : "";

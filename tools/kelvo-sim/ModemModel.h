@@ -2,7 +2,6 @@
 
 #include <stdint.h>
 
-#include <condition_variable>
 #include <deque>
 #include <functional>
 #include <mutex>
