@@ -253,17 +253,15 @@ std::string ModemModel::buildBlock(const Residency& r, Fault fault, int32_t answ
             memcpy(&records[0], &past, sizeof(past));
         }
     }
-    std::string body;
-    if (fault == Fault::Short) {
-        put32(&body, 1);  // four bytes: no room for the header
-    } else {
-        put32(&body, fault == Fault::Count ? 3 : count);
-        put32(&body, static_cast<uint32_t>(records.size()));
-        body += records;
-    }
     std::string block;
-    put32(&block, static_cast<uint32_t>(body.size()));
-    return block + body;
+    if (fault == Fault::Short) {
+        put32(&block, 1);  // four bytes: no room for the header
+    } else {
+        put32(&block, fault == Fault::Count ? 3 : count);
+        put32(&block, static_cast<uint32_t>(records.size()));
+        block += records;
+    }
+    return block;
 }
 
 ModemModel::ModemModel(std::string root, Sender sender)

@@ -20,10 +20,10 @@ namespace sim {
 // <root>/sys/devices/platform/tervin_modem_pm_info/mod_on. Every write (a
 // close after a modification) is a request; after the scenario's delay it is
 // answered with one statistics block holding the residency accumulated since
-// the previous answer, sent to the manager service as event 100:
-//   int32 S, then S bytes: uint32 n, uint32 length of what follows,
-//   n records of uint32 L, uint32 SIM, uint32 module, L bytes of uint32
-//   counters.
+// the previous answer, sent to the manager service as event 100 (which
+// hands the daemon's modem the block's size S, then its S bytes):
+//   uint32 n, uint32 length of what follows, n records of uint32 L,
+//   uint32 SIM, uint32 module, L bytes of uint32 counters.
 // Records: LTE physical layer (5, times in ticks of 1/32768 s), LTE RRC
 // (7, idle in ms), WCDMA physical layer (8, DRX time in ticks, transmit
 // counts of 10 ms) and the driver (10). A scenario may also leave requests
@@ -68,8 +68,8 @@ public:
     static int32_t parseStep(const std::vector<std::string>& words, Scenario::Step* step,
                              std::string* reason);
 
-    // The block bytes (S first) for a residency; `answers` numbers the
-    // driver record's counts.
+    // The block's bytes for a residency; `answers` numbers the driver
+    // record's counts.
     static std::string buildBlock(const Residency& residency, Fault fault, int32_t answers);
 
     ModemModel(std::string root, Sender sender);
