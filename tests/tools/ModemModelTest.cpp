@@ -275,11 +275,8 @@ TEST(ModemTruthTest, EnergyFollowsTheRecordsAndTheProfile) {
     wcdma.wcdmaVoice[0] = 1005;
     wcdma.wcdmaData[1] = 3000;
     const Case kCases[] = {
-        {"idle", idle, 40, 0, 0},
-        {"lte data", lte, 0, 0, 1000},
-        {"volte", volte, 0, 800, 800},
-        {"band 1", band, 0, 0, 1000},
-        {"wcdma", wcdma, 0, 200, 300},
+        {"idle", idle, 40, 0, 0},     {"lte data", lte, 0, 0, 1000}, {"volte", volte, 0, 800, 800},
+        {"band 1", band, 0, 0, 1000}, {"wcdma", wcdma, 0, 200, 300},
     };
     for (const Case& c : kCases) {
         SCOPED_TRACE(c.name);

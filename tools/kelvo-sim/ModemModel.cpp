@@ -98,11 +98,11 @@ int32_t ModemModel::parseStep(const std::vector<std::string>& words, Scenario::S
         step->flag = words[1] == "start";
         step->text = step->flag ? "call-start" : "call-stop";
         step->value = 3;
-        bool ok = step->flag ? (words.size() == 3 || words.size() == 4) &&
-                                   (words[2] == "lte" || words[2] == "wcdma") &&
-                                   (words.size() == 3 ||
-                                    parseLevel(words[3], kWcdmaLevels, &step->value))
-                             : words.size() == 2;
+        bool ok = step->flag
+                      ? (words.size() == 3 || words.size() == 4) &&
+                            (words[2] == "lte" || words[2] == "wcdma") &&
+                            (words.size() == 3 || parseLevel(words[3], kWcdmaLevels, &step->value))
+                      : words.size() == 2;
         if (!ok) {
             *reason =
                 "expected \"at <time> call start lte|wcdma [<level 0..6>]\" or \"at <time> call "
@@ -114,8 +114,8 @@ int32_t ModemModel::parseStep(const std::vector<std::string>& words, Scenario::S
     }
     if (verb == "modem-answer") {
         step->action = Scenario::Action::Modem;
-        static const std::vector<std::string> kFaults = {"", "short", "count", "length", "sim",
-                                                         "pam"};
+        static const std::vector<std::string> kFaults = {"",       "short", "count",
+                                                         "length", "sim",   "pam"};
         bool ok = false;
         if (words.size() == 3 && words[1] == "delay") {
             step->text = "answer-delay";
@@ -147,8 +147,7 @@ int32_t ModemModel::parseStep(const std::vector<std::string>& words, Scenario::S
     if (kind == "band") {
         step->text = kind;
         ok = words.size() == 3 && parseLevel(words[2], 2, &step->value);
-    } else if (words.size() == 4 &&
-               parseSeconds(words[3], 1, kMaxResidencyMs, &step->counters[0])) {
+    } else if (words.size() == 4 && parseSeconds(words[3], 1, kMaxResidencyMs, &step->counters[0])) {
         step->text = kind;
         if (kind == "idle" || kind == "wcdma-idle") {
             step->value = idleLevel(words[2]);
@@ -323,8 +322,8 @@ void ModemModel::watch() {
         {
             std::lock_guard<std::mutex> lock(mLock);
             if (!mQueue.empty()) {
-                timeout = static_cast<int>(
-                    std::max<int64_t>(0, mQueue.front().dueMonoMs - monotonicMs()));
+                timeout =
+                    static_cast<int>(std::max<int64_t>(0, mQueue.front().dueMonoMs - monotonicMs()));
             }
         }
         struct pollfd fds[2] = {{mInotify, POLLIN, 0}, {mWakePipe[0], POLLIN, 0}};
@@ -338,7 +337,8 @@ void ModemModel::watch() {
         if (fds[0].revents & POLLIN) {
             alignas(struct inotify_event) char buffer[4096];
             ssize_t got = read(mInotify, buffer, sizeof(buffer));
-            for (ssize_t at = 0; got > 0 && at + static_cast<ssize_t>(sizeof(inotify_event)) <= got;) {
+            for (ssize_t at = 0;
+                 got > 0 && at + static_cast<ssize_t>(sizeof(inotify_event)) <= got;) {
                 const auto* event = reinterpret_cast<const struct inotify_event*>(buffer + at);
                 // A request is a write: an open for writing closed without
                 // one (the daemon's check of the file) asks for nothing.

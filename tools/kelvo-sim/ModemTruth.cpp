@@ -281,8 +281,8 @@ std::string ModemTruth::report(const std::string& databasePath, int32_t requests
     std::string bytes, energy;
     for (const char* group :
          {"foreground", "background", "charge_foreground", "charge_background"}) {
-        bytes += std::string(bytes.empty() ? "" : " + ") + group + "_tx_bytes + " + group +
-                 "_rx_bytes";
+        bytes +=
+            std::string(bytes.empty() ? "" : " + ") + group + "_tx_bytes + " + group + "_rx_bytes";
         energy += std::string(energy.empty() ? "" : " + ") + group + "_energy";
     }
     const bool haveAccounted = readSums(db,
@@ -349,14 +349,13 @@ std::string ModemTruth::report(const std::string& databasePath, int32_t requests
                  truth ? std::to_string(t->second.uid).c_str() : "",
                  truth ? std::to_string(t->second.packets).c_str() : "-",
                  truth ? std::to_string(t->second.bytes).c_str() : "-",
-                 !haveAccounted ? "-"
+                 !haveAccounted         ? "-"
                  : a != accounted.end() ? std::to_string(a->second.bytes).c_str()
                                         : "0",
-                 !haveAccounted ? "-"
+                 !haveAccounted         ? "-"
                  : a != accounted.end() ? std::to_string(a->second.energy).c_str()
                                         : "0",
-                 truth ? std::to_string(static_cast<int64_t>(t->second.energy + 0.5)).c_str()
-                       : "-");
+                 truth ? std::to_string(static_cast<int64_t>(t->second.energy + 0.5)).c_str() : "-");
         out << line;
     }
     snprintf(line, sizeof(line),
