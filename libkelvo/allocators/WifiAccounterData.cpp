@@ -38,16 +38,21 @@ int64_t truncateToInt64(double value) {
 }
 
 // Σ wi × (a × Pa[i] + b × Pb[i]) with wi = Li / (L × 1000) in single
-// precision; the running sum is truncated after each level.
-int64_t weightedEnergy(const wifi_power_description& d, int64_t levelTotal, int64_t a, int64_t b) {
+// precision; the running sum is truncated after each level. `exact` gets
+// the same sum untruncated.
+int64_t weightedEnergy(const wifi_power_description& d, int64_t levelTotal, int64_t a, int64_t b,
+                       double* exact) {
     const float scale = static_cast<float>(levelTotal) * 1000.0f;
     int64_t sum = 0;
+    double whole = 0;
     for (int32_t i = 0; i < kWifiLevels; ++i) {
         const float weight = static_cast<float>(d.levelTime[i]) / scale;
         const double packets =
             static_cast<double>(a) * d.txPower[i] + static_cast<double>(b) * d.rxPower[i];
         sum = truncateToInt64(static_cast<double>(sum) + static_cast<double>(weight) * packets);
+        whole += static_cast<double>(weight) * packets;
     }
+    *exact = whole;
     return sum;
 }
 
@@ -59,7 +64,7 @@ struct batch_description {
     bool valid = false;
     wifi_power_description d;
     int64_t levelTotal = 0;    // L, each level at least 0
-    int64_t totalEnergy = 0;   // Et
+    double totalExact = 0;     // Et, not truncated
     int64_t totalPackets = 0;  // T1 + T2
 };
 
@@ -108,9 +113,9 @@ int32_t wifi_accounter_data::fillContent(const Parcel& power) {
     for (int64_t time : b.d.levelTime) {
         b.levelTotal = addSaturated(b.levelTotal, std::max<int64_t>(time, 0));
     }
-    b.totalEnergy = 0;
+    b.totalExact = 0;
     if (b.levelTotal >= 1 && b.levelTotal <= kWifiMaxLevelTime) {
-        b.totalEnergy = weightedEnergy(b.d, b.levelTotal, b.d.totals[0], b.d.totals[1]);
+        weightedEnergy(b.d, b.levelTotal, b.d.totals[0], b.d.totals[1], &b.totalExact);
     }
     b.totalPackets =
         addSaturated(std::max<int64_t>(b.d.totals[0], 0), std::max<int64_t>(b.d.totals[1], 0));
@@ -158,16 +163,19 @@ int64_t wifi_accounter_data::trafficEnergy(int64_t x, int64_t y) {
                              static_cast<__int128>(y) * d.rxPower[kWifiLevels - 1];
         return clampToInt64(sum / 100);
     }
-    int64_t energy = weightedEnergy(d, levelTotal, x, y);
-    const int64_t totalEnergy = b.totalEnergy;
-    if (totalEnergy >= 1) {
+    double exact = 0;
+    int64_t energy = weightedEnergy(d, levelTotal, x, y, &exact);
+    if (b.totalExact > 0) {
         // The band's fixed power in proportion to the application's part of
         // the interface's traffic energy; a part read a little after the
-        // totals is held at the whole.
-        const int64_t part = std::min(std::max<int64_t>(energy, 0), totalEnergy);
-        const __int128 fixed = static_cast<__int128>(levelTotal) * part * d.bandPower /
-                               (static_cast<__int128>(totalEnergy) * 1000);
-        energy = clampToInt64(static_cast<__int128>(energy) + clampToInt64(fixed));
+        // totals is held at the whole. The parts are taken before the
+        // traffic energies are truncated to whole units: otherwise light
+        // users (below one unit) would get nothing and the fixed power of a
+        // quiet poll would be lost altogether.
+        const double part = std::min(std::max(exact, 0.0), b.totalExact);
+        const double fixed = static_cast<double>(levelTotal) * d.bandPower / 1000.0 * part /
+                             b.totalExact;
+        energy = clampToInt64(static_cast<__int128>(energy) + truncateToInt64(fixed));
     }
     if (b.totalPackets >= 1) {
         const int64_t packets = std::min(addSaturated(x, y), b.totalPackets);

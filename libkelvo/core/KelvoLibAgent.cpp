@@ -8,9 +8,11 @@
 #include "accounters/BrightnessAccounter.h"
 #include "accounters/CameraAccounter.h"
 #include "accounters/CpuAccounter.h"
+#include "accounters/DpmAccounter.h"
 #include "accounters/FlashlightAccounter.h"
 #include "accounters/GnssAccounter.h"
 #include "accounters/GpuAccounter.h"
+#include "accounters/ModemAccounter.h"
 #include "accounters/SensorAccounter.h"
 #include "accounters/WifiAccounter.h"
 #include "SqlTypes.h"
@@ -51,6 +53,10 @@ KelvoLibAgent::AccounterFactory builtInFactory(int32_t type) {
             return [] { return std::make_unique<AudioAccounter>(); };
         case ACCOUNTER_WIFI:
             return [] { return std::make_unique<WifiAccounter>(); };
+        case ACCOUNTER_DPM:
+            return [] { return std::make_unique<DpmAccounter>(); };
+        case ACCOUNTER_MODEM:
+            return [] { return std::make_unique<ModemAccounter>(); };
         case ACCOUNTER_CPU:
             return [] {
                 return std::make_unique<CpuAccounter>(

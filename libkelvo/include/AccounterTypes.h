@@ -68,4 +68,23 @@ enum WifiSubtype : int32_t {
     WIFI_SUBTYPE_MAX = WIFI_CHARGER,
 };
 
+// Modem subtypes: the int32 after the SetValue code of every modem action.
+//   0..2   int32 module; module 5: int32 modulation (0 or 1), int32 base
+//          usage; int32 level count (0..9), the level times (int32 ms,
+//          level 0 first)
+//   3      int64 tx packets, int64 rx packets of the interface: the data
+//          energy of the residencies so far is split by the next batches
+//   4      a traffic batch: int64 time, int32 count, per application String8
+//          name, int32 foreground flag, int64 tx packets, rx packets, tx
+//          bytes, rx bytes
+//   5      bool charger online
+enum ModemSubtype : int32_t {
+    MODEM_VOICE_RESIDENCY = 0,
+    MODEM_IDLE_RESIDENCY = 1,
+    MODEM_DATA_RESIDENCY = 2,
+    MODEM_INTERFACE_TRAFFIC = 3,
+    MODEM_PACKAGE_TRAFFIC = 4,
+    MODEM_CHARGER = 5,
+};
+
 } // namespace kelvo

@@ -43,6 +43,7 @@ enum class Health : uint32_t {
     TrafficReadingsRefused,  // traffic lines skipped or refused, keys or lists over their cap
     BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
+    ModemRecordsRefused,     // modem records dropped (null, short) or not accounted (bad field, no idle count)
     Count
 };
 

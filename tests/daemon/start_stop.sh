@@ -49,11 +49,13 @@ echo "exit status $rc after ${elapsed} ms"
 # A first start on an empty root raises no error line, but for the CPU and
 # battery handlers, which stand down on a root without CPU counters or kernel
 # device, or without a battery, the Wi-Fi traffic baseline, which finds no
-# network counters there, and the GPU handler, which finds no kernel device.
+# network counters there, and the GPU and DPM handlers, which find no kernel
+# device.
 errors=$(grep '^kelvod E ' "$log" | grep -v 'batteryproperties\|registerListener' |
          grep -v '\[CpuHandler.cpp\]\|disable module: 3\|CpuHandler exit\|CpuHandler is pending to exit' |
          grep -v '\[BatteryHandler.cpp\]\|disable module: -1\|BatteryHandler exit\|BatteryHandler is pending to exit' |
          grep -v '\[TrafficReader.cpp\] openView# Failed to open /proc/net/\|\[TrafficCollector.cpp\] takeBaseline#' |
-         grep -v 'Failed to open /dev/kelvo\|Failed to open device: /dev/kelvo\|\[GpuHandler.cpp\] lateInitialize#' || true)
+         grep -v 'Failed to open /dev/kelvo\|Failed to open device: /dev/kelvo\|\[GpuHandler.cpp\] lateInitialize#' |
+         grep -v 'Failed to open /dev/dpm_ldm\|\[DpmHandler.cpp\] checkEnable#\|disable module: 11\|DpmHandler exit\|DpmHandler is pending to exit' || true)
 [ -z "$errors" ] || { echo "FAIL: error lines on a first start:"; echo "$errors"; exit 1; }
 echo "PASS"

@@ -62,6 +62,8 @@ const Refusal kRefusals[] = {
     {"gpu busy time below 0", "at 5 gpu com.example.mail 480 -1", "gpu <package> <MHz> <busy ms>"},
     {"single camera of a second stream", "at 5 camera configure 0 2 640 480", "camera connect"},
     {"camera of an undeclared pid", "at 5 camera connect 999 0", "pid 999 is not declared"},
+    {"dpm time of no kind", "at 5 dpm DSS hot 3", "dpm <ip-name> off|busy|low|idle"},
+    {"ddr level past the four", "at 5 ddr 4 1 100", "ddr <level 0..3>"},
     {"modem level past the lte levels", "at 5 modem lte-tx 8 2", "modem lte-tx <level 0..7>"},
     {"modem idle of no signal level", "at 5 modem idle weakest 2", "idle <weak|mid|strong>"},
     {"modem residency over an hour", "at 5 modem wcdma-data 1 3600.001", "up to 3600"},

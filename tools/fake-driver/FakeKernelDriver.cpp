@@ -14,6 +14,7 @@
 #include "kelvo/KernelDevice.h"
 #include "kelvo/RootPath.h"
 #include "utils/devices/DpmDevice.h"
+#include "utils/devices/DpmIpNames.h"
 #include "utils/devices/KelvoDevice.h"
 
 namespace kelvo {
@@ -283,6 +284,48 @@ void FakeKernelDriver::addGpuResidency(int64_t frequency, int64_t busyUs, int64_
     mState.gpuSteps.push_back({frequency, busyUs, idleUs});
 }
 
+bool FakeKernelDriver::useIpNames(int32_t policy) {
+    std::vector<DpmIp> ips;
+    if (policy == 1) {
+        for (const dpm_ip_name& ip : kDpmPolicy1Ips) {
+            ips.push_back({ip.name, {}});
+        }
+    } else if (policy == 2) {
+        for (const dpm_ip_name& ip : kDpmPolicy2Ips) {
+            ips.push_back({ip.name, {}});
+        }
+    } else {
+        return false;
+    }
+    std::lock_guard<std::mutex> guard(mLock);
+    mState.ips = std::move(ips);
+    return true;
+}
+
+bool FakeKernelDriver::addIpTime(const std::string& name, DpmTime which, int64_t ms) {
+    std::lock_guard<std::mutex> guard(mLock);
+    for (DpmIp& ip : mState.ips) {
+        if (ip.name == name) {
+            ip.times[which] += ms;
+            return true;
+        }
+    }
+    return false;
+}
+
+bool FakeKernelDriver::addDdr(int32_t level, int64_t seconds, int64_t flux) {
+    std::lock_guard<std::mutex> guard(mLock);
+    for (size_t i = 0; i < 2; ++i) {
+        if (level < 0 || static_cast<size_t>(level) >= mState.ddrValues[i].size()) {
+            return false;
+        }
+    }
+    for (size_t i = 0; i < 2; ++i) {
+        mState.ddrValues[i][level] += mState.ddrNames[i] == "DDR_FREQ_TIME" ? seconds : flux;
+    }
+    return true;
+}
+
 FakeKernelDriver::Answer FakeKernelDriver::answer(Device device, uint32_t request,
                                                   std::vector<uint8_t>* argument) {
     return device == Device::Kelvo ? answerKelvo(request, argument)
@@ -350,24 +393,44 @@ FakeKernelDriver::Answer FakeKernelDriver::answerDpm(uint32_t request,
             putInt32(argument, 0, mState.version);
             return Answer();
         case DpmDevice::kSetEnable:
+            // Monitoring starts (or stops) from zero.
             mState.enable = getInt32(*argument, 0);
+            for (DpmIp& ip : mState.ips) {
+                ip.times.fill(0);
+            }
             return Answer();
         case DpmDevice::kSetPeriod:
             mState.period = getInt32(*argument, 0);
             return Answer();
-        case DpmDevice::kGetPeriod:
-            putInt32(argument, 0, mState.period);
+        case DpmDevice::kGetPeriod: {
+            int32_t which = getInt32(*argument, 0);
+            putInt32(argument, 0,
+                     which == 0 ? mState.minPeriod : which == 1 ? mState.maxPeriod : mState.period);
             return Answer();
+        }
         case DpmDevice::kGetIpCount:
             putInt32(argument, 0,
-                     mState.ipCount.value_or(static_cast<int32_t>(mState.ipRecords.size())));
+                     mState.ipCount.value_or(static_cast<int32_t>(mState.ips.size())));
             return Answer();
         case DpmDevice::kGetIpData: {
-            int32_t capacity = std::max(getInt32(*argument, 0), 0);
-            size_t written = std::min(mState.ipRecords.size(), static_cast<size_t>(capacity));
+            // As many records as the caller's capacity and the buffer it
+            // sent both hold.
+            constexpr size_t kHead = sizeof(dpm_ip_header_t);
+            constexpr size_t kRecord = sizeof(dpm_ip_record_t);
+            size_t room = argument->size() < kHead ? 0 : (argument->size() - kHead) / kRecord;
+            size_t capacity = static_cast<size_t>(std::max(getInt32(*argument, 0), 0));
+            size_t written = std::min({mState.ips.size(), capacity, room});
             putInt32(argument, 0, mState.ipCount.value_or(static_cast<int32_t>(written)));
             for (size_t i = 0; i < written; ++i) {
-                putBytes(argument, 8 + i * 96, mState.ipRecords[i].data(), 96);
+                dpm_ip_fields_t fields;
+                memset(&fields, 0, sizeof(fields));
+                memcpy(fields.name, mState.ips[i].name.data(),
+                       std::min(mState.ips[i].name.size(), sizeof(fields.name)));
+                fields.offTime = mState.ips[i].times[DPM_OFF];
+                fields.busyTime = mState.ips[i].times[DPM_BUSY];
+                fields.busyTimeLowVoltage = mState.ips[i].times[DPM_BUSY_LOW_VOLTAGE];
+                fields.idleTime = mState.ips[i].times[DPM_IDLE];
+                putBytes(argument, kHead + i * kRecord, &fields, sizeof(fields));
             }
             return Answer();
         }

@@ -57,6 +57,14 @@ public:
         int32_t count;
     };
 
+    // One monitored IP block: its name and its times in ms since the last
+    // reset: off, busy, busy at low voltage, idle.
+    struct DpmIp {
+        std::string name;
+        std::array<int64_t, 4> times = {};
+    };
+    enum DpmTime { DPM_OFF = 0, DPM_BUSY = 1, DPM_BUSY_LOW_VOLTAGE = 2, DPM_IDLE = 3 };
+
     struct State {
         // "/dev/kelvo"
         std::map<uint32_t, bool> flags;  // the switch requests, by number
@@ -80,10 +88,19 @@ public:
         int32_t version = 1;
         int32_t enable = 0;
         int32_t period = 0;
-        std::vector<std::array<uint8_t, 96>> ipRecords;
-        std::optional<int32_t> ipCount;  // reported instead of the records' number
+        // Answers of the period getter for 0 and 1.
+        int32_t minPeriod = 100;
+        int32_t maxPeriod = 10000;
+        // The monitored blocks in report order (useIpNames fills them from
+        // the daemon's tables). Every enable or disable zeroes their times.
+        std::vector<DpmIp> ips;
+        std::optional<int32_t> ipCount;  // reported instead of the blocks' number
+        // Cumulative DDR residency (s) and traffic (MB) per bandwidth level,
+        // in the block named "DDR_FREQ_TIME" and the one named
+        // "DDR_FREQ_FLUX"; never zeroed.
         std::array<std::string, 2> ddrNames = {"DDR_FREQ_TIME", "DDR_FREQ_FLUX"};
-        std::array<std::vector<int64_t>, 2> ddrValues;
+        std::array<std::vector<int64_t>, 2> ddrValues = {std::vector<int64_t>(4, 0),
+                                                         std::vector<int64_t>(4, 0)};
         std::optional<int32_t> ddrCount;  // reported instead of the values' number
     };
 
@@ -126,6 +143,16 @@ public:
     // Adds busy and idle time at one frequency to the residency the next
     // read reports (a new step is appended).
     void addGpuResidency(int64_t frequency, int64_t busyUs, int64_t idleUs);
+
+    // Serves the blocks of the daemon's IP table of the policy (1 or 2),
+    // all times zero. false for another policy.
+    bool useIpNames(int32_t policy);
+    // Adds ms to one time of the named block; false when there is no such
+    // block.
+    bool addIpTime(const std::string& name, DpmTime which, int64_t ms);
+    // Adds residency and traffic to a DDR level; false for a level the
+    // driver does not have.
+    bool addDdr(int32_t level, int64_t seconds, int64_t flux);
 
 private:
     struct Answer {

@@ -250,6 +250,7 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     mRadioSensors.reset(new RadioSensorTruth(mScenario, config));
     mGpu.reset(new GpuLoadTruth(config));
     mCameras.reset(new CameraTruth(mScenario, config));
+    mDpm.reset(new DpmActivity(config));
     mModem.reset(new ModemModel(root, [](const std::string& block) {
         return KelvoManagerClient::send(ModemModel::kEventType, block.data(), block.size());
     }));
@@ -299,6 +300,7 @@ bool DeviceSimulator::startServices(std::string* error) {
         return mComponents->takeAdvancedValue(mModelMs);
     });
     mSystem->configureDriver(*mDriver);
+    mDpm->prepare(*mDriver);
     mReporter.reset(new fake::FakeDriverReporter(*mDriver));
     mReporter->setBodyProvider([this](const fake::FakeDriverReporter::Report& report) {
         return report.magic == fake::FakeDriverReporter::MAGIC_PID_CPU_TIME
@@ -439,6 +441,15 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             std::lock_guard<std::mutex> lock(mLock);
             if (mDriver) {
                 mGpu->apply(step, *mDriver);
+            }
+            return;
+        }
+        case Scenario::Action::Dpm:
+        case Scenario::Action::Ddr: {
+            // Counters the daemon reads from the power monitor: no record.
+            std::lock_guard<std::mutex> lock(mLock);
+            if (mDriver) {
+                mDpm->apply(step, *mDriver);
             }
             return;
         }
@@ -721,6 +732,8 @@ int DeviceSimulator::finish(bool completed) {
         components += mGpu->report(SimReport::databasePath(mOptions.root));
         mCameras->advanceTo(mModelMs);
         components += mCameras->report(SimReport::databasePath(mOptions.root));
+        components += mDpm->report(SimReport::databasePath(mOptions.root),
+                                   SimReport::eventsPath(mOptions.root));
     }
     report.addSection(components);
     BatteryReport::Model battery;

@@ -14,6 +14,7 @@
 #include "DaemonProcess.h"
 #include "DeviceModel.h"
 #include "GpuLoadTruth.h"
+#include "DpmActivity.h"
 #include "ModemModel.h"
 #include "ModemTruth.h"
 #include "PlatformState.h"
@@ -120,6 +121,7 @@ private:
     std::unique_ptr<RadioSensorTruth> mRadioSensors;
     std::unique_ptr<GpuLoadTruth> mGpu;  // under mLock
     std::unique_ptr<CameraTruth> mCameras;
+    std::unique_ptr<DpmActivity> mDpm;  // under mLock
     // The modem answers the daemon's requests on its own thread.
     std::unique_ptr<ModemModel> mModem;
     ModemTruth::Profile mModemProfile;

@@ -12,6 +12,7 @@
 #include "CameraTruth.h"
 #include "CpuTree.h"
 #include "GpuLoadTruth.h"
+#include "DpmActivity.h"
 #include "ModemModel.h"
 #include "RadioSensorTruth.h"
 #include "SystemScene.h"
@@ -438,6 +439,9 @@ bool Scenario::parseComponentStep(const std::vector<std::string>& words, Step* s
         }
         if (parsed == 0) {
             parsed = GpuLoadTruth::parseStep(words, step, reason);
+        }
+        if (parsed == 0) {
+            parsed = DpmActivity::parseStep(words, step, reason);
         }
         if (parsed == 1) {
             return true;

@@ -56,6 +56,8 @@ public:
         Gpu,        // text: package, frequency: MHz, value: busy ms (GpuLoadTruth)
         Camera,  // text: connect (pid, values: id), configure (values: dual, type, width, height),
                  // unconfigure (values: type), disconnect
+        Dpm,     // text: IP block, value: time index, counters[0]: ms (DpmActivity)
+        Ddr,     // value: level, counters[0]: seconds, counters[1]: MB (DpmActivity)
         Modem,   // text: the kind (ModemModel::parseStep), value: level, counters[0]: ms
     };
 

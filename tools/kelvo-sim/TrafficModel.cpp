@@ -278,7 +278,8 @@ std::string TrafficModel::summary(const std::string& dbPath) const {
         "\nTraffic per application: truth = bytes (rx + tx) the scenario gave on the wlan\n"
         "and on the other (cellular) interfaces; rows = raw_wifi_package_traffic; accounted =\n"
         "raw_applications_wifi bytes and energy (\"-\": table absent). Traffic after the\n"
-        "daemon's last poll is not in its tables yet.\n";
+        "daemon's last poll is not in its tables yet. A system process's traffic is\n"
+        "charged to its uid's package (system_server's to \"android\").\n";
     if (mHaveEnergyTruth) {
         out += mEnergyHeading;
     }

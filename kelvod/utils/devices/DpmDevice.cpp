@@ -124,15 +124,16 @@ int DpmDevice::getDdrData(int32_t steps, dpm_ddr_data_t* data) {
         return -5;
     }
     // Room for the most steps whatever the count, so a kernel that writes
-    // more than it announced stays inside the buffer.
+    // more than it announced stays inside the buffer; the request itself
+    // names the two blocks' real size.
     dpm_ddr_block_t blocks[2];
     memset(blocks, 0, sizeof(blocks));
-    int ret = DEVICE_REQUEST(kPath, kGetDdrData, blocks, sizeof(blocks), "Failed to get ddr data");
+    size_t blockSize = sizeof(blocks[0].name) + static_cast<size_t>(steps) * sizeof(int64_t);
+    int ret = DEVICE_REQUEST(kPath, kGetDdrData, blocks, 2 * blockSize, "Failed to get ddr data");
     if (ret != 0) {
         return ret;
     }
     const uint8_t* bytes = reinterpret_cast<const uint8_t*>(blocks);
-    size_t blockSize = sizeof(blocks[0].name) + static_cast<size_t>(steps) * sizeof(int64_t);
     for (size_t i = 0; i < 2; ++i) {
         const uint8_t* block = bytes + i * blockSize;
         const char* name = reinterpret_cast<const char*>(block);

@@ -15,6 +15,17 @@ struct dpm_ip_record_t {
 };
 static_assert(sizeof(dpm_ip_record_t) == 96, "ip record layout");
 
+// What a record holds: the block's name (not always terminated), then its
+// times in ms since the statistics were last reset.
+struct dpm_ip_fields_t {
+    char name[64];
+    int64_t offTime;
+    int64_t busyTime;
+    int64_t busyTimeLowVoltage;
+    int64_t idleTime;
+};
+static_assert(sizeof(dpm_ip_fields_t) == sizeof(dpm_ip_record_t), "ip record fields");
+
 // Head of the IP data buffer: capacity in, count out; the records follow.
 struct dpm_ip_header_t {
     int32_t count;
@@ -72,9 +83,10 @@ public:
     static int getPeriod(int32_t period);
     // Capped at kMaxDdrSteps.
     static int getDdrFreqCount();
-    // Reads the two DDR blocks of steps (0..kMaxDdrSteps) values each; the
-    // buffer always has room for kMaxDdrSteps. Names are bounded by their
-    // field. Returns 0.
+    // Reads the two DDR blocks of steps (0..kMaxDdrSteps) values each. The
+    // request carries the size of those two blocks, while the buffer behind
+    // it always has room for kMaxDdrSteps. Names are bounded by their field.
+    // Returns 0.
     static int getDdrData(int32_t steps, dpm_ddr_data_t* data);
 };
 

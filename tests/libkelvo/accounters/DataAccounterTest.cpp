@@ -48,8 +48,6 @@ TEST_F(DataAccounterTest, RefusedActionsAreCountedAndChangeNothing) {
            "[KelvoLibAgent.cpp] findAccounter# Invalid accounter type: 12");
     refuse(Fields(-1, ACTION_FOREGROUND).i64(0).str("a"),
            "[KelvoLibAgent.cpp] setDataAccounter# Failed to find accounter by type: -1");
-    refuse(Fields(ACCOUNTER_MODEM, ACTION_FOREGROUND).i64(0).str("a"),
-           "Unknown accounter type: 10");
     android::Parcel typeOnly;
     typeOnly.writeInt32(kSole);
     EXPECT_EQ(-1, setDataAccounter(typeOnly));

@@ -142,14 +142,24 @@ TEST_F(WifiAccounterTest, TrafficEnergyByLevelTimeAndTotals) {
         {"L = 0", 0, 0, 0, -1, {{"com.a", 1000, 500, 1, 2}}, {{"com.a", {0, 1, 2, 125}}}},
         {"L = 660000", 660000, 0, 0, -1, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 3}}}},
         {"L = 660001", 660001, 0, 0, -1, {{"com.a", 1000, 500, 0, 0}}, {{"com.a", {0, 0, 0, 125}}}},
-        // Et = 10; the fixed 600000 x 40 / 1000 = 24000 split 3 : 7.
+        // Et = 10.5; the fixed 600000 x 40 / 1000 = 24000 split 3.5 : 7
+        // (by the energies before they are truncated to 3 and 7).
         {"two split",
          600000,
          3000,
          1500,
          -1,
          {{"com.a", 1000, 500, 0, 0}, {"com.b", 2000, 1000, 0, 0}},
-         {{"com.a", {200000, 0, 0, 3 + 7200}}, {"com.b", {400000, 0, 0, 7 + 16800}}}},
+         {{"com.a", {200000, 0, 0, 3 + 8000}}, {"com.b", {400000, 0, 0, 7 + 16000}}}},
+        // Et = 0.6 and the applications' energies 0.4 and 0.2 round to
+        // nothing: the fixed power is still shared out whole.
+        {"below one unit",
+         600000,
+         300,
+         0,
+         -1,
+         {{"com.a", 200, 0, 0, 0}, {"com.b", 100, 0, 0, 0}},
+         {{"com.a", {400000, 0, 0, 16000}}, {"com.b", {200000, 0, 0, 8000}}}},
         {"one carries all",
          600000,
          3000,

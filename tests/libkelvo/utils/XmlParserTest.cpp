@@ -300,7 +300,7 @@ TEST_F(XmlParserTest, SampleConfigurationAnswersEveryReader) {
         {0, 0, -2, false, 0}, {0, 1, -2, false, 0}, {0, 2, -2, false, 0},
         {0, kelvo::PROFILE_CPU, -1, false, 3}, {0, kelvo::PROFILE_CAMERA, -1, true, 4},
         {0, kelvo::PROFILE_GPU, -1, true, 1}, {0, kelvo::PROFILE_MODEM, -1, true, 6},
-        {0, kelvo::PROFILE_AUDIO, -1, true, 2}, {0, kelvo::PROFILE_DPM, -1, false, 33},
+        {0, kelvo::PROFILE_AUDIO, -1, true, 2}, {0, kelvo::PROFILE_DPM, -1, false, 62},
         {1, 0, -1, false, 10}, {1000, 0, -2, false, 0}, {3, 0, -2, false, 0},
         {3, 1, -2, false, 0}, {4, 0, -2, false, 0},
     };

@@ -107,7 +107,7 @@ TEST_F(KernelDevicesTest, RequestBytes) {
             {[] { return DpmDevice::getPeriod(7); }, Device::Dpm, 0xC0046B06u, {7, 0, 0, 0}},
             {[&] { return DpmDevice::getIpData(3, &records); }, Device::Dpm, 0x80086B05u, ipData},
             {[&] { return DpmDevice::getDdrData(4, &ddr); }, Device::Dpm, 0xC0006B08u,
-             std::vector<uint8_t>(640, 0)},
+             std::vector<uint8_t>(2 * (64 + 4 * 8), 0)},
     };
     for (size_t i = 0; i < cases.size(); ++i) {
         mDriver.clearRequests();
@@ -125,12 +125,10 @@ TEST_F(KernelDevicesTest, RequestBytes) {
 // What the driver answers reads back field by field, the DDR blocks at the
 // offsets the announced step count gives.
 TEST_F(KernelDevicesTest, AnswersReadBack) {
-    std::array<uint8_t, 96> record;
-    record.fill(0xab);
     mDriver.update([&](FakeKernelDriver::State& s) {
         s.brightness = 180;
         s.gpuSteps = {{200000, 10, 20}, {400000, 30, 40}};
-        s.ipRecords = {record, record};
+        s.ips = {{"DSS", {1, 2, 3, 4}}, {std::string(64, 'n'), {5, 6, 7, 0x0b0a}}};
         s.ddrNames = {"DDR_FREQ_FLUX", "DDR_FREQ_TIME"};
         s.ddrValues = {std::vector<int64_t>{1, 2, 3}, std::vector<int64_t>{4, 5, 6}};
     });
@@ -149,7 +147,8 @@ TEST_F(KernelDevicesTest, AnswersReadBack) {
     std::vector<dpm_ip_record_t> records;
     ASSERT_EQ(0, DpmDevice::getIpData(8, &records));
     ASSERT_EQ(2u, records.size());
-    EXPECT_EQ(0xab, records[1].bytes[95]);
+    EXPECT_EQ(0x0b, records[1].bytes[89]);  // the idle time's second byte
+    EXPECT_EQ('n', records[1].bytes[63]);    // a name that fills its field
     ASSERT_EQ(3, DpmDevice::getDdrFreqCount());
     dpm_ddr_data_t ddr;
     ASSERT_EQ(0, DpmDevice::getDdrData(3, &ddr));
@@ -212,7 +211,7 @@ TEST_F(KernelDevicesTest, HostileCounts) {
     for (size_t i = 0; i < cases.size(); ++i) {
         mDriver.update([&](FakeKernelDriver::State& s) {
             s = FakeKernelDriver::State();
-            s.ipRecords.resize(4);
+            s.ips.resize(4);
             cases[i].set(s);
         });
         // Every refused or capped answer is counted; a good answer or a bad

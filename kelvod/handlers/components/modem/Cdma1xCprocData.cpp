@@ -1,0 +1,55 @@
+#include "handlers/components/modem/Cdma1xCprocData.h"
+
+#include "KelvoLog.h"
+
+namespace kelvo {
+
+namespace {
+
+const column_attribute kColumns[] = {
+    {COLUMN_TIME, "timestamp"}, {COLUMN_INT, "sim"}, CDMA_1X_CPROC_FIELDS(MODEM_RECORD_COLUMN)};
+
+}  // namespace
+
+const table_attribute Cdma1xCprocData::kTable = {"1.1", 1, modemColumnCount(kColumns), kColumns,
+                                                 "raw_modem_cdma_1x_cproc"};
+
+Cdma1xCprocData::Cdma1xCprocData(ModemDataOwner* owner)
+    : ModemData(MODEM_MODULE_CDMA_1X_CPROC, sizeof(cdma_1x_cproc_data), owner) {}
+
+namespace {
+
+// A transmit count in ms: * 5 / 4, the product first, in 64 bits.
+int64_t cdmaCountToMs(uint32_t count) {
+    return clampModemLevel(static_cast<uint64_t>(count) * 5 >> 2);
+}
+
+}  // namespace
+
+int32_t Cdma1xCprocData::calcEnergy(const void* record) {
+    const cdma_1x_cproc_data r = readModemRecord<cdma_1x_cproc_data>(record);
+    const int64_t voice[7] = {
+        cdmaCountToMs(r.voice_tx_pwr_high), cdmaCountToMs(r.voice_tx_pwr_mid4),
+        cdmaCountToMs(r.voice_tx_pwr_mid3), cdmaCountToMs(r.voice_tx_pwr_mid2),
+        cdmaCountToMs(r.voice_tx_pwr_mid1), cdmaCountToMs(r.voice_tx_pwr_mid),
+        cdmaCountToMs(r.voice_tx_pwr_low)};
+    KLOGM(LOG_MODULE_MODEM, "module=%d, voice tx high=%d, mid=%d %d %d %d %d, low=%d", module(),
+          static_cast<int32_t>(voice[0]), static_cast<int32_t>(voice[1]),
+          static_cast<int32_t>(voice[2]), static_cast<int32_t>(voice[3]),
+          static_cast<int32_t>(voice[4]), static_cast<int32_t>(voice[5]),
+          static_cast<int32_t>(voice[6]));
+    sendLevels(MODEM_SCENARIO_VOICE, voice, 7);
+    const int64_t data[7] = {cdmaCountToMs(r.data_tx_pwr_high), cdmaCountToMs(r.data_tx_pwr_mid4),
+                             cdmaCountToMs(r.data_tx_pwr_mid3), cdmaCountToMs(r.data_tx_pwr_mid2),
+                             cdmaCountToMs(r.data_tx_pwr_mid1), cdmaCountToMs(r.data_tx_pwr_mid),
+                             cdmaCountToMs(r.data_tx_pwr_low)};
+    KLOGM(LOG_MODULE_MODEM, "module=%d, data tx high=%d, mid=%d %d %d %d %d, low=%d", module(),
+          static_cast<int32_t>(data[0]), static_cast<int32_t>(data[1]),
+          static_cast<int32_t>(data[2]), static_cast<int32_t>(data[3]),
+          static_cast<int32_t>(data[4]), static_cast<int32_t>(data[5]),
+          static_cast<int32_t>(data[6]));
+    sendLevels(MODEM_SCENARIO_DATA, data, 7);
+    return 0;
+}
+
+}  // namespace kelvo
