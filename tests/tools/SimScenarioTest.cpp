@@ -64,6 +64,12 @@ const Refusal kRefusals[] = {
     {"camera of an undeclared pid", "at 5 camera connect 999 0", "pid 999 is not declared"},
     {"dpm time of no kind", "at 5 dpm DSS hot 3", "dpm <ip-name> off|busy|low|idle"},
     {"ddr level past the four", "at 5 ddr 4 1 100", "ddr <level 0..3>"},
+    {"modem level past the lte levels", "at 5 modem lte-tx 8 2", "modem lte-tx <level 0..7>"},
+    {"modem idle of no signal level", "at 5 modem idle weakest 2", "idle <weak|mid|strong>"},
+    {"modem residency over an hour", "at 5 modem wcdma-data 1 3600.001", "up to 3600"},
+    {"call start on no network", "at 5 call start gsm", "call start lte|wcdma"},
+    {"modem answer of no fault", "at 5 modem-answer malformed garbage", "modem-answer delay"},
+    {"modem answer delay over ten minutes", "at 5 modem-answer delay 601", "modem-answer delay"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -25,6 +25,7 @@
 #include "SimReport.h"
 #include "WifiRecords.h"
 #include "kelvo/BufferedLogClient.h"
+#include "kelvo/KelvoManagerClient.h"
 #include "kelvo/LogWriter.h"
 #include "kelvo/RootPath.h"
 
@@ -250,6 +251,14 @@ bool DeviceSimulator::prepareRoot(std::string* error) {
     mGpu.reset(new GpuLoadTruth(config));
     mCameras.reset(new CameraTruth(mScenario, config));
     mDpm.reset(new DpmActivity(config));
+    mModem.reset(new ModemModel(root, [](const std::string& block) {
+        return KelvoManagerClient::send(ModemModel::kEventType, block.data(), block.size());
+    }));
+    ModemTruth::readProfile(config, &mModemProfile);
+    if (!mModem->layout()) {
+        *error = "cannot create the modem's control file below " + root + ": " + strerror(errno);
+        return false;
+    }
     mLogPath = root + "/sim/kelvod.log";
     RootPath::setRoot(root.c_str());
     return true;
@@ -299,6 +308,10 @@ bool DeviceSimulator::startServices(std::string* error) {
                    : fake::FakeDriverReporter::reportBody(report, mDriver->state());
     });
     mReporter->start();
+    if (!mModem->start()) {
+        *error = "cannot watch the modem's control file below " + mOptions.root;
+        return false;
+    }
     mLogWriter.reset(new LogWriter(RootPath::resolve("/dev/tvlog_kelvo")));
     mLogWriter->setTimeout(200);
     return true;
@@ -440,6 +453,10 @@ void DeviceSimulator::apply(const Scenario::Step& step) {
             }
             return;
         }
+        case Scenario::Action::Modem:
+            // Residency the daemon asks the modem for: no record.
+            mModem->apply(step);
+            return;
         case Scenario::Action::Battery: {
             mBattery->setLevel(step.value);
             pushBattery(mServices->state()->battery());
@@ -519,6 +536,9 @@ void DeviceSimulator::advanceTo(int64_t ms) {
         }
         levelChanged = mBattery->advance(ms - mModelMs);
         mModelMs = ms;
+    }
+    if (mModem) {
+        mModem->advanceTo(ms);
     }
     if (levelChanged) {
         pushBattery(mServices->state()->battery());
@@ -638,6 +658,9 @@ void DeviceSimulator::stopAll() {
     if (mReporter) {
         mReporter->stop();
     }
+    if (mModem) {
+        mModem->stop();
+    }
     mDaemonStatus = mDaemon.stop(kStopGraceMs);
     if (mDriver) {
         mDriver->stop();
@@ -736,6 +759,11 @@ int DeviceSimulator::finish(bool completed) {
         std::ofstream(mOptions.root + "/sim/summary.txt", std::ios::app) << traffic;
         std::ofstream(mOptions.root + "/sim/traffic-truth.tsv") << mTraffic->truthTable();
     }
+    if (mModem) {
+        std::string modem = modemReport(endMs - mStartMs);
+        fputs(modem.c_str(), stdout);
+        std::ofstream(mOptions.root + "/sim/summary.txt", std::ios::app) << modem;
+    }
     if (!mError.empty()) {
         fprintf(stderr, "kelvo-sim: %s\n", mError.c_str());
     }
@@ -817,6 +845,21 @@ WifiEnergyTruth::Result DeviceSimulator::wifiEnergyTruth(int64_t endMs) {
              truth.batches);
     mWifiEnergyHeading = text;
     return truth;
+}
+
+}  // namespace sim
+}  // namespace kelvo
+
+namespace kelvo {
+namespace sim {
+
+std::string DeviceSimulator::modemReport(int64_t endMs) {
+    std::vector<ModemModel::Sent> sent = mModem->sent();
+    ModemTruth truth(mScenario, mModemProfile, mStartMs, endMs);
+    truth.compute(sent);
+    std::ofstream(mOptions.root + "/sim/modem-truth.tsv") << truth.table();
+    return truth.report(SimReport::databasePath(mOptions.root), mModem->requests(), sent,
+                        mModem->pending());
 }
 
 }  // namespace sim

@@ -15,6 +15,8 @@
 #include "DeviceModel.h"
 #include "GpuLoadTruth.h"
 #include "DpmActivity.h"
+#include "ModemModel.h"
+#include "ModemTruth.h"
 #include "PlatformState.h"
 #include "RadioSensorTruth.h"
 #include "Scenario.h"
@@ -120,6 +122,10 @@ private:
     std::unique_ptr<GpuLoadTruth> mGpu;  // under mLock
     std::unique_ptr<CameraTruth> mCameras;
     std::unique_ptr<DpmActivity> mDpm;  // under mLock
+    // The modem answers the daemon's requests on its own thread.
+    std::unique_ptr<ModemModel> mModem;
+    ModemTruth::Profile mModemProfile;
+    std::string modemReport(int64_t endMs);
     int64_t mGuardUntilMs = 0;  // monotonic: no counter rewrite before
     bool mHaveBaseline = false;
     std::map<std::string, int64_t> mBaselineMs;

@@ -13,6 +13,7 @@
 #include "CpuTree.h"
 #include "GpuLoadTruth.h"
 #include "DpmActivity.h"
+#include "ModemModel.h"
 #include "RadioSensorTruth.h"
 #include "SystemScene.h"
 #include "TrafficModel.h"
@@ -360,6 +361,10 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
         }
     } else if (verb == "wifi") {
         if (!WifiRecords::parseStep(words, &step, reason)) {
+            return false;
+        }
+    } else if (int32_t modem = ModemModel::parseStep(words, &step, reason)) {
+        if (modem < 0) {
             return false;
         }
     } else if (int system = SystemScene::parseStep(words, &step.text, reason)) {

@@ -58,6 +58,7 @@ public:
                  // unconfigure (values: type), disconnect
         Dpm,     // text: IP block, value: time index, counters[0]: ms (DpmActivity)
         Ddr,     // value: level, counters[0]: seconds, counters[1]: MB (DpmActivity)
+        Modem,   // text: the kind (ModemModel::parseStep), value: level, counters[0]: ms
     };
 
     struct Step {
