@@ -27,6 +27,7 @@
 #include "handlers/components/SensorHandler.h"
 #include "handlers/components/CameraHandler.h"
 #include "handlers/SystemHandler.h"
+#include "handlers/ThermalHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
@@ -93,6 +94,10 @@ android::sp<KelvoOperator> makeCameraHandler() {
     return new CameraHandler();
 }
 
+android::sp<KelvoOperator> makeThermalHandler() {
+    return new ThermalHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -124,6 +129,7 @@ struct Factories {
         handlers[HANDLER_SENSOR] = &makeSensorHandler;
         handlers[HANDLER_GPU] = &makeGpuHandler;
         handlers[HANDLER_CAMERA] = &makeCameraHandler;
+        handlers[HANDLER_THERMAL] = &makeThermalHandler;
     }
 
     std::mutex lock;

@@ -43,6 +43,7 @@ enum class Health : uint32_t {
     TrafficReadingsRefused,  // traffic lines skipped or refused, keys or lists over their cap
     BatteryReadingsKept,     // battery values that could not be read (the last good one kept)
     HandlerStateCapped,      // component handler state grown from messages refused or trimmed at its cap
+    ThermalInputRefused,     // thermal triggers refused (repeated, too near, over the day's limit) and thermal statistics refused or cut
     Count
 };
 

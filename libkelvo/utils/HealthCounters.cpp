@@ -23,6 +23,7 @@ const char* const kHealthNames[] = {
         "traffic_readings_refused",
         "battery_readings_kept",
         "handler_state_capped",
+        "thermal_input_refused",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),
