@@ -28,8 +28,8 @@ public:
 
     // Longest text kept, in UTF-16 units.
     static constexpr size_t kMaxTextUnits = 256;
-    // A scene holds 8 int64, 27 int32 and 5 texts of at least 8 bytes.
-    static constexpr size_t kMinSceneSize = 8 * 8 + 27 * 4 + 5 * 8;
+    // A scene holds 3 int64, 29 int32 and 5 texts of at least 8 bytes.
+    static constexpr size_t kMinSceneSize = 3 * 8 + 29 * 4 + 5 * 8;
     // A package: its text and the int32 length of its pairs.
     static constexpr size_t kMinApplicationSize = 8 + 4;
     static constexpr int32_t kSceneInts = 20;  // signal_kind .. ambient_light
