@@ -1,6 +1,7 @@
 #include "handlers/ThermalHandler.h"
 
 #include <math.h>
+#include <time.h>
 
 #include <string>
 #include <vector>
@@ -12,7 +13,6 @@
 #include "core/Notifier.h"
 #include "storage/DataUploader.h"
 #include "utils/PackageProperty.h"
-#include "utils/TimeProvider.h"
 
 using android::Parcel;
 using android::String8;
@@ -138,6 +138,17 @@ int64_t clampToInt64(double value) {
         return INT64_MIN;
     }
     return static_cast<int64_t>(value);
+}
+
+// The local calendar day of a time, as year * 1000 + day of the year (the
+// zone's offset at that very time).
+int64_t localDay(int64_t ms) {
+    time_t seconds = static_cast<time_t>(ms / 1000 - (ms % 1000 < 0 ? 1 : 0));
+    struct tm local = {};
+    if (localtime_r(&seconds, &local) == nullptr) {
+        return ms / kDayMs;
+    }
+    return static_cast<int64_t>(local.tm_year) * 1000 + local.tm_yday;
 }
 
 void formPackage(uint32_t id, const std::string& name, Parcel& out) {
@@ -371,7 +382,7 @@ int32_t ThermalHandler::onDailyTick(const Parcel& data) {
     data.readInt64();
     const int64_t hour = data.readInt64();
     // Local days: a day of 23 or 25 hours is still one day.
-    if (TimeProvider(hour).startOfDay() <= TimeProvider(mDayStamp).startOfDay()) {
+    if (localDay(hour) <= localDay(mDayStamp)) {
         KLOGI("Ignore repeated daily tick in one day");
         return voteCandidate(hour, kCandidateDailyTick, kElector);
     }
@@ -481,7 +492,11 @@ void ThermalHandler::storeDaily(const ThermalRecords::daily& daily) {
 }
 
 void ThermalHandler::uploadShell(const ThermalRecords::daily& daily) {
+    // Range0's parameter is the window's end stamp as well: the count,
+    // formed last, keeps the place (the end is the start plus a day).
     Parcel out;
+    DataUploader::formDatetimeData(0, daily.dayStamp - kDayMs, out);
+    DataUploader::formDatetimeData(1, daily.dayStamp, out);
     bool formed = false;
     for (const ThermalRecords::range_count& r : daily.shell) {
         const int64_t index = ThermalRecords::rangeIndex(r.range);
@@ -498,12 +513,7 @@ void ThermalHandler::uploadShell(const ThermalRecords::daily& daily) {
         DataUploader::formIntData(static_cast<uint32_t>(index + 1), r.count, out);
         formed = true;
     }
-    if (!formed) {
-        return;
-    }
-    DataUploader::formDatetimeData(0, daily.dayStamp - kDayMs, out);
-    DataUploader::formDatetimeData(1, daily.dayStamp, out);
-    if (setAndUploadEvent(EVENT_THERMAL_SHELL, out, true) < 0) {
+    if (formed && setAndUploadEvent(EVENT_THERMAL_SHELL, out, true) < 0) {
         KLOGE("Failed to set upload thermal shell data");
     }
 }

@@ -62,6 +62,9 @@ const Refusal kRefusals[] = {
     {"gpu busy time below 0", "at 5 gpu com.example.mail 480 -1", "gpu <package> <MHz> <busy ms>"},
     {"single camera of a second stream", "at 5 camera configure 0 2 640 480", "camera connect"},
     {"camera of an undeclared pid", "at 5 camera connect 999 0", "pid 999 is not declared"},
+    {"thermal neither enter nor exit", "at 5 thermal hot", "thermal enter|exit"},
+    {"shell range without a count", "pelmora-shell Range0", "pelmora-shell <range>=<count>"},
+    {"scene with two temperatures", "pelmora-scene a b 38/41 a", "pelmora-scene <package>"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

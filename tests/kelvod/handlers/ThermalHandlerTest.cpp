@@ -6,6 +6,7 @@
 #include <json/json.h>
 #include <time.h>
 
+#include <map>
 #include <mutex>
 #include <thread>
 #include <utils/String16.h>
@@ -165,6 +166,10 @@ struct EpisodeCase {
     int64_t display, cpu, gnss;  // energies of the first upload
 };
 
+void PrintTo(const EpisodeCase& c, std::ostream* os) {
+    *os << c.name;
+}
+
 class EpisodeTest : public ThermalTest, public ::testing::WithParamInterface<EpisodeCase> {};
 
 // Rows of the first window (0, 10 min]: the battery gave 5 mAh (18000 after
@@ -271,9 +276,14 @@ TEST_F(ThermalTest, EleventhEpisodeWaitsForTheNextDay) {
 struct AnswerCase {
     const char* name;
     std::function<void(Parcel&, int64_t day)> body;
-    size_t applications, shell, scenes, shellUploads;
+    size_t applications, shell, scenes;
+    std::map<std::string, int64_t> shellCounts;  // uploaded, by parameter
     int64_t refused;
 };
+
+void PrintTo(const AnswerCase& c, std::ostream* os) {
+    *os << c.name;
+}
 
 class AnswerTest : public ThermalTest, public ::testing::WithParamInterface<AnswerCase> {};
 
@@ -326,7 +336,13 @@ TEST_P(AnswerTest, StoresWhatFitsAndVotesOnce) {
     EXPECT_EQ(c.shell, rows("SELECT count FROM daily_thermal_shell").size());
     EXPECT_EQ(c.scenes, rows("SELECT top_time FROM raw_thermal_heat_scene").size());
     EXPECT_EQ(c.scenes, uploads(EVENT_THERMAL_SCENE).size());
-    EXPECT_EQ(c.shellUploads, uploads(EVENT_THERMAL_SHELL).size());
+    std::vector<Json::Value> shell = uploads(EVENT_THERMAL_SHELL);
+    ASSERT_EQ(c.shellCounts.empty() ? 0u : 1u, shell.size());
+    std::map<std::string, int64_t> counts;
+    for (const std::string& id : shell.empty() ? std::vector<std::string>() : shell[0].getMemberNames()) {
+        if (shell[0][id].isIntegral()) counts[id] = shell[0][id].asInt64();
+    }
+    EXPECT_EQ(c.shellCounts, counts);
     EXPECT_EQ(c.refused, refused());
 }
 
@@ -349,8 +365,8 @@ void full(Parcel& p, int64_t day) {
 INSTANTIATE_TEST_SUITE_P(
     Thermal, AnswerTest,
     ::testing::Values(
-        AnswerCase{"ThreeTables", full, 3, 4, 1, 1, 2},
-        AnswerCase{"OtherDay", [](Parcel& p, int64_t day) { full(p, day - kDay); }, 0, 0, 0, 0,
+        AnswerCase{"ThreeTables", full, 3, 4, 1, {{"1", 5}, {"21", 1}}, 2},
+        AnswerCase{"OtherDay", [](Parcel& p, int64_t day) { full(p, day - kDay); }, 0, 0, 0, {},
                    1},
         AnswerCase{"CountPastTheData",
                    [](Parcel& p, int64_t day) {
@@ -359,14 +375,14 @@ INSTANTIATE_TEST_SUITE_P(
                        p.writeInt32(1000);
                        scene(p);
                    },
-                   0, 0, 0, 0, 1},
+                   0, 0, 0, {}, 1},
         AnswerCase{"LengthPastTheEnd",
                    [](Parcel& p, int64_t day) {
                        p.writeInt64(day);
                        p.writeInt32(1);
                        pairs(p, {{"Range1", 3}}, 64);
                    },
-                   0, 0, 0, 0, 1},
+                   0, 0, 0, {}, 1},
         AnswerCase{"UnknownBlockEndsTheEntry",
                    [](Parcel& p, int64_t day) {
                        p.writeInt64(day);
@@ -376,7 +392,7 @@ INSTANTIATE_TEST_SUITE_P(
                        p.writeInt32(1);
                        pairs(p, {{"Range2", 3}});
                    },
-                   0, 1, 0, 1, 1}),
+                   0, 1, 0, {{"2", 3}}, 1}),
     [](const ::testing::TestParamInfo<AnswerCase>& info) { return info.param.name; });
 
 // A 23-hour day (clocks forward) is a day: its tick asks again. A second
