@@ -47,8 +47,8 @@ constexpr int kApps = 20;
 bool fillTable(sqlite3* db, const std::string& table) {
     std::vector<std::pair<std::string, std::string>> columns;  // name, declared type
     sqlite3_stmt* info = nullptr;
-    if (sqlite3_prepare_v2(db, ("PRAGMA table_info(" + table + ")").c_str(), -1, &info,
-                           nullptr) != SQLITE_OK) {
+    if (sqlite3_prepare_v2(db, ("PRAGMA table_info(" + table + ")").c_str(), -1, &info, nullptr) !=
+        SQLITE_OK) {
         return false;
     }
     while (sqlite3_step(info) == SQLITE_ROW) {
@@ -111,18 +111,17 @@ void BM_ThermalEpisode(benchmark::State& state) {
     kelvo::RootPath::setRoot(root.c_str());
     kelvo::WallClock::setFixedTimeMs(kStart + kDayMs);
     sp<kelvo::KelvoStorage> storage = kelvo::KelvoAgent::getInstance()->getStorage();
-    for (sp<kelvo::KelvoOperator> op :
-         {sp<kelvo::KelvoOperator>(new kelvo::BatteryHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::DisplayHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::CpuHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::GnssHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::SensorHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::GpuHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::CameraHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::FlashlightHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::AudioHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::WifiHandler()),
-          sp<kelvo::KelvoOperator>(new kelvo::BluetoothHandler())}) {
+    for (sp<kelvo::KelvoOperator> op : {sp<kelvo::KelvoOperator>(new kelvo::BatteryHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::DisplayHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::CpuHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::GnssHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::SensorHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::GpuHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::CameraHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::FlashlightHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::AudioHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::WifiHandler()),
+                                        sp<kelvo::KelvoOperator>(new kelvo::BluetoothHandler())}) {
         op->addSchemaTable();
         op->requestThreadExit();
         op->join();

@@ -44,11 +44,10 @@ TABLE("1.3", raw_thermal_heat_scene, {COLUMN_TIME, "timestamp"}, {COLUMN_TIME, "
       {COLUMN_INT, "end_temperature"}, {COLUMN_INT, "top_temperature"}, {COLUMN_TIME, "top_time"},
       {COLUMN_INT, "brightness"}, {COLUMN_INT, "media_volume"}, {COLUMN_INT, "signal_kind"},
       {COLUMN_INT, "signal_level"}, {COLUMN_INT, "gps_state"}, {COLUMN_INT, "wifi_state"},
-      {COLUMN_INT, "wifi_ap_state"}, {COLUMN_INT, "calling_state"},
-      {COLUMN_INT, "ap_temperature"}, {COLUMN_INT, "charger_temperature"},
-      {COLUMN_INT, "flashlight_temperature"}, {COLUMN_INT, "pa_temperature"},
-      {COLUMN_INT, "dcxo_temperature"}, {COLUMN_INT, "rear_main_camera_temperature"},
-      {COLUMN_INT, "front_camera_temperature"},
+      {COLUMN_INT, "wifi_ap_state"}, {COLUMN_INT, "calling_state"}, {COLUMN_INT, "ap_temperature"},
+      {COLUMN_INT, "charger_temperature"}, {COLUMN_INT, "flashlight_temperature"},
+      {COLUMN_INT, "pa_temperature"}, {COLUMN_INT, "dcxo_temperature"},
+      {COLUMN_INT, "rear_main_camera_temperature"}, {COLUMN_INT, "front_camera_temperature"},
       {COLUMN_INT, "rear_secondary_camera_temperature"}, {COLUMN_INT, "camera_model"},
       {COLUMN_INT, "battery_temperature"}, {COLUMN_INT, "charger_state"},
       {COLUMN_INT, "battery_current"}, {COLUMN_INT, "battery_voltage"},
@@ -69,7 +68,7 @@ const table_attribute* const kTables[] = {
 // Usage and energy summed over an episode. Tables with result buckets sum
 // their four usage buckets (foreground, background and the two charging
 // ones; screen on and off repeat them).
-#define BUCKET_SUM(suffix)                                                     \
+#define BUCKET_SUM(suffix)                                                      \
     "SUM(foreground_" suffix "+background_" suffix "+charge_foreground_" suffix \
     "+charge_background_" suffix ")"
 #define BUCKET_SUMS(unit) BUCKET_SUM(unit) ", " BUCKET_SUM("energy")
@@ -83,8 +82,8 @@ struct usage_query {
 };
 
 const usage_query kUsageQueries[] = {
-    {"SUM(duration+charge_duration), SUM(energy+charge_energy)", "raw_applications_backlight", 5,
-     4, "display usage and energy"},
+    {"SUM(duration+charge_duration), SUM(energy+charge_energy)", "raw_applications_backlight", 5, 4,
+     "display usage and energy"},
     {BUCKET_SUMS("time"), "raw_component_cpu", 7, 6, "cpu usage and energy"},
     {BUCKET_SUMS("duration"), "raw_component_gnss", 9, 8, "gnss usage and energy"},
     {BUCKET_SUMS("duration"), "raw_component_sensor", 11, 10, "sensor usage and energy"},
@@ -94,13 +93,11 @@ const usage_query kUsageQueries[] = {
      "camera usage and energy: raw_applications_front_camera"},
     {BUCKET_SUMS("duration"), "raw_applications_rear_camera", 17, 16,
      "camera usage and energy: raw_applications_rear_camera"},
-    {BUCKET_SUMS("duration"), "raw_applications_flashlight", 19, 18,
-     "flashlight usage and energy"},
+    {BUCKET_SUMS("duration"), "raw_applications_flashlight", 19, 18, "flashlight usage and energy"},
     {BUCKET_SUMS("duration"), "raw_applications_audio", 21, 20, "audio usage and energy"},
     {BUCKET_SUM("tx_bytes") "+" BUCKET_SUM("rx_bytes") ", " BUCKET_SUM("energy"),
      "raw_applications_wifi", 26, 25, "wifi traffic and energy"},
-    {BUCKET_SUMS("duration"), "raw_applications_bluetooth", 28, 27,
-     "bluetooth usage and energy"},
+    {BUCKET_SUMS("duration"), "raw_applications_bluetooth", 28, 27, "bluetooth usage and energy"},
 };
 
 #undef BUCKET_SUMS
@@ -208,8 +205,8 @@ void ThermalHandler::setCandidateElector() {
 
 void ThermalHandler::dump(String8& out) {
     out.appendFormat("ThermalHandler: state %d, episodes today %d, last %lld .. %lld, day %lld\n",
-                     mState, mCount, static_cast<long long>(mStart),
-                     static_cast<long long>(mEnd), static_cast<long long>(mDayStamp));
+                     mState, mCount, static_cast<long long>(mStart), static_cast<long long>(mEnd),
+                     static_cast<long long>(mDayStamp));
     KelvoOperator::dump(out);
 }
 
@@ -420,12 +417,12 @@ int32_t ThermalHandler::handleBufferedLog(const Parcel& data) {
     int32_t magic = 0;
     int32_t length = 0;
     const void* bytes = nullptr;
-    const bool ok = data.readInt64(&arrival) == android::NO_ERROR &&
-                    data.readString8(&sender) == android::NO_ERROR &&
-                    data.readInt32(&magic) == android::NO_ERROR &&
-                    data.readInt32(&length) == android::NO_ERROR && length >= 0 &&
-                    (length == 0 ||
-                     (bytes = data.readInplace(static_cast<size_t>(length))) != nullptr);
+    const bool ok =
+        data.readInt64(&arrival) == android::NO_ERROR &&
+        data.readString8(&sender) == android::NO_ERROR &&
+        data.readInt32(&magic) == android::NO_ERROR &&
+        data.readInt32(&length) == android::NO_ERROR && length >= 0 &&
+        (length == 0 || (bytes = data.readInplace(static_cast<size_t>(length))) != nullptr);
     int32_t ret = 0;
     if (!ok || sender != kSender || magic != kSenderType) {
         KLOGE("Unknown buffered log type");

@@ -1,13 +1,12 @@
 #include "handlers/ThermalRecords.h"
 
+#include <binder/Parcel.h>
 #include <errno.h>
 #include <stdlib.h>
-
-#include <functional>
-
-#include <binder/Parcel.h>
 #include <utils/String16.h>
 #include <utils/String8.h>
+
+#include <functional>
 
 using android::Parcel;
 

@@ -38,15 +38,14 @@ std::string dateOf(int64_t ms) {
     return text;
 }
 
-#define BUCKETS(unit)                                                                 \
-    "foreground_" unit "+background_" unit "+charge_foreground_" unit                 \
-    "+charge_background_" unit
+#define BUCKETS(unit) \
+    "foreground_" unit "+background_" unit "+charge_foreground_" unit "+charge_background_" unit
 
 // Each component's rows: usage and energy sums, and where the upload puts
 // them.
 struct component {
     const char* name;
-    const char* usage;   // "SUM(...) FROM table" pieces
+    const char* usage;  // "SUM(...) FROM table" pieces
     const char* energy;
     const char* table;
     const char* usageTable;  // when not the same table
@@ -55,25 +54,26 @@ struct component {
 };
 
 const component kComponents[] = {
-    {"display", "duration+charge_duration", "energy+charge_energy", "raw_applications_backlight", nullptr, 5,
-     4},
+    {"display", "duration+charge_duration", "energy+charge_energy", "raw_applications_backlight",
+     nullptr, 5, 4},
     {"cpu", BUCKETS("time"), BUCKETS("energy"), "raw_component_cpu", nullptr, 7, 6},
     {"gnss", BUCKETS("duration"), BUCKETS("energy"), "raw_component_gnss", nullptr, 9, 8},
     {"sensors", BUCKETS("duration"), BUCKETS("energy"), "raw_component_sensor", nullptr, 11, 10},
     {"gpu", "usage+charge_usage", "energy+charge_energy", "raw_applications_gpu", nullptr, 13, 12},
-    {"front camera", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_front_camera", nullptr, 15,
-     14},
-    {"rear camera", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_rear_camera", nullptr, 17,
-     16},
-    {"flashlight", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_flashlight", nullptr, 19, 18},
+    {"front camera", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_front_camera",
+     nullptr, 15, 14},
+    {"rear camera", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_rear_camera", nullptr,
+     17, 16},
+    {"flashlight", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_flashlight", nullptr,
+     19, 18},
     {"audio", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_audio", nullptr, 21, 20},
     {"modem (bytes)", BUCKETS("tx_bytes") "+" BUCKETS("rx_bytes"), "energy+charge_energy",
      "raw_component_modem", "raw_applications_modem", 23, 22},
     {"wifi (bytes)", BUCKETS("tx_bytes") "+" BUCKETS("rx_bytes"), BUCKETS("energy"),
      "raw_applications_wifi", nullptr, 26, 25},
-    {"bluetooth", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_bluetooth", nullptr, 28, 27},
+    {"bluetooth", BUCKETS("duration"), BUCKETS("energy"), "raw_applications_bluetooth", nullptr, 28,
+     27},
 };
-
 
 // One value of a one-row query; 0 when the table is missing.
 int64_t scalar(sqlite3* db, const std::string& sql) {
@@ -106,23 +106,27 @@ std::vector<Json::Value> episodeEvents(const std::string& path) {
 
 void describeEpisode(sqlite3* db, int64_t start, int64_t end, const Json::Value* up,
                      std::string* out) {
-    const std::string window = format(" WHERE end_time > %" PRId64 " AND end_time <= %" PRId64,
-                                      start, end);
+    const std::string window =
+        format(" WHERE end_time > %" PRId64 " AND end_time <= %" PRId64, start, end);
     const int64_t gas = scalar(
-        db, "SELECT SUM(discharge_screen_on_gas_gauge+discharge_screen_off_gas_gauge) FROM "
-            "raw_component_battery" + window +
-                " AND discharge_screen_on_gas_gauge >= 0 AND discharge_screen_off_gas_gauge >= 0 "
-                "AND discharge_screen_on_level >= 0 AND discharge_screen_off_level >= 0");
-    const int64_t charging = scalar(
-        db, "SELECT SUM(charge_screen_on_duration+charge_screen_off_duration) FROM "
-            "raw_component_battery" + window);
+        db,
+        "SELECT SUM(discharge_screen_on_gas_gauge+discharge_screen_off_gas_gauge) FROM "
+        "raw_component_battery" +
+            window +
+            " AND discharge_screen_on_gas_gauge >= 0 AND discharge_screen_off_gas_gauge >= 0 "
+            "AND discharge_screen_on_level >= 0 AND discharge_screen_off_level >= 0");
+    const int64_t charging =
+        scalar(db,
+               "SELECT SUM(charge_screen_on_duration+charge_screen_off_duration) FROM "
+               "raw_component_battery" +
+                   window);
     std::vector<std::pair<int64_t, int64_t>> sums;
     double accounted = 0;
     for (const component& c : kComponents) {
         int64_t usage = scalar(db, std::string("SELECT SUM(") + c.usage + ") FROM " +
                                        (c.usageTable != nullptr ? c.usageTable : c.table) + window);
-        int64_t energy = scalar(db, std::string("SELECT SUM(") + c.energy + ") FROM " + c.table +
-                                        window);
+        int64_t energy =
+            scalar(db, std::string("SELECT SUM(") + c.energy + ") FROM " + c.table + window);
         sums.push_back({usage, energy});
         accounted += static_cast<double>(energy);
     }
@@ -140,11 +144,10 @@ void describeEpisode(sqlite3* db, int64_t start, int64_t end, const Json::Value*
             const Json::Value& v = up == nullptr ? Json::Value() : (*up)[std::to_string(param)];
             return v.isIntegral() ? std::to_string(v.asInt64()) : "-";
         };
-        *out += format("    %-14s %12s %12" PRId64 " %12s %12" PRId64 " %12" PRId64 "\n", c.name,
-                       uploaded(c.usageParam).c_str(), sums[i].first,
-                       uploaded(c.energyParam).c_str(),
-                       static_cast<int64_t>(static_cast<double>(sums[i].second) * factor),
-                       sums[i].second);
+        *out += format(
+            "    %-14s %12s %12" PRId64 " %12s %12" PRId64 " %12" PRId64 "\n", c.name,
+            uploaded(c.usageParam).c_str(), sums[i].first, uploaded(c.energyParam).c_str(),
+            static_cast<int64_t>(static_cast<double>(sums[i].second) * factor), sums[i].second);
     }
 }
 
@@ -160,7 +163,8 @@ std::string ThermalReport::build() const {
     std::vector<Json::Value> events = episodeEvents(mEventsPath);
     sqlite3_stmt* stmt = nullptr;
     int32_t episodes = 0;
-    if (sqlite3_prepare_v2(db, "SELECT start_time, end_time FROM raw_thermal_abnormality ORDER BY id",
+    if (sqlite3_prepare_v2(db,
+                           "SELECT start_time, end_time FROM raw_thermal_abnormality ORDER BY id",
                            -1, &stmt, nullptr) == SQLITE_OK) {
         while (sqlite3_step(stmt) == SQLITE_ROW) {
             const int64_t start = sqlite3_column_int64(stmt, 0);

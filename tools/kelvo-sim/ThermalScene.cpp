@@ -1,14 +1,13 @@
 #include "ThermalScene.h"
 
+#include <binder/Parcel.h>
 #include <errno.h>
 #include <stdlib.h>
 #include <string.h>
 #include <time.h>
+#include <utils/String16.h>
 
 #include <sstream>
-
-#include <binder/Parcel.h>
-#include <utils/String16.h>
 
 #include "kelvo/BufferedLogClient.h"
 
@@ -128,7 +127,8 @@ int ThermalScene::parseLine(const std::vector<std::string>& words, Content* cont
         return 1;
     }
     if (verb == "pelmora-shell") {
-        if (words.size() != 2 || !content->shell.empty() || !parseRanges(words[1], &content->shell)) {
+        if (words.size() != 2 || !content->shell.empty() ||
+            !parseRanges(words[1], &content->shell)) {
             *reason = "expected one \"pelmora-shell <range>=<count>[,...]\"";
             return -1;
         }
@@ -138,13 +138,14 @@ int ThermalScene::parseLine(const std::vector<std::string>& words, Content* cont
         return 0;
     }
     Scene scene;
-    std::vector<std::string> temperatures = words.size() == 5 ? split(words[3], '/') : std::vector<std::string>();
+    std::vector<std::string> temperatures =
+        words.size() == 5 ? split(words[3], '/') : std::vector<std::string>();
     scene.top = words.size() == 5 ? split(words[4], ',') : std::vector<std::string>();
     bool ok = temperatures.size() == 3 && isWord(words[1]) && isWord(words[2]) &&
               parseNumber(temperatures[0], -40, 150, &scene.startTemperature) &&
               parseNumber(temperatures[1], -40, 150, &scene.endTemperature) &&
-              parseNumber(temperatures[2], -40, 150, &scene.topTemperature) &&
-              !scene.top.empty() && scene.top.size() <= 3 && content->scenes.size() < kMaxItems;
+              parseNumber(temperatures[2], -40, 150, &scene.topTemperature) && !scene.top.empty() &&
+              scene.top.size() <= 3 && content->scenes.size() < kMaxItems;
     for (const std::string& top : scene.top) {
         ok = ok && isWord(top);
     }
@@ -192,8 +193,9 @@ std::string ThermalScene::answer(const Content& content, int64_t day) {
             out.writeInt32(8);    // media volume
             // signal kind .. ambient light: LTE at level 3, GNSS and Wi-Fi
             // on, the chips' temperatures near the top one.
-            const int32_t values[20] = {4, 3, 1, 1, 0, 0, s.topTemperature, 36, 33, 39,
-                                        35, 34, 33, 32, 1, 35, 0, -850, 3870, 200};
+            const int32_t values[20] = {4,  3,  1,  1,    0,    0,  s.topTemperature,
+                                        36, 33, 39, 35,   34,   33, 32,
+                                        1,  35, 0,  -850, 3870, 200};
             for (int32_t v : values) {
                 out.writeInt32(v);
             }

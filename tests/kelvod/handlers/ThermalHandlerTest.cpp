@@ -5,11 +5,11 @@
 #include <gtest/gtest.h>
 #include <json/json.h>
 #include <time.h>
+#include <utils/String16.h>
 
 #include <map>
 #include <mutex>
 #include <thread>
-#include <utils/String16.h>
 
 #include "HealthCounters.h"
 #include "core/BufferedLogServer.h"
@@ -75,10 +75,9 @@ protected:
         ASSERT_EQ(0, BufferedLogServer::getInstance()->start());
         // The component tables the episode is summed from, as their owners
         // define them.
-        for (sp<KelvoOperator> op : {sp<KelvoOperator>(new BatteryHandler()),
-                                     sp<KelvoOperator>(new DisplayHandler()),
-                                     sp<KelvoOperator>(new CpuHandler()),
-                                     sp<KelvoOperator>(new GnssHandler())}) {
+        for (sp<KelvoOperator> op :
+             {sp<KelvoOperator>(new BatteryHandler()), sp<KelvoOperator>(new DisplayHandler()),
+              sp<KelvoOperator>(new CpuHandler()), sp<KelvoOperator>(new GnssHandler())}) {
             op->addSchemaTable();
             op->requestThreadExit();
             op->join();
@@ -160,8 +159,8 @@ protected:
 struct EpisodeCase {
     const char* name;
     bool charging;
-    std::vector<std::pair<int32_t, int64_t>> triggers;   // tag, time after kT0
-    std::vector<std::pair<int64_t, int64_t>> episodes;   // uploaded windows
+    std::vector<std::pair<int32_t, int64_t>> triggers;  // tag, time after kT0
+    std::vector<std::pair<int64_t, int64_t>> episodes;  // uploaded windows
     int64_t refused;
     int64_t display, cpu, gnss;  // energies of the first upload
 };
@@ -186,8 +185,8 @@ TEST_P(EpisodeTest, UploadsEachEpisodeOverItsWindow) {
     // The four usage buckets' (usage, energy) columns.
     auto both = [](const char* unit) {
         std::string out;
-        for (const char* b : {"foreground_", "background_", "charge_foreground_",
-                              "charge_background_"}) {
+        for (const char* b :
+             {"foreground_", "background_", "charge_foreground_", "charge_background_"}) {
             out += std::string(out.empty() ? "" : ", ") + b + unit + ", " + b + "energy";
         }
         return out;
@@ -199,8 +198,9 @@ TEST_P(EpisodeTest, UploadsEachEpisodeOverItsWindow) {
                "discharge_screen_on_level, discharge_screen_off_level, charge_screen_on_duration, "
                "charge_screen_off_duration",
                end, std::string("3, 2, 1, 1, ") + (c.charging ? "1000" : "0") + ", 0");
-        insert("raw_applications_backlight", "name, duration, energy, charge_duration, charge_energy",
-               end, "'a', 600000, 6000" + k + ", 0, 0");
+        insert("raw_applications_backlight",
+               "name, duration, energy, charge_duration, charge_energy", end,
+               "'a', 600000, 6000" + k + ", 0, 0");
         insert("raw_component_cpu", both("time"), end,
                "300000, 10000" + k + ", 100000, 2000, 0, 0, 0, 0");
         insert("raw_component_gnss", both("duration"), end,
@@ -230,31 +230,23 @@ TEST_P(EpisodeTest, UploadsEachEpisodeOverItsWindow) {
 constexpr int32_t kIn = ThermalHandler::TAG_HIGH_TEMP_ENTER;
 constexpr int32_t kOut = ThermalHandler::TAG_HIGH_TEMP_EXIT;
 
-INSTANTIATE_TEST_SUITE_P(
-    Thermal, EpisodeTest,
-    ::testing::Values(
-        EpisodeCase{"Scaled", false, {{kIn, 0}, {kOut, 10 * kMin}}, {{0, 10 * kMin}}, 0, 4500,
-                    9000, 4500},
-        EpisodeCase{"ChargingUnscaled", true, {{kIn, 0}, {kOut, 10 * kMin}}, {{0, 10 * kMin}}, 0,
-                    6000, 12000, 6000},
-        // The next episode starts before the first is summed.
-        EpisodeCase{"EnterSoonAfterExit",
-                    false,
-                    {{kIn, 0}, {kOut, 10 * kMin}, {kIn, 10 * kMin + 30000}, {kOut, 12 * kMin}},
-                    {{0, 10 * kMin}, {10 * kMin + 30000, 12 * kMin}},
-                    0, 4500, 9000, 4500},
-        // The second enter is too near; its exit then finds no episode.
-        EpisodeCase{"EntersFiveMinutesApart",
-                    false,
-                    {{kIn, 0}, {kOut, kMin}, {kIn, 5 * kMin}, {kOut, 6 * kMin}},
-                    {{0, kMin}},
-                    2, 0, 0, 0},
-        EpisodeCase{"ClockSetBack",
-                    false,
-                    {{kIn, 0}, {kOut, kMin}, {kIn, -60 * kMin}, {kOut, -50 * kMin}},
-                    {{0, kMin}, {-60 * kMin, -50 * kMin}},
-                    0, 0, 0, 0}),
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Thermal, EpisodeTest, ::testing::Values(
+    EpisodeCase{"Scaled", false, {{kIn, 0}, {kOut, 10 * kMin}}, {{0, 10 * kMin}}, 0, 4500, 9000, 4500},
+    EpisodeCase{"ChargingUnscaled", true, {{kIn, 0}, {kOut, 10 * kMin}}, {{0, 10 * kMin}}, 0,
+                6000, 12000, 6000},
+    // The next episode starts before the first is summed.
+    EpisodeCase{"EnterSoonAfterExit", false,
+                {{kIn, 0}, {kOut, 10 * kMin}, {kIn, 10 * kMin + 30000}, {kOut, 12 * kMin}},
+                {{0, 10 * kMin}, {10 * kMin + 30000, 12 * kMin}}, 0, 4500, 9000, 4500},
+    // The second enter is too near; its exit then finds no episode.
+    EpisodeCase{"EntersFiveMinutesApart", false,
+                {{kIn, 0}, {kOut, kMin}, {kIn, 5 * kMin}, {kOut, 6 * kMin}}, {{0, kMin}}, 2, 0, 0, 0},
+    EpisodeCase{"ClockSetBack", false,
+                {{kIn, 0}, {kOut, kMin}, {kIn, -60 * kMin}, {kOut, -50 * kMin}},
+                {{0, kMin}, {-60 * kMin, -50 * kMin}}, 0, 0, 0, 0}),
     [](const ::testing::TestParamInfo<EpisodeCase>& info) { return info.param.name; });
+// clang-format on
 
 // Ten episodes a day; the eleventh waits for the next day.
 TEST_F(ThermalTest, EleventhEpisodeWaitsForTheNextDay) {
@@ -339,7 +331,8 @@ TEST_P(AnswerTest, StoresWhatFitsAndVotesOnce) {
     std::vector<Json::Value> shell = uploads(EVENT_THERMAL_SHELL);
     ASSERT_EQ(c.shellCounts.empty() ? 0u : 1u, shell.size());
     std::map<std::string, int64_t> counts;
-    for (const std::string& id : shell.empty() ? std::vector<std::string>() : shell[0].getMemberNames()) {
+    for (const std::string& id :
+         shell.empty() ? std::vector<std::string>() : shell[0].getMemberNames()) {
         if (shell[0][id].isIntegral()) counts[id] = shell[0][id].asInt64();
     }
     EXPECT_EQ(c.shellCounts, counts);
@@ -362,38 +355,22 @@ void full(Parcel& p, int64_t day) {
     scene(p);
 }
 
-INSTANTIATE_TEST_SUITE_P(
-    Thermal, AnswerTest,
-    ::testing::Values(
-        AnswerCase{"ThreeTables", full, 3, 4, 1, {{"1", 5}, {"21", 1}}, 2},
-        AnswerCase{"OtherDay", [](Parcel& p, int64_t day) { full(p, day - kDay); }, 0, 0, 0, {},
-                   1},
-        AnswerCase{"CountPastTheData",
-                   [](Parcel& p, int64_t day) {
-                       p.writeInt64(day);
-                       p.writeInt32(2);
-                       p.writeInt32(1000);
-                       scene(p);
-                   },
-                   0, 0, 0, {}, 1},
-        AnswerCase{"LengthPastTheEnd",
-                   [](Parcel& p, int64_t day) {
-                       p.writeInt64(day);
-                       p.writeInt32(1);
-                       pairs(p, {{"Range1", 3}}, 64);
-                   },
-                   0, 0, 0, {}, 1},
-        AnswerCase{"UnknownBlockEndsTheEntry",
-                   [](Parcel& p, int64_t day) {
-                       p.writeInt64(day);
-                       p.writeInt32(1);
-                       pairs(p, {{"Range1", 3}});
-                       p.writeInt32(9);
-                       p.writeInt32(1);
-                       pairs(p, {{"Range2", 3}});
-                   },
-                   0, 1, 0, {{"2", 3}}, 1}),
+// clang-format off
+INSTANTIATE_TEST_SUITE_P(Thermal, AnswerTest, ::testing::Values(
+    AnswerCase{"ThreeTables", full, 3, 4, 1, {{"1", 5}, {"21", 1}}, 2},
+    AnswerCase{"OtherDay", [](Parcel& p, int64_t day) { full(p, day - kDay); }, 0, 0, 0, {}, 1},
+    AnswerCase{"CountPastTheData", [](Parcel& p, int64_t day) {
+        p.writeInt64(day); p.writeInt32(2); p.writeInt32(1000); scene(p);
+    }, 0, 0, 0, {}, 1},
+    AnswerCase{"LengthPastTheEnd", [](Parcel& p, int64_t day) {
+        p.writeInt64(day); p.writeInt32(1); pairs(p, {{"Range1", 3}}, 64);
+    }, 0, 0, 0, {}, 1},
+    AnswerCase{"UnknownBlockEndsTheEntry", [](Parcel& p, int64_t day) {
+        p.writeInt64(day); p.writeInt32(1); pairs(p, {{"Range1", 3}});
+        p.writeInt32(9); p.writeInt32(1); pairs(p, {{"Range2", 3}});
+    }, 0, 1, 0, {{"2", 3}}, 1}),
     [](const ::testing::TestParamInfo<AnswerCase>& info) { return info.param.name; });
+// clang-format on
 
 // A 23-hour day (clocks forward) is a day: its tick asks again. A second
 // tick in one day votes at once; without an answer the vote comes after
