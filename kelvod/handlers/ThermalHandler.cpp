@@ -229,7 +229,7 @@ int32_t ThermalHandler::handleLogger(int64_t time, int32_t tag, const char* /* t
 
 int32_t ThermalHandler::enter(int64_t time) {
     // A clock set back puts the enter before the previous start: far enough.
-    if (time - mStart <= kMinEnterSpacingMs && time >= mStart) {
+    if (time >= mStart && time - mStart <= kMinEnterSpacingMs) {
         KLOGI("Ignore nearest thermal abnormality trigger");
         return refuse(-2);
     }
