@@ -1,5 +1,6 @@
 #include "ThermalReport.h"
 
+#include <dirent.h>
 #include <inttypes.h>
 #include <json/json.h>
 #include <sqlite3.h>
@@ -183,12 +184,32 @@ std::string ThermalReport::build() const {
     if (episodes == 0) {
         out += "  none\n";
     }
-    const int64_t apps = scalar(db, "SELECT COUNT(*) FROM daily_thermal_applications");
-    const int64_t shell = scalar(db, "SELECT COUNT(*) FROM daily_thermal_shell");
-    const int64_t scenes = scalar(db, "SELECT COUNT(*) FROM raw_thermal_heat_scene");
+    // A midnight round moves the day's rows into the day's copy and cleans
+    // them from the database: count both.
+    std::vector<std::string> files = {mDatabasePath};
+    const std::string upload = mDatabasePath.substr(0, mDatabasePath.rfind('/') + 1) + "upload";
+    if (DIR* dir = opendir(upload.c_str())) {
+        while (struct dirent* entry = readdir(dir)) {
+            std::string name = entry->d_name;
+            if (name.size() > 3 && name.compare(name.size() - 3, 3, ".db") == 0) {
+                files.push_back(upload + "/" + name);
+            }
+        }
+        closedir(dir);
+    }
+    int64_t counts[3] = {};
+    for (const std::string& file : files) {
+        sqlite3* copy = nullptr;
+        if (sqlite3_open_v2(file.c_str(), &copy, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
+            counts[0] += scalar(copy, "SELECT COUNT(*) FROM daily_thermal_applications");
+            counts[1] += scalar(copy, "SELECT COUNT(*) FROM daily_thermal_shell");
+            counts[2] += scalar(copy, "SELECT COUNT(*) FROM raw_thermal_heat_scene");
+        }
+        sqlite3_close(copy);
+    }
     out += format("  daily statistics from Pelmora: %" PRId64 " application ranges, %" PRId64
                   " shell ranges, %" PRId64 " heat scenes\n",
-                  apps, shell, scenes);
+                  counts[0], counts[1], counts[2]);
     sqlite3_close(db);
     return out;
 }
