@@ -224,10 +224,10 @@ int32_t ThermalHandler::handleLogger(int64_t time, int32_t tag, const char* /* t
         KLOGI("Repeated thermal abnormality trigger");
         return refuse(-2);
     }
-    return tag == TAG_HIGH_TEMP_ENTER ? enter(time) : exit(time);
+    return tag == TAG_HIGH_TEMP_ENTER ? enterEpisode(time) : exitEpisode(time);
 }
 
-int32_t ThermalHandler::enter(int64_t time) {
+int32_t ThermalHandler::enterEpisode(int64_t time) {
     // A clock set back puts the enter before the previous start: far enough.
     if (time >= mStart && time - mStart <= kMinEnterSpacingMs) {
         KLOGI("Ignore nearest thermal abnormality trigger");
@@ -248,7 +248,7 @@ int32_t ThermalHandler::enter(int64_t time) {
     return 0;
 }
 
-int32_t ThermalHandler::exit(int64_t time) {
+int32_t ThermalHandler::exitEpisode(int64_t time) {
     mState = TAG_HIGH_TEMP_EXIT;
     mEnd = time;
     Parcel data;

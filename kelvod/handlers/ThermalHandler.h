@@ -61,8 +61,8 @@ public:
     int32_t onDailyTick(const android::Parcel& data) override;
 
 private:
-    int32_t enter(int64_t time);
-    int32_t exit(int64_t time);
+    int32_t enterEpisode(int64_t time);
+    int32_t exitEpisode(int64_t time);
     int32_t recordEpisode(int64_t start, int64_t end);
     int32_t handleDaily(const uint8_t* data, size_t size);
     void storeDaily(const ThermalRecords::daily& daily);
