@@ -327,7 +327,17 @@ TEST_P(AnswerTest, StoresWhatFitsAndVotesOnce) {
     EXPECT_EQ(c.applications, rows("SELECT name FROM daily_thermal_applications").size());
     EXPECT_EQ(c.shell, rows("SELECT count FROM daily_thermal_shell").size());
     EXPECT_EQ(c.scenes, rows("SELECT top_time FROM raw_thermal_heat_scene").size());
-    EXPECT_EQ(c.scenes, uploads(EVENT_THERMAL_SCENE).size());
+    std::vector<Json::Value> scenes = uploads(EVENT_THERMAL_SCENE);
+    EXPECT_EQ(c.scenes, scenes.size());
+    // The scene's values (100 + their place after the top time) where each belongs.
+    const std::map<std::string, int64_t> kPlaces = {{"4", 45},   {"6", 100},  {"8", 102},
+                                                    {"26", 120}, {"28", 121}, {"30", 123},
+                                                    {"31", 40},  {"32", 39}};
+    for (const auto& [param, value] : kPlaces) {
+        if (!scenes.empty()) EXPECT_EQ(value, scenes[0][param].asInt64()) << param;
+    }
+    if (!scenes.empty())
+        EXPECT_EQ("com.video", scenes[0]["27"]["params"]["11"]["params"]["0"].asString());
     std::vector<Json::Value> shell = uploads(EVENT_THERMAL_SHELL);
     ASSERT_EQ(c.shellCounts.empty() ? 0u : 1u, shell.size());
     std::map<std::string, int64_t> counts;
