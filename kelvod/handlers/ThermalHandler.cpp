@@ -264,7 +264,11 @@ int32_t ThermalHandler::exitEpisode(int64_t time) {
     episode.writeInt64(mStart);
     episode.writeInt64(mEnd);
     int32_t ret = sendCustomizedMessageDelayed(MESSAGE_RECORD_EPISODE, episode, sRecordDelayMs);
-    return ret < 0 ? ret : 0;
+    if (ret < 0) {
+        return ret;
+    }
+    ++mRecordsPending;
+    return 0;
 }
 
 int32_t ThermalHandler::handleCustomized(int32_t code, const Parcel& data, Parcel* /* reply */) {
@@ -277,7 +281,15 @@ int32_t ThermalHandler::handleCustomized(int32_t code, const Parcel& data, Parce
             KLOGE("Invalid parameter");
             return -5;
         }
-        return recordEpisode(start, end);
+        int32_t ret = recordEpisode(start, end);
+        if (mRecordsPending > 0 && --mRecordsPending == 0) {
+            std::vector<int64_t> held;
+            held.swap(mHeldVotes);
+            for (int64_t hour : held) {
+                voteCandidate(hour, kCandidateDailyTick, kElector);
+            }
+        }
+        return ret;
     }
     if (code == MESSAGE_ANSWER_TIMEOUT) {
         if (mPendingDay >= 0 && data.readInt64() == mPendingDay) {
@@ -381,7 +393,8 @@ int32_t ThermalHandler::onDailyTick(const Parcel& data) {
     // Local days: a day of 23 or 25 hours is still one day.
     if (localDay(hour) <= localDay(mDayStamp)) {
         KLOGI("Ignore repeated daily tick in one day");
-        return voteCandidate(hour, kCandidateDailyTick, kElector);
+        voteDaily(hour);
+        return 0;
     }
     mDayStamp = hour;
     mCount = 0;
@@ -390,7 +403,7 @@ int32_t ThermalHandler::onDailyTick(const Parcel& data) {
                                                                       &request, sizeof(request));
     if (ret < 0) {
         KLOGE("Failed to request log, ret: %d", ret);
-        voteCandidate(hour, kCandidateDailyTick, kElector);
+        voteDaily(hour);
         return -2;
     }
     if (mPendingDay >= 0) {
@@ -403,9 +416,19 @@ int32_t ThermalHandler::onDailyTick(const Parcel& data) {
     return 0;
 }
 
+void ThermalHandler::voteDaily(int64_t hour) {
+    // The round cleans the day's raw rows after this step: an episode that
+    // ended before the tick is summed first.
+    if (mRecordsPending > 0) {
+        mHeldVotes.push_back(hour);
+        return;
+    }
+    voteCandidate(hour, kCandidateDailyTick, kElector);
+}
+
 void ThermalHandler::voteAnswered() {
     if (mPendingDay >= 0) {
-        voteCandidate(mPendingDay, kCandidateDailyTick, kElector);
+        voteDaily(mPendingDay);
         mPendingDay = -1;
     }
 }

@@ -3,6 +3,7 @@
 #include <stdint.h>
 
 #include <atomic>
+#include <vector>
 
 #include "core/KelvoOperator.h"
 #include "handlers/ThermalRecords.h"
@@ -70,6 +71,9 @@ private:
     void storeScene(int64_t dayStamp, const ThermalRecords::heat_scene& scene);
     // Casts the vote of the pending daily request, once.
     void voteAnswered();
+    // Votes for the daily tick of the hour, or holds the vote until the
+    // episodes waiting to be summed are.
+    void voteDaily(int64_t hour);
     int32_t refuse(int32_t ret);
 
     int32_t mState = 1;  // 1 normal, 0 high temperature
@@ -79,6 +83,9 @@ private:
     int64_t mDayStamp = 0;
     // Day stamp of the request whose answer is awaited; -1 when none.
     int64_t mPendingDay = -1;
+    // Episodes posted to be summed, and daily votes waiting for them.
+    int32_t mRecordsPending = 0;
+    std::vector<int64_t> mHeldVotes;
 
     static std::atomic<int64_t> sRecordDelayMs;
     static std::atomic<int64_t> sAnswerWaitMs;

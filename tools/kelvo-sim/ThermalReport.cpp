@@ -156,36 +156,15 @@ void describeEpisode(sqlite3* db, int64_t start, int64_t end, const Json::Value*
 
 std::string ThermalReport::build() const {
     std::string out = "Thermal episodes (uploaded beside the simulator's sums of the same rows)\n";
-    sqlite3* db = nullptr;
-    if (sqlite3_open_v2(mDatabasePath.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
-        sqlite3_close(db);
+    sqlite3* live = nullptr;
+    const bool readable =
+        sqlite3_open_v2(mDatabasePath.c_str(), &live, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK;
+    sqlite3_close(live);
+    if (!readable) {
         return out + "  the database cannot be read\n";
     }
-    std::vector<Json::Value> events = episodeEvents(mEventsPath);
-    sqlite3_stmt* stmt = nullptr;
-    int32_t episodes = 0;
-    if (sqlite3_prepare_v2(db,
-                           "SELECT start_time, end_time FROM raw_thermal_abnormality ORDER BY id",
-                           -1, &stmt, nullptr) == SQLITE_OK) {
-        while (sqlite3_step(stmt) == SQLITE_ROW) {
-            const int64_t start = sqlite3_column_int64(stmt, 0);
-            const int64_t end = sqlite3_column_int64(stmt, 1);
-            const Json::Value* up = nullptr;
-            for (const Json::Value& e : events) {
-                if (e["0"].asString() == dateOf(start) && e["1"].asString() == dateOf(end)) {
-                    up = &e;
-                }
-            }
-            describeEpisode(db, start, end, up, &out);
-            ++episodes;
-        }
-    }
-    sqlite3_finalize(stmt);
-    if (episodes == 0) {
-        out += "  none\n";
-    }
     // A midnight round moves the day's rows into the day's copy and cleans
-    // them from the database: count both.
+    // them from the database: read both.
     std::vector<std::string> files = {mDatabasePath};
     const std::string upload = mDatabasePath.substr(0, mDatabasePath.rfind('/') + 1) + "upload";
     if (DIR* dir = opendir(upload.c_str())) {
@@ -197,20 +176,45 @@ std::string ThermalReport::build() const {
         }
         closedir(dir);
     }
+    std::vector<Json::Value> events = episodeEvents(mEventsPath);
+    int32_t episodes = 0;
     int64_t counts[3] = {};
     for (const std::string& file : files) {
-        sqlite3* copy = nullptr;
-        if (sqlite3_open_v2(file.c_str(), &copy, SQLITE_OPEN_READONLY, nullptr) == SQLITE_OK) {
-            counts[0] += scalar(copy, "SELECT COUNT(*) FROM daily_thermal_applications");
-            counts[1] += scalar(copy, "SELECT COUNT(*) FROM daily_thermal_shell");
-            counts[2] += scalar(copy, "SELECT COUNT(*) FROM raw_thermal_heat_scene");
+        sqlite3* db = nullptr;
+        if (sqlite3_open_v2(file.c_str(), &db, SQLITE_OPEN_READONLY, nullptr) != SQLITE_OK) {
+            sqlite3_close(db);
+            continue;
         }
-        sqlite3_close(copy);
+        sqlite3_stmt* stmt = nullptr;
+        if (sqlite3_prepare_v2(db,
+                               "SELECT start_time, end_time FROM raw_thermal_abnormality ORDER BY "
+                               "id",
+                               -1, &stmt, nullptr) == SQLITE_OK) {
+            while (sqlite3_step(stmt) == SQLITE_ROW) {
+                const int64_t start = sqlite3_column_int64(stmt, 0);
+                const int64_t end = sqlite3_column_int64(stmt, 1);
+                const Json::Value* up = nullptr;
+                for (const Json::Value& e : events) {
+                    if (e["0"].asString() == dateOf(start) && e["1"].asString() == dateOf(end)) {
+                        up = &e;
+                    }
+                }
+                describeEpisode(db, start, end, up, &out);
+                ++episodes;
+            }
+        }
+        sqlite3_finalize(stmt);
+        counts[0] += scalar(db, "SELECT COUNT(*) FROM daily_thermal_applications");
+        counts[1] += scalar(db, "SELECT COUNT(*) FROM daily_thermal_shell");
+        counts[2] += scalar(db, "SELECT COUNT(*) FROM raw_thermal_heat_scene");
+        sqlite3_close(db);
+    }
+    if (episodes == 0) {
+        out += "  none\n";
     }
     out += format("  daily statistics from Pelmora: %" PRId64 " application ranges, %" PRId64
                   " shell ranges, %" PRId64 " heat scenes\n",
                   counts[0], counts[1], counts[2]);
-    sqlite3_close(db);
     return out;
 }
 

@@ -263,6 +263,19 @@ TEST_F(ThermalTest, EleventhEpisodeWaitsForTheNextDay) {
     EXPECT_EQ(2, refused());  // the eleventh enter and its exit
 }
 
+// The midnight round cleans the day's rows after the daily step: an episode
+// that ended before the tick is summed before the vote.
+TEST_F(ThermalTest, DailyVoteWaitsForTheEpisodeBeforeIt) {
+    ThermalHandler::setDelaysForTest(1000, kDelayMs);
+    trigger(kIn, kT0);
+    trigger(kOut, kT0 + kMin);
+    dailyTick(kT0 + 14 * 3600000);
+    mThermal->sendMessageSync(ParcelMessage(MESSAGE_CUSTOMIZED, -1));
+    EXPECT_TRUE(mHourly->votes().empty());
+    ASSERT_TRUE(kelvo::test::waitFor([&] { return mHourly->votes().size() == 1; }));
+    EXPECT_EQ(1u, uploads(EVENT_THERMAL_ABNORMALITY).size());
+}
+
 // Pelmora answers the daily request with the entry the case builds; the
 // rows, the uploads and the one vote of the day.
 struct AnswerCase {
