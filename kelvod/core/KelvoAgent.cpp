@@ -31,6 +31,7 @@
 #include "handlers/SystemHandler.h"
 #include "handlers/DpmHandler.h"
 #include "hidl/KelvoManager.h"
+#include "handlers/ThermalHandler.h"
 #include "routines/AbnormalityRoutine.h"
 #include "routines/HourlyRoutine.h"
 #include "routines/PollingRoutine.h"
@@ -105,6 +106,10 @@ android::sp<KelvoOperator> makeModemHandler() {
     return new ModemHandler();
 }
 
+android::sp<KelvoOperator> makeThermalHandler() {
+    return new ThermalHandler();
+}
+
 android::sp<KelvoOperator> makePollingRoutine() {
     return new PollingRoutine();
 }
@@ -138,6 +143,7 @@ struct Factories {
         handlers[HANDLER_CAMERA] = &makeCameraHandler;
         handlers[HANDLER_DPM] = &makeDpmHandler;
         handlers[HANDLER_MODEM] = &makeModemHandler;
+        handlers[HANDLER_THERMAL] = &makeThermalHandler;
     }
 
     std::mutex lock;

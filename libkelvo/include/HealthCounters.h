@@ -46,6 +46,7 @@ enum class Health : uint32_t {
     ModemRecordsRefused,     // modem records dropped (null, short) or not accounted (bad field, no idle count)
     ModemBlocksRefused,      // modem statistics blocks refused whole or ended early by a record, answers given up
     HidlEventsRefused,       // manager service events refused (type, size, memory) or not handed on
+    ThermalInputRefused,     // thermal triggers refused (repeated, too near, over the day's limit) and thermal statistics refused or cut
     Count
 };
 

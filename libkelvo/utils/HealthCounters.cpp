@@ -26,6 +26,7 @@ const char* const kHealthNames[] = {
         "modem_records_refused",
         "modem_blocks_refused",
         "hidl_events_refused",
+        "thermal_input_refused",
 };
 static_assert(sizeof(kHealthNames) / sizeof(kHealthNames[0]) ==
                       static_cast<size_t>(Health::Count),

@@ -70,6 +70,9 @@ const Refusal kRefusals[] = {
     {"call start on no network", "at 5 call start gsm", "call start lte|wcdma"},
     {"modem answer of no fault", "at 5 modem-answer malformed garbage", "modem-answer delay"},
     {"modem answer delay over ten minutes", "at 5 modem-answer delay 601", "modem-answer delay"},
+    {"thermal neither enter nor exit", "at 5 thermal hot", "thermal enter|exit"},
+    {"shell range without a count", "pelmora-shell Range0", "pelmora-shell <range>=<count>"},
+    {"scene with two temperatures", "pelmora-scene a b 38/41 a", "pelmora-scene <package>"},
 };
 
 void PrintTo(const Refusal& c, std::ostream* os) {

@@ -23,6 +23,7 @@
 #include "FakeKernelDriver.h"
 #include "PlatformServices.h"
 #include "SimReport.h"
+#include "ThermalReport.h"
 #include "WifiRecords.h"
 #include "kelvo/BufferedLogClient.h"
 #include "kelvo/KelvoManagerClient.h"
@@ -655,6 +656,9 @@ void DeviceSimulator::stopAll() {
     if (mSystem) {
         mSystem->stop();
     }
+    if (mThermal) {
+        mThermal->stop();
+    }
     if (mReporter) {
         mReporter->stop();
     }
@@ -745,6 +749,9 @@ int DeviceSimulator::finish(bool completed) {
     report.addSection(BatteryReport(SimReport::databasePath(mOptions.root),
                                     SimReport::eventsPath(mOptions.root), battery)
                           .build());
+    report.addSection(
+        ThermalReport(SimReport::databasePath(mOptions.root), SimReport::eventsPath(mOptions.root))
+            .build());
     std::string text;
     bool readable = report.build(&text);
     fputs("\n", stdout);
@@ -816,6 +823,8 @@ int DeviceSimulator::run() {
         return 1;
     }
     mSystem->startService(mOffsetMs);
+    mThermal.reset(new ThermalScene(mScenario.pelmora()));
+    mThermal->start();
     // The steps count from here, once the daemon is up.
     mStartMs = simulatedNowMs();
     mNextHourMs = (mStartMs / kHourMs + 1) * kHourMs - mStartMs;

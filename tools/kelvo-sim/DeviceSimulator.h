@@ -21,6 +21,7 @@
 #include "RadioSensorTruth.h"
 #include "Scenario.h"
 #include "SystemScene.h"
+#include "ThermalScene.h"
 #include "TrafficModel.h"
 
 namespace kelvo {
@@ -137,6 +138,7 @@ private:
     std::unique_ptr<fake::FakeDriverReporter> mReporter;
     std::unique_ptr<LogWriter> mLogWriter;
     std::unique_ptr<SystemScene> mSystem;
+    std::unique_ptr<ThermalScene> mThermal;  // "Pelmora"
     int32_t mLogWritten = 0;
     int32_t mLogUnread = 0;
     DaemonProcess mDaemon;

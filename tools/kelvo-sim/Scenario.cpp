@@ -292,6 +292,9 @@ bool Scenario::parseLine(const std::vector<std::string>& words, std::string* rea
         }
         return true;
     }
+    if (int pelmora = ThermalScene::parseLine(words, &mPelmora, reason)) {
+        return pelmora > 0;
+    }
     *reason = "unknown verb \"" + verb + "\"";
     return false;
 }
@@ -369,6 +372,11 @@ bool Scenario::parseTimed(int64_t atMs, const std::vector<std::string>& words, s
         }
     } else if (int system = SystemScene::parseStep(words, &step.text, reason)) {
         if (system < 0) {
+            return false;
+        }
+        step.action = Action::System;
+    } else if (int thermal = ThermalScene::parseStep(words, &step.text, reason)) {
+        if (thermal < 0) {
             return false;
         }
         step.action = Action::System;

@@ -7,6 +7,7 @@
 #include <vector>
 
 #include "BatteryModel.h"
+#include "ThermalScene.h"
 
 namespace kelvo {
 namespace sim {
@@ -95,6 +96,8 @@ public:
     // The audio data-source policy of the root's own configuration (1 the
     // shipped one; 2 the smart amplifier's measured energy).
     int32_t audioPolicy() const { return mAudioPolicy; }
+    // What the power-management application answers each day.
+    const ThermalScene::Content& pelmora() const { return mPelmora; }
     // In time order (lines of equal time keep their order).
     const std::vector<Step>& steps() const { return mSteps; }
 
@@ -123,6 +126,7 @@ private:
     std::vector<Step> mSteps;
     BatteryModel::Config mBattery;
     int32_t mAudioPolicy = 1;
+    ThermalScene::Content mPelmora;
 };
 
 }  // namespace sim
