@@ -15,6 +15,7 @@
 #include "common/TestEnv.h"
 #include "core/KelvoAgent.h"
 #include "core/Notifier.h"
+#include "handlers/DpmHandler.h"
 #include "handlers/SystemHandler.h"
 #include "handlers/ThermalHandler.h"
 #include "handlers/components/AudioHandler.h"
@@ -26,6 +27,7 @@
 #include "handlers/components/FlashlightHandler.h"
 #include "handlers/components/GnssHandler.h"
 #include "handlers/components/GpuHandler.h"
+#include "handlers/components/ModemHandler.h"
 #include "handlers/components/SensorHandler.h"
 #include "handlers/components/WifiHandler.h"
 
@@ -129,7 +131,8 @@ INSTANTIATE_TEST_SUITE_P(
                       make<SensorHandler>("Sensor"), make<WifiHandler>("Wifi"),
                       make<BatteryHandler>("Battery"), make<AudioHandler>("Audio"),
                       make<GpuHandler>("Gpu"), make<BluetoothHandler>("Bluetooth"),
-                      make<ThermalHandler>("Thermal")),
+                      make<ThermalHandler>("Thermal"), make<ModemHandler>("Modem"),
+                      make<DpmHandler>("Dpm")),
     [](const ::testing::TestParamInfo<OperatorCase>& info) { return info.param.name; });
 
 }  // namespace

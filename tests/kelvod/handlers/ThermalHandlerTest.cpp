@@ -347,10 +347,13 @@ TEST_P(AnswerTest, StoresWhatFitsAndVotesOnce) {
                                                     {"26", 120}, {"28", 121}, {"30", 123},
                                                     {"31", 40},  {"32", 39}};
     for (const auto& [param, value] : kPlaces) {
-        if (!scenes.empty()) EXPECT_EQ(value, scenes[0][param].asInt64()) << param;
+        if (!scenes.empty()) {
+            EXPECT_EQ(value, scenes[0][param].asInt64()) << param;
+        }
     }
-    if (!scenes.empty())
+    if (!scenes.empty()) {
         EXPECT_EQ("com.video", scenes[0]["27"]["params"]["11"]["params"]["0"].asString());
+    }
     std::vector<Json::Value> shell = uploads(EVENT_THERMAL_SHELL);
     ASSERT_EQ(c.shellCounts.empty() ? 0u : 1u, shell.size());
     std::map<std::string, int64_t> counts;
