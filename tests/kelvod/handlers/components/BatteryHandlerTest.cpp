@@ -32,7 +32,6 @@ constexpr int64_t kHour = 3600000;
 constexpr int64_t kMidnight = 1796515200000LL;  // 2026-12-06 00:00 UTC
 constexpr int64_t kH = kMidnight + 10 * kHour;
 constexpr int64_t kT = kH - 4 * 60000;
-const char kUpper[] = "/sys/class/power_supply/Battery/";
 
 // Stands in for the hourly routine or the system handler: "code:values"
 // of each vote (code 0: the candidate), compensation (3: elector=energy) and
