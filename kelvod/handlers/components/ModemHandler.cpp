@@ -223,8 +223,7 @@ ModemHandler::ModemHandler(TrafficCollector::PackageLookup packages,
       mHourlyPending(false),
       mPendingTimeout(-1),
       mLastPollingMonotonic(-1),
-      mChargerOnline(false),
-      mForeground("com.tovaro.android.launcher") {
+      mChargerOnline(false) {
     mTraffic = std::make_unique<TrafficCollector>(
         kModemTrafficConfig, [this](const Parcel& action) { return feedAccounter(action); },
         std::move(packages), std::move(processes));
@@ -624,7 +623,7 @@ int32_t ModemHandler::storePamItems(const ModemBlock::Record& record, int64_t bl
 
 void ModemHandler::collectTraffic(int64_t time) {
     mTraffic->collectInterfaces(time);
-    mTraffic->collectSystem(time, mForeground.c_str());
+    mTraffic->collectSystem(time, mTraffic->foreground());
     mTraffic->collectPackages(time);
 }
 
@@ -656,9 +655,7 @@ int32_t ModemHandler::onForegroundChanged(const Parcel& data) {
     if (data.readInt64(&time) != NO_ERROR || data.readString8(&package) != NO_ERROR) {
         return -5;
     }
-    // The process increments so far belong to the old foreground.
-    mTraffic->collectSystem(time, mForeground.c_str());
-    mForeground = package;
+    mTraffic->changeForeground(time, package.c_str());
     return 0;
 }
 
@@ -1048,7 +1045,7 @@ void ModemHandler::dump(String8& out) {
                      mHourlyPending ? 1 : 0);
     out.appendFormat("outstanding requests=%zu, decoders=%zu, charger=%d, foreground=%s\n",
                      mOutstanding.size(), mDecoders.size(), mChargerOnline ? 1 : 0,
-                     mForeground.c_str());
+                     mTraffic->foreground().c_str());
     out.append("======ModemHandler END======\n");
     KelvoOperator::dump(out);
 }

@@ -134,7 +134,6 @@ private:
     // Monotonic time of the last request, -1 before the first.
     int64_t mLastPollingMonotonic;
     bool mChargerOnline;
-    android::String8 mForeground;
     ModemBlock mBlock;
 
     static std::atomic<int64_t> sHourlyTimeoutMs;

@@ -248,6 +248,11 @@ int32_t TrafficCollector::collectPackages(int64_t time) {
     return ret;
 }
 
+void TrafficCollector::changeForeground(int64_t time, const std::string& package) {
+    collectSystem(time, mForeground);
+    mForeground = package;
+}
+
 void TrafficCollector::removeUid(int32_t uid) {
     mReader.removeUid(uid);
     mMissingNameHour.erase(uid);

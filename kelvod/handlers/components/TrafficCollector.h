@@ -126,6 +126,11 @@ public:
     // collected before is still sent).
     int32_t collectPackages(int64_t time);
     void removeUid(int32_t uid);
+    // The application in front (the launcher until the first change).
+    const std::string& foreground() const { return mForeground; }
+    // Books the process increments so far to the old foreground, then
+    // takes the new one.
+    void changeForeground(int64_t time, const std::string& package);
 
     TrafficReader& reader() { return mReader; }
     const traffic_collector_config& config() const { return mConfig; }
@@ -154,6 +159,7 @@ private:
     SystemMap mSystem[2];
     std::map<int32_t, int64_t> mMissingNameHour;
     uint64_t mPackageLookups = 0;
+    std::string mForeground = "com.tovaro.android.launcher";
 };
 
 }  // namespace kelvo

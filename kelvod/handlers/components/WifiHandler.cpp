@@ -147,7 +147,6 @@ WifiHandler::WifiHandler(TrafficCollector::PackageLookup packages,
       mActivityStart(0),
       mSignalLevel(4),
       mDistribution{},
-      mForeground("com.tovaro.android.launcher"),
       mScreenOn(true),
       mNameLogHour(-1) {
     // The collector lives inside the handler and runs on its thread.
@@ -319,7 +318,7 @@ int32_t WifiHandler::onScanStarted(int64_t time, const char* text) {
         }
         it = mScanData.emplace(uid, scan_data{name, 0, 0}).first;
     }
-    const bool foreground = name == mForeground;
+    const bool foreground = name == mTraffic->foreground().c_str();
     uint32_t& count = foreground ? it->second.foreground : it->second.background;
     if (count < UINT32_MAX) {
         ++count;
@@ -408,7 +407,7 @@ void WifiHandler::changeActivity(int64_t time, bool active) {
 void WifiHandler::pollAll(int64_t time) {
     mTraffic->collectInterfaces(time);
     collectActivity(time);
-    mTraffic->collectSystem(time, mForeground.c_str());
+    mTraffic->collectSystem(time, mTraffic->foreground());
     mTraffic->collectPackages(time);
     collectScans(time);
 }
@@ -560,9 +559,7 @@ int32_t WifiHandler::onForegroundChanged(const Parcel& data) {
     if (data.readInt64(&time) != NO_ERROR || data.readString8(&package) != NO_ERROR) {
         return -5;
     }
-    // The increments so far belong to the old foreground.
-    mTraffic->collectSystem(time, mForeground.c_str());
-    mForeground = package;
+    mTraffic->changeForeground(time, package.c_str());
     return 0;
 }
 

@@ -100,7 +100,6 @@ private:
     int64_t mActivityStart;  // monotonic ms
     int32_t mSignalLevel;
     int64_t mDistribution[kSignalLevels];
-    android::String8 mForeground;
     bool mScreenOn;
     // Uids whose missing name was logged as an error in mNameLogHour.
     std::set<int32_t> mNameLogged;
