@@ -6,7 +6,7 @@
 #include <time.h>
 
 #include "FakeKernelDriver.h"
-#include "kelvo/BufferedLogClient.h"
+#include "BufferedLogResponder.h"
 #include "kelvo/LogWriter.h"
 
 namespace kelvo {
@@ -14,8 +14,6 @@ namespace sim {
 
 namespace {
 
-constexpr int kReceiveWaitMs = 200;
-constexpr int64_t kReconnectMs = 500;
 
 bool parseNumber(const std::string& text, long long low, long long high, long long* out) {
     if (text.empty()) {
@@ -59,11 +57,6 @@ int64_t realtimeMs() {
     struct timespec ts;
     clock_gettime(CLOCK_REALTIME, &ts);
     return ts.tv_sec * 1000LL + ts.tv_nsec / 1000000;
-}
-
-void sleepMs(int64_t ms) {
-    struct timespec ts = {static_cast<time_t>(ms / 1000), static_cast<long>(ms % 1000) * 1000000};
-    nanosleep(&ts, nullptr);
 }
 
 }  // namespace
@@ -231,45 +224,24 @@ void SystemScene::stop() {
 }
 
 void SystemScene::serve() {
-    BufferedLogClient client;
-    bool connected = false;
-    while (!mStop) {
-        if (!connected) {
-            connected = client.connect(kServiceName) == 0;
-            if (!connected) {
-                sleepMs(kReconnectMs);
-                continue;
-            }
-        }
-        int32_t magic = 0;
-        std::string data;
-        if (client.receive(&magic, &data, kReceiveWaitMs) != 0) {
-            if (errno != ETIMEDOUT) {
-                client.close();
-                connected = false;
-            }
-            continue;
-        }
-        std::string body;
-        switch (magic) {
-            case REQUEST_DAILY_STATISTICS:
-                body = dailyStatistics(realtimeMs() + mClockOffsetMs);
-                break;
-            case REQUEST_MOBILE_PHONE:
-                body = mobilePhone();
-                break;
-            case REQUEST_PACKAGE_VERSIONS:
-                body = packageVersions(mScenario.apps());
-                break;
-            default:
-                continue;
-        }
-        if (client.send(magic, body) != 0) {
-            client.close();
-            connected = false;
-        }
-    }
-    client.close();
+    BufferedLogResponder::serve(
+            kServiceName, mStop,
+            [this](int32_t magic, const std::string& /*data*/, int32_t* /*replyMagic*/,
+                   std::string* reply) {
+                switch (magic) {
+                    case REQUEST_DAILY_STATISTICS:
+                        *reply = dailyStatistics(realtimeMs() + mClockOffsetMs);
+                        return true;
+                    case REQUEST_MOBILE_PHONE:
+                        *reply = mobilePhone();
+                        return true;
+                    case REQUEST_PACKAGE_VERSIONS:
+                        *reply = packageVersions(mScenario.apps());
+                        return true;
+                    default:
+                        return false;
+                }
+            });
 }
 
 }  // namespace sim

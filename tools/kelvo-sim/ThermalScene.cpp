@@ -9,15 +9,13 @@
 
 #include <sstream>
 
-#include "kelvo/BufferedLogClient.h"
+#include "BufferedLogResponder.h"
 
 namespace kelvo {
 namespace sim {
 
 namespace {
 
-constexpr int kReceiveWaitMs = 200;
-constexpr int64_t kReconnectMs = 500;
 constexpr int64_t kHourMs = 3600000;
 constexpr size_t kMaxItems = 64;
 
@@ -88,11 +86,6 @@ void writeRanges(android::Parcel& out, const ThermalScene::Ranges& ranges) {
     }
     out.writeInt32(static_cast<int32_t>(pairs.dataSize()));
     out.write(pairs.data(), pairs.dataSize());
-}
-
-void sleepMs(int64_t ms) {
-    struct timespec ts = {static_cast<time_t>(ms / 1000), static_cast<long>(ms % 1000) * 1000000};
-    nanosleep(&ts, nullptr);
 }
 
 }  // namespace
@@ -231,38 +224,20 @@ void ThermalScene::stop() {
 }
 
 void ThermalScene::serve() {
-    BufferedLogClient client;
-    bool connected = false;
-    while (!mStop) {
-        if (!connected) {
-            connected = client.connect(kClientName) == 0;
-            if (!connected) {
-                sleepMs(kReconnectMs);
-                continue;
-            }
-        }
-        int32_t magic = 0;
-        std::string data;
-        if (client.receive(&magic, &data, kReceiveWaitMs) != 0) {
-            if (errno != ETIMEDOUT) {
-                client.close();
-                connected = false;
-            }
-            continue;
-        }
-        int64_t day = 0;
-        if (magic != kMagic || data.size() != sizeof(day)) {
-            continue;
-        }
-        memcpy(&day, data.data(), sizeof(day));
-        if (client.send(kMagic, answer(mContent, day)) != 0) {
-            client.close();
-            connected = false;
-            continue;
-        }
-        ++mAnswered;
-    }
-    client.close();
+    BufferedLogResponder::serve(
+            kClientName, mStop,
+            [this](int32_t magic, const std::string& data, int32_t* replyMagic,
+                   std::string* reply) {
+                int64_t day = 0;
+                if (magic != kMagic || data.size() != sizeof(day)) {
+                    return false;
+                }
+                memcpy(&day, data.data(), sizeof(day));
+                *replyMagic = kMagic;
+                *reply = answer(mContent, day);
+                return true;
+            },
+            [this] { ++mAnswered; });
 }
 
 }  // namespace sim
